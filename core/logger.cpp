@@ -1,0 +1,155 @@
+#include "s2s_logger.h"
+
+#include <syslog.h>
+
+#include <cstdarg>
+#include <cstdio>
+#include <ctime>
+
+namespace S2S {
+
+int Logger::log_level = 3;
+int Logger::log_size = -1;
+int Logger::rotate_cnt = 50;
+int Logger::log_type = Logger::Syslog;
+FILE* Logger::log_fp = nullptr;
+std::string Logger::log_path;
+pthread_mutex_t Logger::log_mutex = PTHREAD_MUTEX_INITIALIZER;
+
+namespace {
+
+constexpr int kRotateSize = 1048576;
+
+std::string RotatedName(int index) {
+    char name[1024];
+    std::snprintf(name, sizeof(name), "%s_%d", Logger::log_path.c_str(), index);
+    return name;
+}
+
+}  // namespace
+
+int Logger::Initialize(Type type, int level, const std::string& path, int count) {
+    log_type = type;
+    log_level = level;
+    switch (type) {
+        case Syslog:
+            log_fp = nullptr;
+            log_path.clear();
+            log_size = -1;
+            return 0;
+        case Stdout:
+            log_fp = stdout;
+            log_path.clear();
+            log_size = -1;
+            return 0;
+        case Stderr:
+            log_fp = stderr;
+            log_path.clear();
+            log_size = -1;
+            return 0;
+        default:
+            break;
+    }
+    if (path.empty()) {
+        return -1;
+    }
+    FILE* fp = std::fopen(path.c_str(), "a");
+    if (fp == nullptr) {
+        return -1;
+    }
+    // Any other kind is the file kind. The size already in the file is not counted, on purpose.
+    log_type = File;
+    log_fp = fp;
+    log_size = 0;
+    log_path = path;
+    rotate_cnt = count;
+    return 0;
+}
+
+void Logger::LogMsg(Level level, const char* format, ...) {
+    if (log_type != Syslog && log_fp == nullptr) {
+        return;
+    }
+    // log_level only changes in Initialize/Destroy, which never run while another thread logs, so
+    // a filtered message can be dropped before the lock: the answer under the lock is the same.
+    if (level > log_level) {
+        return;
+    }
+    pthread_mutex_lock(&log_mutex);
+    if (level > log_level) {
+        pthread_mutex_unlock(&log_mutex);
+        return;
+    }
+    int written = -1;
+    va_list args;
+    va_start(args, format);
+    if (log_type == Syslog) {
+        // The level filters; it does not set the priority: every line goes out as an error, and
+        // the process's own openlog settings (identity, facility) apply.
+        vsyslog(LOG_ERR, format, args);
+    } else if (log_type < Syslog || log_type > File) {
+        std::vfprintf(stderr, format, args);
+    } else if (log_fp != nullptr) {
+        char stamp[512];
+        time_t now = std::time(nullptr);
+        struct tm local;
+        localtime_r(&now, &local);
+        std::strftime(stamp, sizeof(stamp), "%b %d %H:%M:%S ", &local);
+        int head = std::fprintf(log_fp, "%s", stamp);
+        int body = std::vfprintf(log_fp, format, args);
+        std::fflush(log_fp);
+        written = head + body;
+        if (head < 0 || body < 0) {
+            written = -1;
+        }
+    }
+    va_end(args);
+    if (log_type == File && log_size >= 0 && written >= 0) {
+        log_size += written;
+        if (log_size > kRotateSize) {
+            Rotate();
+            log_size = 0;
+        }
+    }
+    pthread_mutex_unlock(&log_mutex);
+}
+
+int Logger::Rotate() {
+    for (int i = rotate_cnt - 2; i >= 0; --i) {
+        std::rename(RotatedName(i).c_str(), RotatedName(i + 1).c_str());
+    }
+    // After the renames, on purpose: the file just moved to the last index goes, so at most
+    // rotate_cnt - 1 rotated files survive.
+    std::remove(RotatedName(rotate_cnt - 1).c_str());
+    if (log_fp != nullptr) {
+        std::fclose(log_fp);
+        log_fp = nullptr;
+    }
+    if (std::rename(log_path.c_str(), RotatedName(0).c_str()) != 0) {
+        return -1;
+    }
+    FILE* fp = std::fopen(log_path.c_str(), "a");
+    if (fp == nullptr) {
+        return -1;
+    }
+    log_fp = fp;
+    return 0;
+}
+
+void Logger::Destroy() {
+    if (log_type != File) {
+        return;
+    }
+    if (log_fp != nullptr) {
+        std::fclose(log_fp);
+    }
+    // The kind says standard error while the stream is standard output; both are written alike.
+    log_fp = stdout;
+    log_level = 3;
+    log_type = Stderr;
+    log_size = -1;
+    log_path.clear();
+    rotate_cnt = 50;
+}
+
+}  // namespace S2S

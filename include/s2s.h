@@ -1,0 +1,11 @@
+// The sync library's core interface: values, logging, status codes, and the host services
+// (locks, temporary files, daemon control, share/volume/host queries).
+#ifndef S2S_H
+#define S2S_H
+
+#include "s2s_export.h"
+#include "s2s_logger.h"
+#include "s2s_pobject.h"
+#include "s2s_status.h"
+
+#endif  // S2S_H

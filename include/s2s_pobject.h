@@ -1,0 +1,133 @@
+// PObject: the one dynamic value of the library. Every message that crosses a process boundary is
+// a tree of these: null, unsigned 64-bit integer, byte string, array, or map with byte-ordered
+// string keys. Deep-copy value semantics; not thread-safe (one object, one thread at a time).
+#ifndef S2S_POBJECT_H
+#define S2S_POBJECT_H
+
+#include <map>
+#include <string>
+#include <vector>
+
+#include "s2s_export.h"
+
+namespace S2S {
+
+class S2S_EXPORT PObject {
+  public:
+    typedef std::vector<PObject> Array;
+    // std::string orders its bytes as unsigned chars, a prefix first: the key order of the format.
+    typedef std::map<std::string, PObject> Map;
+
+    enum { kNull = 0, kArray = 1, kMap = 2, kInteger = 3, kString = 4 };
+
+    // Type code of a storage type: Array 1, Map 2, unsigned long long 3, std::string 4.
+    template <typename T>
+    static int type_trait();
+
+    PObject() = default;
+    PObject(unsigned long long value);
+    PObject(const std::string& value);
+    PObject(const char* value);
+    PObject(const PObject& other);
+    // Moves hand the payload over without copying (containers of PObject grow without deep copies).
+    PObject(PObject&& other) noexcept { swap(other); }
+    ~PObject();
+
+    PObject& operator=(unsigned long long value);
+    PObject& operator=(unsigned int value);
+    PObject& operator=(bool value);
+    PObject& operator=(int value);  // sign-extended: -1 is 18446744073709551615
+    PObject& operator=(const std::string& value);
+    PObject& operator=(const char* value);
+    PObject& operator=(const Array& value);
+    PObject& operator=(const Map& value);
+    // Deep copy through copy(): clears first, so assigning an object to itself leaves it null.
+    PObject& operator=(const PObject& other);
+    PObject& operator=(PObject&& other) noexcept;
+
+    bool isNull() const { return payload_ == nullptr; }
+    bool isArray() const { return type_ == kArray; }
+    bool isMap() const { return type_ == kMap; }
+    bool isInteger() const { return type_ == kInteger; }
+    bool isString() const { return type_ == kString; }
+    bool isContainer() const { return isArray() || isMap(); }
+    bool isPrimitive() const { return isString() || isInteger(); }
+    bool isEmpty() const;
+
+    unsigned long long asUInt64() const;
+    long long asInteger() const { return static_cast<long long>(asUInt64()); }
+    long long asInt64() const { return static_cast<long long>(asUInt64()); }
+    unsigned int asUInt32() const { return static_cast<unsigned int>(asUInt64()); }
+    unsigned short asUInt16() const { return static_cast<unsigned short>(asUInt64()); }
+    unsigned char asUInt8() const { return static_cast<unsigned char>(asUInt64()); }
+    int asInt32() const { return static_cast<int>(asUInt64()); }
+    short asInt16() const { return static_cast<short>(asUInt64()); }
+    signed char asInt8() const { return static_cast<signed char>(asUInt64()); }
+    bool asBool() const;
+    // An integer reads as the "%u" text of its low 32 bits, on purpose.
+    std::string asString() const;
+    const Array& asArray() const;
+    const Map& asMap() const;
+
+    // Mutable access turns the object into the wanted container first, discarding what it held.
+    Array& asArray();
+    Map& asMap();
+    PObject& operator[](const std::string& key);
+    // Never reaches array elements and never inserts: throws std::out_of_range
+    // ("out_of_range: PObject::operator[]") for arrays, non-containers and missing map positions.
+    PObject& operator[](unsigned int index);
+    const PObject& operator[](const std::string& key) const;
+    const PObject& operator[](unsigned int index) const;
+    bool hasMember(const std::string& key) const;
+
+    void clear();
+    void copy(const PObject& other);
+    // Typed assignment: the new payload is built before the old one is freed, so a value taken
+    // from inside this object may be assigned to it.
+    template <typename T>
+    void copy(const T& value);
+    void swap(PObject& other) noexcept;
+    std::string toString() const;
+
+    static const Map& GetEmptyMap();
+    static const Array& GetEmptyArray();
+    static const PObject& GetEmptyObject();
+
+  private:
+    const PObject* MapEntryAt(unsigned int index) const;
+    void Print(std::string& out) const;
+    void TakeChildren(std::vector<PObject>& pending);
+
+    int type_ = kNull;
+    void* payload_ = nullptr;  // owned; holds the storage type of type_, null exactly when null
+};
+
+template <>
+inline int PObject::type_trait<PObject::Array>() {
+    return kArray;
+}
+template <>
+inline int PObject::type_trait<PObject::Map>() {
+    return kMap;
+}
+template <>
+inline int PObject::type_trait<unsigned long long>() {
+    return kInteger;
+}
+template <>
+inline int PObject::type_trait<std::string>() {
+    return kString;
+}
+
+template <typename T>
+void PObject::copy(const T& value) {
+    // The payload is a separately allocated storage object: swap() then exchanges two words.
+    T* fresh = new T(value);
+    clear();
+    payload_ = fresh;
+    type_ = type_trait<T>();
+}
+
+}  // namespace S2S
+
+#endif  // S2S_POBJECT_H
