@@ -1,0 +1,191 @@
+// Channel: the byte transport of the library. A stream socket (TCP over IPv4 or a local domain
+// socket) held in non-blocking mode, with a read ring and a write ring of one fixed capacity,
+// every wait bounded by select(), an inactivity timeout and an external abort flag. An open
+// channel can be turned into a TLS channel in place: the set of I/O operations is exchanged
+// (SwitchChannelOp) and all buffering, timeouts and status codes stay as they are.
+//
+// Every operation returns a status of s2s_status.h: 0 or a negative code (-1 abort flag, -2 I/O
+// failure / closed / peer gone, -3 system call failure, -4 invalid argument, -9 timeout).
+//
+// A channel is used by one thread at a time. The abort flag is the only cross-thread input: any
+// thread (or a signal handler) may set the int it points to; each wait checks it before every
+// select, so an abort takes effect within one wait interval.
+#ifndef S2S_CHANNEL_H
+#define S2S_CHANNEL_H
+
+#include <sys/select.h>
+#include <sys/time.h>
+
+#include <memory>
+#include <string>
+
+#include "s2s_export.h"
+
+// The TLS layer works on OpenSSL's session and context objects; the header only needs their
+// names (these are the library's own typedefs, repeated identically).
+typedef struct ssl_st SSL;
+typedef struct ssl_ctx_st SSL_CTX;
+
+namespace S2S {
+
+class S2S_EXPORT Channel {
+  public:
+    // The operation set: the handle is an int* holding the descriptor for a plain channel and the
+    // SSL* session for a TLS one. Reads and writes return the byte count or a negative status.
+    typedef int (*ReadOp)(void* handle, void* buf, unsigned int len, const timeval& wait,
+                          int* flag);
+    typedef int (*WriteOp)(void* handle, const void* buf, unsigned int len, const timeval& wait,
+                           int* flag);
+    typedef int (*GetFdOp)(const void* handle);
+    typedef void (*CloseOp)(void* handle);
+    typedef bool (*IsClosedOp)(const void* handle);
+
+    // Mode values of SwitchChannelOp: 1 installs the plain set, any other value the TLS set.
+    enum { kPlainOps = 1, kSSLOps = 0 };
+
+    // Allocates both rings of `capacity` bytes; `capacity` is also the largest single Write.
+    explicit Channel(unsigned int capacity);
+    Channel(const Channel&) = delete;
+    Channel& operator=(const Channel&) = delete;
+
+    // Closes (flushing what is buffered first, non-virtually) and frees both rings.
+    virtual ~Channel();
+
+    // Connects to a local domain stream socket, blocking during the connect.
+    virtual int Open(const char* path);
+    // Adopts a connected socket (the accepting side). With `configure`: linger 1 s and
+    // non-blocking. The descriptor is not closed on failure: the caller still owns it then.
+    virtual int Open(int fd, bool configure);
+    // TCP client to a dotted IPv4 address. A null `ip` or a negative `port` returns 0 at once
+    // without opening anything: callers rely on that silent success.
+    virtual int Open(const char* ip, int port);
+    // Flushes, closes the handle and returns to the closed, plain state. Harmless when closed.
+    virtual void Close();
+    virtual void SetTimeout(unsigned int seconds);
+    // REQUIRES: *flag outlives every use of the channel; null means no abort flag.
+    virtual void SetFlag(int* flag);
+    // Part of the TLS layer (net/channel_tls.cpp): 0, -2 (setup, binding, handshake) or -24
+    // (peer not verified while untrusted peers are refused). The channel must be open.
+    virtual int ConvertToSSLChannel(bool server);
+
+    // Integers travel most significant byte first whatever the host's byte order. On a failure
+    // the output is left untouched.
+    virtual int ReadByte(unsigned char* value);
+    virtual int ReadInt16(unsigned short* value);
+    virtual int ReadInt32(unsigned int* value);
+    virtual int ReadInt64(unsigned long long* value);
+    virtual int WriteByte(unsigned char value);
+    virtual int WriteInt16(unsigned short value);
+    virtual int WriteInt32(unsigned int value);
+    virtual int WriteInt64(unsigned long long value);
+
+    // Delivers exactly `len` bytes or fails.
+    virtual int Read(char* dst, unsigned int len);
+    // As above; `count` is the number of bytes delivered. After a failure the partial bytes are
+    // in `dst` and also remain in the read buffer.
+    virtual int Read(char* dst, unsigned int len, unsigned int& count);
+    // Buffers `len` bytes (at most `capacity`), flushing only when the ring would overflow.
+    virtual int Write(const char* src, unsigned int len);
+    virtual void ClearRead();
+    virtual void ClearWrite();
+    // Sends at least `want` buffered bytes (0: everything buffered now).
+    virtual int FlushWrite(int want);
+    // Dotted IPv4 address and port of the peer; 0 with an empty address on a closed channel.
+    virtual int GetPeerInfo(std::string& ip, int& port) const;
+    virtual bool IsClosed() const;
+    // Receives until at least `want` more bytes are buffered.
+    // REQUIRES: the read buffer is not full (callers call it on an empty buffer).
+    virtual int ReadMore(int want);
+
+    // Byte order reversal, independent of the host's byte order.
+    virtual unsigned long long Convert(unsigned long long value);
+    virtual unsigned int Convert(unsigned int value);
+    virtual unsigned short Convert(unsigned short value);
+
+    virtual int CreateSock();
+    virtual int SetLinger(int fd, int seconds);
+    virtual int SetNonBlock(int fd);
+    virtual int ConnectWithTimeout(int fd, const char* ip, int port);
+    // Installs the plain (mode 1) or the TLS (any other mode) operation set. Touches neither the
+    // handle nor the buffers: the caller replaces the handle at the same time.
+    virtual void SwitchChannelOp(int mode);
+
+    void SetAllowUntrust(bool allow) { allow_untrust_ = allow; }
+    bool IsAllowingUntrust() const { return allow_untrust_; }
+    void SetSSLHostname(const std::string& name) { ssl_hostname_ = name; }
+
+    // One bounded wait and at most one recv/send on the descriptor held by `handle`.
+    static int ReadFd(int* handle, void* buf, unsigned int len, const timeval& wait, int* flag);
+    static int WriteFd(int* handle, const void* buf, unsigned int len, const timeval& wait,
+                       int* flag);
+
+    // --- TLS layer (net/channel_tls.cpp) ---
+    static int SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wait, int* flag);
+    static int SSLWriteFd(SSL* ssl, const void* buf, unsigned int len, const timeval& wait,
+                          int* flag);
+    // Ignores any abort flag on purpose: `flag` is accepted for symmetry and callers pass null.
+    static int SSLHandshake(SSL* ssl, timeval wait, unsigned int timeout, int* flag);
+    // The close and closed-test operations of the TLS set.
+    static void SSLClose(SSL* ssl);
+    static bool SSLIsClosed(const SSL* ssl);
+    static int InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted);
+    static void DeinitSSL(SSL*& ssl, SSL_CTX*& ctx, bool quiet);
+    static int InstallVerifyCA(SSL_CTX* ctx);
+    static int InstallPriKey(SSL_CTX* ctx);
+    static int InstallCERT(SSL_CTX* ctx);
+    // Process-wide file paths, read at each conversion; setters are meant for start-up.
+    static const std::string& GetCAPath();
+    static const std::string& GetKeyPath();
+    static const std::string& GetCertPath();
+    static void SetVerifyCAPath(const std::string& path);
+    static void SetPriKeyPath(std::string path);
+    static void SetCERTPath(std::string path);
+    // Drains OpenSSL's error queue into the log.
+    static void log_ssl();
+
+  protected:
+    // One bounded wait on `fd`: each given set is reset to hold only `fd` before every select.
+    // 0 when select reported the descriptor (the caller inspects the sets), -9 when one wait
+    // interval passed quietly, -3 on a select failure, -1 once *flag is non-zero.
+    static int WaitFd(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_set,
+                      const timeval& wait, int* flag);
+
+    // The operation set of the plain channel.
+    static int PlainGetFd(const int* handle);
+    static void PlainClose(int* handle);
+    static bool PlainIsClosed(const int* handle);
+
+    // The descriptor behind the handle (get-descriptor op); -1 when closed.
+    int GetFd() const { return get_fd_op_(handle_); }
+
+    // Null when closed. A plain handle is an int allocated by the channel (Open), released by
+    // PlainClose or, when the session takes the descriptor over, by ConvertToSSLChannel.
+    void* handle_ = nullptr;
+    ReadOp read_op_ = nullptr;
+    WriteOp write_op_ = nullptr;
+    GetFdOp get_fd_op_ = nullptr;
+    CloseOp close_op_ = nullptr;
+    IsClosedOp is_closed_op_ = nullptr;
+
+    // Ring of bytes written but not yet sent: w_head_ is the oldest unsent byte.
+    std::unique_ptr<char[]> w_buf_;
+    unsigned int w_head_ = 0;
+    unsigned int w_size_ = 0;
+    // Ring of received bytes not yet consumed. r_head_ may equal capacity_ right after a read
+    // that ended exactly at the buffer end; it then behaves as 0.
+    std::unique_ptr<char[]> r_buf_;
+    unsigned int r_head_ = 0;
+    unsigned int r_size_ = 0;
+    unsigned int capacity_;
+
+    timeval wait_ = {1, 0};
+    unsigned int timeout_ = 60;  // seconds of inactivity; 0 waits forever
+    int* flag_ = nullptr;
+    bool is_ssl_ = false;
+    bool allow_untrust_ = true;
+    std::string ssl_hostname_;
+};
+
+}  // namespace S2S
+
+#endif  // S2S_CHANNEL_H
