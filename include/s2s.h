@@ -4,6 +4,7 @@
 #define S2S_H
 
 #include "s2s_export.h"
+#include "s2s_host.h"
 #include "s2s_logger.h"
 #include "s2s_pobject.h"
 #include "s2s_status.h"
