@@ -113,6 +113,8 @@ class S2S_EXPORT Channel {
     void SetAllowUntrust(bool allow) { allow_untrust_ = allow; }
     bool IsAllowingUntrust() const { return allow_untrust_; }
     void SetSSLHostname(const std::string& name) { ssl_hostname_ = name; }
+    // The ring size: the largest single Write. Writers of longer data split it.
+    unsigned int GetCapacity() const { return capacity_; }
 
     // One bounded wait and at most one recv/send on the descriptor held by `handle`.
     static int ReadFd(int* handle, void* buf, unsigned int len, const timeval& wait, int* flag);
