@@ -1,0 +1,50 @@
+#!/usr/bin/env bash
+# check_install.sh BUILD_DIR THIS_DIR: install, then compile and run outside programs.
+set -euo pipefail
+build=$1
+here=$2
+scratch=$(mktemp -d "${TMPDIR:-/tmp}/s2s-install.XXXXXX")
+trap 'rm -rf "$scratch"' EXIT
+prefix=$scratch/prefix
+cmake --install "$build" --prefix "$prefix" >/dev/null
+libdir=$(dirname "$(find "$prefix" -name 's2s.pc' | head -n 1)")/..
+export PKG_CONFIG_PATH=$libdir/pkgconfig
+export LD_LIBRARY_PATH=$libdir
+
+# Every public header compiles on its own; the C headers also compile as C.
+for header in "$prefix"/include/*.h; do
+  name=$(basename "$header")
+  printf '#include "%s"\n' "$name" >"$scratch/one.cpp"
+  g++ -std=c++17 -Wall -Wextra -Wpedantic -Werror -fsyntax-only $(pkg-config --cflags s2s) \
+    "$scratch/one.cpp"
+  if grep -q 'extern "C"' "$header"; then
+    printf '#include "%s"\n' "$name" >"$scratch/one.c"
+    gcc -std=c11 -Wall -Wextra -Wpedantic -Werror -fsyntax-only $(pkg-config --cflags s2s) \
+      "$scratch/one.c"
+  fi
+done
+
+# Through pkg-config.
+g++ -std=c++17 -Wall -Wextra -Werror -o "$scratch/outside" "$here/outside_program.cpp" \
+  $(pkg-config --cflags --libs s2s)
+"$scratch/outside" >"$scratch/out.txt"
+grep -q '^{"name": "demo", "shares": \["docs", "media"\]}$' "$scratch/out.txt"
+grep -q '^Protocal error$' "$scratch/out.txt"
+grep -q '\[NOTE\] outside.cpp(7): logged$' "$scratch/out.txt"
+
+# Through the CMake package.
+mkdir -p "$scratch/cmake-project"
+cp "$here/outside_program.cpp" "$scratch/cmake-project/"
+cat >"$scratch/cmake-project/CMakeLists.txt" <<'CMAKE'
+cmake_minimum_required(VERSION 3.25)
+project(outside CXX)
+set(CMAKE_CXX_STANDARD 17)
+find_package(s2s REQUIRED)
+add_executable(outside outside_program.cpp)
+target_link_libraries(outside PRIVATE s2s::s2s)
+CMAKE
+cmake -S "$scratch/cmake-project" -B "$scratch/cmake-build" -G Ninja \
+  -DCMAKE_PREFIX_PATH="$prefix" >/dev/null
+cmake --build "$scratch/cmake-build" >/dev/null
+"$scratch/cmake-build/outside" | grep -q '^Protocal error$'
+echo "installed library usable from outside programs"
