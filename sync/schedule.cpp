@@ -1,0 +1,401 @@
+// Schedule: its setters, validation and the next-run arithmetic.
+//
+// The next run is found by walking local calendar days from `now`: align to the next day the mode
+// allows, try that day's runs (the start time, then `repeat_times_in_day` more, `period` plain
+// seconds apart), else move to the following day. Day lengths, month lengths and clock changes
+// all come from the system's time-zone rules through mktime/localtime_r.
+#include <cstring>
+#include <ctime>
+
+#include "s2s_logger.h"
+#include "s2s_sync_obj.h"
+
+namespace S2S {
+
+namespace {
+
+// The line numbers in these messages are part of the messages (log readers match on them), so
+// they are fixed here rather than taken from __LINE__.
+constexpr int kLineNoWeekday = 87;
+constexpr int kLineUnknownMode = 93;
+constexpr int kLineAlignFailed = 117;
+constexpr int kLineReferenceSeconds = 128;
+constexpr int kLinePastScheduled = 139;
+constexpr int kLinePastWeekly = 156;
+constexpr int kLinePastUnsupported = 160;
+constexpr int kLineDaySeconds = 209;
+constexpr int kLineBadHour = 325;
+constexpr int kLineBadMinute = 329;
+constexpr int kLineBadPeriod = 334;
+constexpr int kLineBadRepeat = 340;
+constexpr int kLineRepeatPastDay = 346;
+constexpr int kLineBadBegin = 359;
+constexpr int kLineBadBeginFields = 367;
+constexpr int kLineBadBeginDate = 375;
+constexpr int kLineWeekLength = 381;
+constexpr int kLineNoWeekdayChosen = 391;
+constexpr int kLineBadMode = 405;
+
+constexpr unsigned kLastSecondOfDay = 86399;
+constexpr unsigned kMaxRepeats = 95;
+constexpr int kWeekDays = 7;
+constexpr char kEveryDay[] = "1111111";
+
+bool SameDate(const struct tm& a, const struct tm& b) {
+    return a.tm_year == b.tm_year && a.tm_mon == b.tm_mon && a.tm_mday == b.tm_mday;
+}
+
+bool SameWallClock(const struct tm& a, const struct tm& b) {
+    return SameDate(a, b) && a.tm_hour == b.tm_hour && a.tm_min == b.tm_min && a.tm_sec == b.tm_sec;
+}
+
+// mktime, for broken-down times built by date arithmetic. Their daylight-saving flag is a hint
+// carried over from another day or another time of day; trusted blindly, a stale flag makes
+// mktime move the result by the size of the clock change (09:00 on the day the clocks go back
+// becomes 08:00; 23:30 on the day before they go forward becomes 00:30 of the next day, so a
+// monthly run lands on the wrong date). So the hint only decides what it can decide correctly:
+// which of the two 02:30s of the repeated hour is meant, and where a time inside the skipped hour
+// goes. Any wall-clock time that exists is kept as asked for.
+time_t NormaliseLocal(struct tm& tm) {
+    struct tm hinted = tm;
+    time_t hinted_secs = mktime(&hinted);
+    if (hinted_secs == -1 || tm.tm_isdst < 0) {
+        tm = hinted;
+        return hinted_secs;
+    }
+    // The wall-clock time asked for, with the calendar overflow resolved (31 April is 1 May).
+    struct tm wanted = tm;
+    wanted.tm_isdst = 0;
+    if (timegm(&wanted) == -1) {
+        tm = hinted;
+        return hinted_secs;
+    }
+    if (SameWallClock(hinted, wanted)) {
+        tm = hinted;
+        return hinted_secs;
+    }
+    struct tm other = tm;
+    other.tm_isdst = tm.tm_isdst > 0 ? 0 : 1;
+    time_t other_secs = mktime(&other);
+    if (other_secs != -1 && SameWallClock(other, wanted)) {
+        tm = other;
+        return other_secs;
+    }
+    // The time lies in a skipped hour. Keep the hinted reading unless it left the day, which can
+    // only happen where the clocks jump at midnight.
+    if (!SameDate(hinted, wanted) && other_secs != -1 && SameDate(other, wanted)) {
+        tm = other;
+        return other_secs;
+    }
+    tm = hinted;
+    return hinted_secs;
+}
+
+void LogTimeFields(int line, const char* what, const struct tm& tm) {
+    Logger::LogMsg(Logger::Error,
+                   "[ERROR] s2s_sync_obj.cpp(%d): Fail to get %s seconds, year:[%d], mon:[%d], "
+                   "mday:[%d], hour:[%d], min:[%d], sec:[%d], dst:[%d]\n",
+                   line, what, tm.tm_year, tm.tm_mon, tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec,
+                   tm.tm_isdst);
+}
+
+}  // namespace
+
+int GetDaysToNextSync(unsigned weekday, std::string week_schedule) {
+    for (unsigned d = 0; d < kWeekDays; ++d) {
+        size_t position = (weekday + d) % kWeekDays;
+        if (position < week_schedule.size() && week_schedule[position] == '1') {
+            return static_cast<int>(d);
+        }
+    }
+    return -1;
+}
+
+void Schedule::SetPeriod(long seconds) {
+    period_ = static_cast<int>(seconds);
+    if (seconds == 0) {
+        repeat_times_in_day_ = 0;
+    }
+}
+
+void Schedule::SetPeriod(long hours, long minutes) {
+    SetPeriod(hours * 3600 + minutes * 60);
+}
+
+void Schedule::SetRepeatTimesInDay(long times) {
+    repeat_times_in_day_ = static_cast<int>(times);
+    if (times == 0) {
+        period_ = 0;
+    }
+}
+
+void Schedule::SetWeekSchedule(const std::string& text) {
+    if (text.size() < kWeekDays) {
+        week_schedule_ = kEveryDay;
+        return;
+    }
+    week_schedule_.resize(kWeekDays);
+    bool any = false;
+    for (int i = 0; i < kWeekDays; ++i) {
+        week_schedule_[i] = text[i] == '0' ? '0' : '1';
+        any = any || week_schedule_[i] == '1';
+    }
+    // Choosing no day at all means every day, on purpose: a task is never left without days.
+    if (!any) {
+        week_schedule_ = kEveryDay;
+    }
+}
+
+std::string Schedule::GetModeStr() const {
+    switch (mode_) {
+        case SCHD_MANUAL:
+            return "manual";
+        case SCHD_REALTIME:
+            return "realtime";
+        case SCHD_MONTHLY:
+            return "monthly";
+        case SCHD_YEARLY:
+            return "yearly";
+        case SCHD_ONCE:
+            return "once";
+        case SCHD_WEEKLY:
+        default:
+            return "weekly";
+    }
+}
+
+void Schedule::SetModeByStr(const std::string& text) {
+    if (text == "realtime") {
+        mode_ = SCHD_REALTIME;
+    } else if (text == "weekly") {
+        mode_ = SCHD_WEEKLY;
+    } else if (text == "monthly") {
+        mode_ = SCHD_MONTHLY;
+    } else if (text == "yearly") {
+        mode_ = SCHD_YEARLY;
+    } else if (text == "once") {
+        mode_ = SCHD_ONCE;
+    } else {
+        mode_ = SCHD_MANUAL;
+    }
+}
+
+struct tm Schedule::GetScheduleBegin() const {
+    struct tm begin;
+    std::memset(&begin, 0, sizeof(begin));
+    begin.tm_year = begin_year_ - 1900;
+    begin.tm_mon = begin_month_ - 1;
+    begin.tm_mday = begin_day_;
+    begin.tm_hour = start_hour_;
+    begin.tm_min = start_minute_;
+    begin.tm_sec = 0;
+    begin.tm_isdst = 0;
+    return begin;
+}
+
+bool Schedule::Validate() const {
+    // Compared as unsigned so that negative values fail the upper bounds too.
+    if (static_cast<unsigned>(start_hour_) > 23) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Invalid begin hour\n",
+                       kLineBadHour);
+        return false;
+    }
+    if (static_cast<unsigned>(start_minute_) > 59) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Invalid begin minute\n",
+                       kLineBadMinute);
+        return false;
+    }
+    // The two texts below each name the other's field; they are kept as they have always read.
+    if (static_cast<unsigned>(period_) > kLastSecondOfDay) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Invalid period or repeat\n",
+                       kLineBadPeriod);
+        return false;
+    }
+    if (static_cast<unsigned>(repeat_times_in_day_) > kMaxRepeats) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Invalid period\n",
+                       kLineBadRepeat);
+        return false;
+    }
+    // The last run of a day must fall on that day.
+    int start = start_hour_ * 3600 + start_minute_ * 60;
+    if (static_cast<long>(start) + static_cast<long>(repeat_times_in_day_) * period_ >
+        static_cast<long>(kLastSecondOfDay)) {
+        Logger::LogMsg(Logger::Note,
+                       "[NOTE] s2s_sync_obj.cpp(%d): Invalid repeat in day [%d + %d * %d]\n",
+                       kLineRepeatPastDay, start, period_, repeat_times_in_day_);
+        return false;
+    }
+    // Noon keeps the check clear of clock changes, which happen at night.
+    struct tm begin = GetScheduleBegin();
+    begin.tm_hour = 12;
+    struct tm normalised = begin;
+    if (mktime(&normalised) < 0) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Invalid begin\n", kLineBadBegin);
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): %d %d %d %d %d %d\n",
+                       kLineBadBeginFields, normalised.tm_year, normalised.tm_mon,
+                       normalised.tm_mday, normalised.tm_hour, normalised.tm_min,
+                       normalised.tm_sec);
+        return false;
+    }
+    if (!SameDate(normalised, begin)) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Invalid begin date\n",
+                       kLineBadBeginDate);
+        return false;
+    }
+    // The week schedule and the begin date are checked for every mode, also those not using them.
+    if (week_schedule_.size() != kWeekDays) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Wrong length of weekday '%s'\n",
+                       kLineWeekLength, week_schedule_.c_str());
+        return false;
+    }
+    if (week_schedule_.find_first_not_of('0') == std::string::npos) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Invalid weekday '%s'\n",
+                       kLineNoWeekdayChosen, week_schedule_.c_str());
+        return false;
+    }
+    if (static_cast<unsigned>(mode_) > SCHD_ONCE) {
+        Logger::LogMsg(Logger::Note, "[NOTE] s2s_sync_obj.cpp(%d): Invalid schedule mode [%d]\n",
+                       kLineBadMode, static_cast<int>(mode_));
+        return false;
+    }
+    return true;
+}
+
+long Schedule::GetNextScheduledSeconds(long now) const {
+    if (now < 0) {
+        return -1;
+    }
+    struct tm now_tm;
+    std::memset(&now_tm, 0, sizeof(now_tm));
+    time_t now_time = static_cast<time_t>(now);
+    // A time too large for a calendar year leaves the zeroed fields, which fail further down.
+    localtime_r(&now_time, &now_tm);
+
+    if (mode_ == SCHD_MANUAL) {
+        return 0;
+    }
+    if (mode_ == SCHD_REALTIME) {
+        return now + 1;
+    }
+
+    // Each pass either returns or moves now_tm on by one day. A valid schedule has a run on every
+    // day (weekly), month (monthly) or year (yearly), so the walk is a few passes at most.
+    for (;;) {
+        const struct tm begin = GetScheduleBegin();
+        // The current day at the current time of day, with its weekday.
+        struct tm ref = now_tm;
+        NormaliseLocal(ref);
+
+        switch (mode_) {
+            case SCHD_WEEKLY: {
+                int days = GetDaysToNextSync(static_cast<unsigned>(ref.tm_wday), week_schedule_);
+                if (days < 0) {
+                    Logger::LogMsg(Logger::Error,
+                                   "[ERROR] s2s_sync_obj.cpp(%d): No chosen week day for sync "
+                                   "'%s'\n",
+                                   kLineNoWeekday, week_schedule_.c_str());
+                    Logger::LogMsg(Logger::Error,
+                                   "[ERROR] s2s_sync_obj.cpp(%d): Fail to align to scheduled day\n",
+                                   kLineAlignFailed);
+                    return -1;
+                }
+                ref.tm_mday += days;
+                break;
+            }
+            case SCHD_MONTHLY:
+                ref.tm_mday = begin.tm_mday;
+                break;
+            case SCHD_YEARLY:
+                ref.tm_mon = begin.tm_mon;
+                ref.tm_mday = begin.tm_mday;
+                break;
+            case SCHD_ONCE:
+                ref.tm_year = begin.tm_year;
+                ref.tm_mon = begin.tm_mon;
+                ref.tm_mday = begin.tm_mday;
+                break;
+            default:
+                Logger::LogMsg(Logger::Error,
+                               "[ERROR] s2s_sync_obj.cpp(%d): Unknown schedule mode [%d]\n",
+                               kLineUnknownMode, static_cast<int>(mode_));
+                Logger::LogMsg(Logger::Error,
+                               "[ERROR] s2s_sync_obj.cpp(%d): Fail to align to scheduled day\n",
+                               kLineAlignFailed);
+                return -1;
+        }
+
+        struct tm now_copy = now_tm;
+        long now_secs = static_cast<long>(NormaliseLocal(now_copy));
+        if (now_secs < 0) {
+            LogTimeFields(kLineReferenceSeconds, "reference", now_copy);
+            return -1;
+        }
+        // Normalising rolls an overflowing day into the next month: a monthly task on the 31st
+        // runs on the 1st after a 30-day month.
+        long ref_secs = static_cast<long>(NormaliseLocal(ref));
+
+        // Both carry the same time of day, so this says the aligned day lies before today.
+        if (now_secs > ref_secs) {
+            if (ref_secs < 0) {
+                LogTimeFields(kLinePastScheduled, "scheduled", ref);
+                return -1;
+            }
+            switch (mode_) {
+                case SCHD_MONTHLY:
+                    ref.tm_mon += 1;  // the next mktime normalises
+                    break;
+                case SCHD_YEARLY:
+                    ref.tm_year += 1;
+                    break;
+                case SCHD_ONCE:
+                    return 0;  // the single run is past
+                case SCHD_WEEKLY:
+                    // The weekly alignment never goes back; kept as a guard.
+                    Logger::LogMsg(Logger::Error,
+                                   "[ERROR] s2s_sync_obj.cpp(%d): No chosen week day for sync\n",
+                                   kLinePastWeekly);
+                    return -1;
+                default:
+                    Logger::LogMsg(Logger::Error,
+                                   "[ERROR] s2s_sync_obj.cpp(%d): Unsupported schedule mode "
+                                   "[%d]\n",
+                                   kLinePastUnsupported, static_cast<int>(mode_));
+                    return -1;
+            }
+        }
+
+        // The day's first run. Its daylight-saving flag is the one ref just got, which picks the
+        // reading of a start time inside the repeated or the skipped hour.
+        struct tm day = ref;
+        day.tm_hour = start_hour_;
+        day.tm_min = start_minute_;
+        day.tm_sec = 0;
+        long first = static_cast<long>(NormaliseLocal(day));
+        if (first < 0) {
+            // This day cannot be expressed; try the next one.
+            LogTimeFields(kLineDaySeconds, "scheduled", day);
+        } else if (repeat_times_in_day_ >= 0 && first > 0) {
+            // Repeats are plain seconds apart, so after a clock change within the day they keep
+            // their distance rather than their wall-clock times. The first one strictly after
+            // `now` is the answer; with a period of 0 or less none after the first can be.
+            if (first > now) {
+                return first;
+            }
+            if (period_ > 0) {
+                long k = (now - first) / period_ + 1;
+                if (k <= repeat_times_in_day_) {
+                    return first + k * static_cast<long>(period_);
+                }
+            }
+        }
+
+        // The next day, from its beginning.
+        now_tm = ref;
+        now_tm.tm_hour = 0;
+        now_tm.tm_min = 0;
+        now_tm.tm_sec = 0;
+        now_tm.tm_mday += 1;
+    }
+}
+
+}  // namespace S2S
