@@ -1,11 +1,49 @@
 // VURN::Backup::RsyncWrapper: one rsync run over the stock rsync binary. The sync driver's
 // RsyncTask derives from it; the wrapper owns the command line, the authentication with the
 // server and the delivery of custom command lines to the server's command handler.
+//
+// How the settings reach the server (rsync daemon transport, the default):
+//   setDestPath(server, user, password, dest, module) names the target
+//     rsync://user@server:port/<target>
+//   where <target> is
+//     - module empty:            dest itself; its first component is the daemon module, so
+//                                "photos" and "photos/sub" land in the module "photos", and an
+//                                encrypted share's "@photos@" in the module "@photos@";
+//     - module set, dest relative: module + "/" + dest;
+//     - module set, dest absolute: the daemon module that serves that server directory (see
+//                                setServerPathModule; "/usr/vurn/etc/.encrypt" is served by the
+//                                key module "@s2s-key") + "/" + module + "/", so an encryption
+//                                key lands in a directory named after its share.
+//   The port is setPort's (default 873). With setSsh(true) the same modules are reached through
+//   rsync's daemon-over-remote-shell mode: ssh to server:port as `user`, where rsync starts a
+//   one-shot daemon with the receiver's configuration (setRemoteConfig).
+//   The password travels only in the child's environment (RSYNC_PASSWORD, and SSHPASS for ssh).
+//
+// Custom commands (setVurnCustCmdRule with a non-empty list, dest and module empty): the lines
+// are sent as rsync's early input to the command module ("@s2s-cmd", setCommandModule) under a
+// random reply token; the server's handler runs the command and leaves its result code and output
+// in a reply directory named by the token, which the same run pulls back. execute() returns the
+// handler's result code; when the lines carry outfile="<local path>", the reply's output file
+// (at most 1 MiB) is written to that local path. A command file may hold at most 4000 bytes.
+// The server's answers are described in docs/protocol.md.
+//
+// Result codes of execute(): 0; rsync's own exit code (5 authentication refused or unknown
+// module, 10 server unreachable, 30/35 time-outs, 23 partial transfer, ...); the server's result
+// code for a command; 51 when the server has no command module (a server that knows no custom
+// commands); 20 when the run was cancelled through the predicate; 1 when the settings are
+// incomplete or malformed; 11 when a local file (temporary directory, command file, output file)
+// could not be handled; 12 when a command's reply is malformed; 14 when rsync could not be
+// started.
+//
+// Pointing a wrapper at a test daemon started by s2s-receiver on 127.0.0.1:<port>:
+//   w.setPort(port); w.setDestPath("127.0.0.1", user, password, "<share>", "");
+// with the user and password given to `s2s-receiver configure`; commands need nothing more.
 #ifndef S2S_RSYNC_WRAPPER_H
 #define S2S_RSYNC_WRAPPER_H
 
 #include <boost/function.hpp>
 #include <list>
+#include <memory>
 #include <string>
 
 #include "s2s_export.h"
@@ -15,6 +53,16 @@ namespace Backup {
 
 class S2S_EXPORT RsyncWrapper {
   public:
+    // Result codes the wrapper produces itself (the others are rsync's or the server's).
+    enum Result : int {
+        kResultUsage = 1,        // settings incomplete or malformed
+        kResultLocalFile = 11,   // a local temporary or output file could not be handled
+        kResultBadReply = 12,    // a command's reply was malformed
+        kResultSpawn = 14,       // rsync could not be started
+        kResultCancelled = 20,   // the cancel predicate returned true
+        kResultNoCommands = 51,  // the server has no command module
+    };
+
     RsyncWrapper();
     virtual ~RsyncWrapper();
     RsyncWrapper(const RsyncWrapper&) = delete;
@@ -39,9 +87,41 @@ class S2S_EXPORT RsyncWrapper {
     void setVurnPseudoRoot(bool on);
     void setVurnCustCmdRule(std::list<std::string> lines);
 
+    // --- extras: defaults suit a production server; tests and tools override them -------------
+    // The rsync program (default: "rsync" looked up in PATH).
+    void setRsyncPath(std::string path);
+    // Seconds allowed to reach the server (rsync --contimeout, ssh ConnectTimeout); default 30.
+    void setConnectTimeout(int seconds);
+    // The daemon module that runs custom commands (default "@s2s-cmd").
+    void setCommandModule(std::string module);
+    // Maps an absolute server directory used as a destination to the daemon module serving it.
+    void setServerPathModule(std::string serverPath, std::string module);
+    // Where the debug log goes when setDebugLog(true) (default "/var/log/s2s_rsync.log" below
+    // $S2S_ROOT).
+    void setLogFile(std::string path);
+    // Over ssh: the server's daemon configuration that the one-shot daemon reads (default
+    // "/usr/vurn/etc/s2s_rsyncd.conf" below the local $S2S_ROOT, which is the server's path when
+    // S2S_ROOT is unset on both ends). Only [A-Za-z0-9._/-] characters are accepted.
+    void setRemoteConfig(std::string path);
+    // Over ssh: the known-hosts file to check and record the server's key in (default: ssh's
+    // own). Unknown hosts are accepted and recorded on first contact.
+    void setSshKnownHostsFile(std::string path);
+    // Over ssh: an identity file for key authentication (then no password is needed).
+    void setSshIdentityFile(std::string path);
+    // Called from execute()'s thread with the overall progress of a transfer, 0 to 100.
+    void setProgressCallback(boost::function<void(int)> callback);
+
     // Runs rsync with these settings; polls `cancel` (when set) at least every 200 ms and stops
     // the run when it returns true. 0, or rsync's / the server's numeric result code.
     int execute(boost::function<bool()> cancel);
+
+    // The last error lines rsync (or the wrapper) reported for the previous execute(); never
+    // holds the password.
+    std::string lastError() const;
+
+  private:
+    struct Impl;
+    std::unique_ptr<Impl> impl_;
 };
 
 }  // namespace Backup

@@ -1,0 +1,313 @@
+#include "rsync/child_process.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <thread>
+
+extern char** environ;
+
+namespace S2S {
+namespace rsync_internal {
+
+namespace {
+
+constexpr int kPollMillis = 100;  // well under the 200 ms the cancel predicate is promised
+constexpr auto kTermGrace = std::chrono::seconds(3);
+constexpr auto kKillGrace = std::chrono::seconds(3);
+
+class Fd {
+  public:
+    explicit Fd(int fd = -1) : fd_(fd) {}
+    ~Fd() { reset(); }
+    Fd(const Fd&) = delete;
+    Fd& operator=(const Fd&) = delete;
+    int get() const { return fd_; }
+    void reset(int fd = -1) {
+        if (fd_ >= 0) {
+            close(fd_);
+        }
+        fd_ = fd;
+    }
+
+  private:
+    int fd_;
+};
+
+bool IsExecutable(const std::string& path) {
+    struct stat st;
+    return stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) && access(path.c_str(), X_OK) == 0;
+}
+
+// Splits the merged output into lines; progress meters rewrite their line with '\r'.
+class LineSplitter {
+  public:
+    explicit LineSplitter(const LineSink& sink) : sink_(sink) {}
+    void Feed(const char* data, size_t size) {
+        for (size_t i = 0; i < size; ++i) {
+            char c = data[i];
+            if (c == '\n' || c == '\r') {
+                Flush();
+            } else if (pending_.size() < kMaxLine) {
+                pending_.push_back(c);
+            }
+        }
+    }
+    void Flush() {
+        if (!pending_.empty() && sink_) {
+            sink_(pending_);
+        }
+        pending_.clear();
+    }
+
+  private:
+    static constexpr size_t kMaxLine = 8192;
+    const LineSink& sink_;
+    std::string pending_;
+};
+
+// True while any process (zombies included) is still in the group.
+bool GroupAlive(pid_t pgid) {
+    return kill(-pgid, 0) == 0 || errno == EPERM;
+}
+
+// Reaps `pid` without blocking; true once it has been reaped (status in `*status`).
+bool TryReap(pid_t pid, int* status) {
+    for (;;) {
+        pid_t r = waitpid(pid, status, WNOHANG);
+        if (r == pid) {
+            return true;
+        }
+        if (r < 0 && errno == EINTR) {
+            continue;
+        }
+        if (r < 0) {
+            // Already reaped elsewhere: nothing more can be learnt about it.
+            *status = 0;
+            return true;
+        }
+        return false;
+    }
+}
+
+void DrainAvailable(int fd, LineSplitter* splitter) {
+    char buffer[4096];
+    for (;;) {
+        ssize_t n = read(fd, buffer, sizeof buffer);
+        if (n > 0) {
+            splitter->Feed(buffer, static_cast<size_t>(n));
+            continue;
+        }
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        return;
+    }
+}
+
+// Ends the group: SIGTERM, a grace period, then SIGKILL; reaps `pid` on the way.
+void StopGroup(pid_t pid, int fd, LineSplitter* splitter, bool* reaped, int* status) {
+    kill(-pid, SIGTERM);
+    auto deadline = std::chrono::steady_clock::now() + kTermGrace;
+    while (std::chrono::steady_clock::now() < deadline) {
+        if (!*reaped) {
+            *reaped = TryReap(pid, status);
+        }
+        if (*reaped && !GroupAlive(pid)) {
+            break;
+        }
+        DrainAvailable(fd, splitter);
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    if (!*reaped || GroupAlive(pid)) {
+        kill(-pid, SIGKILL);
+    }
+    if (!*reaped) {
+        while (waitpid(pid, status, 0) < 0 && errno == EINTR) {
+        }
+        *reaped = true;
+    }
+    // Grandchildren that were re-parented are reaped by their new parent; wait (bounded) until
+    // the group is gone so that the caller can rely on it.
+    deadline = std::chrono::steady_clock::now() + kKillGrace;
+    while (GroupAlive(pid) && std::chrono::steady_clock::now() < deadline) {
+        kill(-pid, SIGKILL);
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+}
+
+}  // namespace
+
+std::string FindProgram(const std::string& program) {
+    if (program.empty()) {
+        return std::string();
+    }
+    if (program.find('/') != std::string::npos) {
+        return program;
+    }
+    const char* path = std::getenv("PATH");
+    std::string dirs = path != nullptr && *path != '\0' ? path : "/usr/local/bin:/usr/bin:/bin";
+    size_t start = 0;
+    while (start <= dirs.size()) {
+        size_t end = dirs.find(':', start);
+        if (end == std::string::npos) {
+            end = dirs.size();
+        }
+        std::string dir = dirs.substr(start, end - start);
+        if (!dir.empty()) {
+            std::string candidate = dir + "/" + program;
+            if (IsExecutable(candidate)) {
+                return candidate;
+            }
+        }
+        start = end + 1;
+    }
+    return std::string();
+}
+
+ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& cancel,
+                      const LineSink& sink) {
+    ChildOutcome outcome;
+    if (spec.argv.empty()) {
+        outcome.error = "no program given";
+        return outcome;
+    }
+    std::string program = FindProgram(spec.argv[0]);
+    if (program.empty() || !IsExecutable(program)) {
+        outcome.error = "cannot find the program " + spec.argv[0];
+        return outcome;
+    }
+
+    // Everything the child needs is prepared before fork: after it, only async-signal-safe calls.
+    std::vector<std::string> env_strings;
+    for (char** e = environ; e != nullptr && *e != nullptr; ++e) {
+        std::string entry(*e);
+        std::string name = entry.substr(0, entry.find('='));
+        bool drop = false;
+        for (const auto& unset : spec.unset_env) {
+            drop = drop || name == unset;
+        }
+        for (const auto& set : spec.set_env) {
+            drop = drop || name == set.first;
+        }
+        if (!drop) {
+            env_strings.push_back(entry);
+        }
+    }
+    for (const auto& set : spec.set_env) {
+        env_strings.push_back(set.first + "=" + set.second);
+    }
+    std::vector<char*> envp;
+    for (auto& s : env_strings) {
+        envp.push_back(&s[0]);
+    }
+    envp.push_back(nullptr);
+    std::vector<std::string> argv_strings(spec.argv);
+    std::vector<char*> argv;
+    for (auto& s : argv_strings) {
+        argv.push_back(&s[0]);
+    }
+    argv.push_back(nullptr);
+
+    int fds[2];
+    if (pipe2(fds, O_CLOEXEC) != 0) {
+        outcome.error = std::string("pipe: ") + strerror(errno);
+        return outcome;
+    }
+    Fd read_end(fds[0]);
+    Fd write_end(fds[1]);
+    int devnull = open("/dev/null", O_RDONLY | O_CLOEXEC);
+    if (devnull < 0) {
+        outcome.error = std::string("/dev/null: ") + strerror(errno);
+        return outcome;
+    }
+    Fd null_fd(devnull);
+
+    pid_t pid = fork();
+    if (pid < 0) {
+        outcome.error = std::string("fork: ") + strerror(errno);
+        return outcome;
+    }
+    if (pid == 0) {
+        setpgid(0, 0);
+        // Default dispositions: the caller may ignore SIGPIPE or block signals.
+        sigset_t none;
+        sigemptyset(&none);
+        sigprocmask(SIG_SETMASK, &none, nullptr);
+        signal(SIGPIPE, SIG_DFL);
+        signal(SIGTERM, SIG_DFL);
+        signal(SIGINT, SIG_DFL);
+        if (dup2(null_fd.get(), 0) < 0 || dup2(write_end.get(), 1) < 0 ||
+            dup2(write_end.get(), 2) < 0) {
+            _exit(127);
+        }
+        execve(program.c_str(), argv.data(), envp.data());
+        _exit(127);
+    }
+    // Both ends set the group so that a cancel right after fork already reaches the child.
+    setpgid(pid, pid);
+    outcome.started = true;
+    write_end.reset();
+    null_fd.reset();
+    fcntl(read_end.get(), F_SETFL, fcntl(read_end.get(), F_GETFL) | O_NONBLOCK);
+
+    LineSplitter splitter(sink);
+    bool reaped = false;
+    bool eof = false;
+    int status = 0;
+    while (!reaped || !eof) {
+        if (cancel && cancel()) {
+            outcome.cancelled = true;
+            StopGroup(pid, read_end.get(), &splitter, &reaped, &status);
+            break;
+        }
+        if (!eof) {
+            struct pollfd pfd = {read_end.get(), POLLIN, 0};
+            int r = poll(&pfd, 1, kPollMillis);
+            if (r > 0) {
+                char buffer[4096];
+                ssize_t n = read(read_end.get(), buffer, sizeof buffer);
+                if (n > 0) {
+                    splitter.Feed(buffer, static_cast<size_t>(n));
+                } else if (n == 0) {
+                    eof = true;
+                }
+            }
+        } else {
+            std::this_thread::sleep_for(std::chrono::milliseconds(kPollMillis / 4));
+        }
+        if (!reaped) {
+            reaped = TryReap(pid, &status);
+            if (reaped && !eof) {
+                // Whatever of the group still holds the pipe open goes with its leader.
+                if (GroupAlive(pid)) {
+                    kill(-pid, SIGKILL);
+                }
+                DrainAvailable(read_end.get(), &splitter);
+                eof = true;
+            }
+        }
+    }
+    if (GroupAlive(pid)) {
+        kill(-pid, SIGKILL);
+    }
+    DrainAvailable(read_end.get(), &splitter);
+    splitter.Flush();
+    if (WIFEXITED(status)) {
+        outcome.exit_code = WEXITSTATUS(status);
+    } else if (WIFSIGNALED(status)) {
+        outcome.signal = WTERMSIG(status);
+    }
+    return outcome;
+}
+
+}  // namespace rsync_internal
+}  // namespace S2S

@@ -1,0 +1,46 @@
+// One child program run without a shell, in a process group of its own, with its standard output
+// and error merged into one pipe that the caller sees line by line. The run can be cancelled: the
+// whole group gets SIGTERM, then SIGKILL, and nothing of it survives the call.
+#ifndef S2S_RSYNC_CHILD_PROCESS_H
+#define S2S_RSYNC_CHILD_PROCESS_H
+
+#include <boost/function.hpp>
+#include <functional>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace S2S {
+namespace rsync_internal {
+
+struct ChildSpec {
+    // argv[0] is the program: a path, or a name looked up in PATH.
+    std::vector<std::string> argv;
+    // Variables set (NAME, value) or removed (NAME, nullopt-like: removed when listed in `unset`)
+    // in a copy of this process's environment; secrets travel only this way.
+    std::vector<std::pair<std::string, std::string> > set_env;
+    std::vector<std::string> unset_env;
+};
+
+struct ChildOutcome {
+    bool started = false;    // false: the program could not be started (see `error`)
+    bool cancelled = false;  // the predicate asked to stop and the group was killed
+    int exit_code = -1;      // the exit status; -1 when it died from a signal
+    int signal = 0;          // the signal that ended it, if any
+    std::string error;       // why it could not be started
+};
+
+// Lines (split at '\n' and '\r') of the child's merged output; a final unterminated line too.
+typedef std::function<void(const std::string& line)> LineSink;
+
+// Polls `cancel` (when set) at least every 200 ms while the child runs.
+ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& cancel,
+                      const LineSink& sink);
+
+// The absolute path of `program` (returned as is when it holds a '/'), or "" when PATH has none.
+std::string FindProgram(const std::string& program);
+
+}  // namespace rsync_internal
+}  // namespace S2S
+
+#endif  // S2S_RSYNC_CHILD_PROCESS_H

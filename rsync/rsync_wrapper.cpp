@@ -1,0 +1,486 @@
+#include <sys/stat.h>
+
+#include <cctype>
+#include <cerrno>
+#include <utility>
+
+#include "rsync/rsync_wrapper_impl.h"
+#include "s2s_logger.h"
+#include "s2s_platform.h"
+
+namespace VURN {
+namespace Backup {
+
+namespace {
+
+using S2S::Logger;
+using S2S::rsync_internal::ChildOutcome;
+using S2S::rsync_internal::ChildSpec;
+
+// Where the debug log of client runs goes, and the receiver's daemon configuration that a
+// one-shot daemon started over ssh reads (both below $S2S_ROOT when it is set).
+constexpr const char* kDefaultLogFile = "/var/log/s2s_rsync.log";
+constexpr const char* kDefaultRemoteConfig = "/usr/vurn/etc/s2s_rsyncd.conf";
+constexpr const char* kKeyModule = "@s2s-key";
+constexpr size_t kKeptErrorLines = 8;
+
+bool HasControl(const std::string& s) {
+    for (unsigned char c : s) {
+        if (c < 0x20 || c == 0x7f) {
+            return true;
+        }
+    }
+    return false;
+}
+
+// Host names and numeric addresses (IPv6 with an optional zone): nothing that could turn the
+// URL into another user, path or option.
+bool ValidServer(const std::string& s) {
+    if (s.empty() || s[0] == '-') {
+        return false;
+    }
+    for (unsigned char c : s) {
+        if (!(std::isalnum(c) || c == '.' || c == '-' || c == ':' || c == '_' || c == '%')) {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool ValidUser(const std::string& s) {
+    if (s.empty() || s[0] == '-' || HasControl(s)) {
+        return false;
+    }
+    return s.find_first_of("@:/ \t'\"\\") == std::string::npos;
+}
+
+// Paths handed to ssh's command line through rsync's -e parsing (which splits at blanks and
+// honours quotes): only plain characters are let through.
+bool PlainPath(const std::string& s) {
+    if (s.empty()) {
+        return false;
+    }
+    for (unsigned char c : s) {
+        if (!(std::isalnum(c) || c == '.' || c == '_' || c == '/' || c == '-')) {
+            return false;
+        }
+    }
+    return true;
+}
+
+std::string StripSlashes(const std::string& s) {
+    size_t b = s.find_first_not_of('/');
+    if (b == std::string::npos) {
+        return std::string();
+    }
+    return s.substr(b);
+}
+
+bool HasDotDot(const std::string& path) {
+    size_t start = 0;
+    while (start <= path.size()) {
+        size_t end = path.find('/', start);
+        if (end == std::string::npos) {
+            end = path.size();
+        }
+        if (path.compare(start, end - start, "..") == 0 && end - start == 2) {
+            return true;
+        }
+        start = end + 1;
+    }
+    return false;
+}
+
+// The overall percentage of an --info=progress2 line ("  1,234  45%  1.2MB/s  0:00:01 ..."),
+// or -1 when the line is none.
+int ProgressPercent(const std::string& line) {
+    size_t pct = line.find('%');
+    if (pct == std::string::npos || pct == 0) {
+        return -1;
+    }
+    size_t start = pct;
+    while (start > 0 && std::isdigit(static_cast<unsigned char>(line[start - 1]))) {
+        --start;
+    }
+    if (start == pct || pct - start > 3 || (start > 0 && line[start - 1] != ' ')) {
+        return -1;
+    }
+    int value = std::stoi(line.substr(start, pct - start));
+    return value <= 100 ? value : -1;
+}
+
+void MakeParentDir(const std::string& path) {
+    size_t slash = path.rfind('/');
+    if (slash == std::string::npos || slash == 0) {
+        return;
+    }
+    std::string dir = path.substr(0, slash);
+    for (size_t pos = 1; pos <= dir.size(); ++pos) {
+        if (pos == dir.size() || dir[pos] == '/') {
+            mkdir(dir.substr(0, pos).c_str(), 0755);
+        }
+    }
+}
+
+}  // namespace
+
+RsyncWrapper::Impl::Impl() {
+    pathModules[S2S_PATH_KEY_DIR] = kKeyModule;
+}
+
+std::string RsyncWrapper::Impl::CheckConnection() const {
+    if (!ValidServer(server)) {
+        return "invalid server address";
+    }
+    if (auth) {
+        if (!ValidUser(user)) {
+            return "invalid user name";
+        }
+        if (authStrict && password.empty() && !(ssh && !identity.empty())) {
+            return "authentication requires a password";
+        }
+    }
+    if (port < 0 || port > 65535 || timeout < 0 || connectTimeout < 0) {
+        return "invalid port or time-out";
+    }
+    if (ssh) {
+        if (!remoteConfig.empty() && !PlainPath(remoteConfig)) {
+            return "remote configuration path holds characters that are not allowed";
+        }
+        if ((!knownHosts.empty() && !PlainPath(knownHosts)) ||
+            (!identity.empty() && !PlainPath(identity))) {
+            return "ssh file path holds characters that are not allowed";
+        }
+    }
+    return std::string();
+}
+
+std::string RsyncWrapper::Impl::Url(const std::string& target) const {
+    std::string host = server.find(':') != std::string::npos ? "[" + server + "]" : server;
+    std::string url = "rsync://";
+    if (auth) {
+        url += user + "@";
+    }
+    url += host;
+    // Over ssh the port belongs to ssh (-e); the one-shot daemon needs none.
+    if (!ssh && port > 0) {
+        url += ":" + std::to_string(port);
+    }
+    return url + "/" + target;
+}
+
+std::string RsyncWrapper::Impl::TransferTarget(std::string* why) const {
+    if (HasControl(dest) || HasControl(module) || HasDotDot(dest) || HasDotDot(module)) {
+        *why = "destination holds control characters or '..'";
+        return std::string();
+    }
+    if (module.empty()) {
+        std::string target = StripSlashes(dest);
+        if (target.empty()) {
+            *why = "no destination module";
+        }
+        return target;
+    }
+    if (module.find('/') != std::string::npos) {
+        *why = "module name holds '/'";
+        return std::string();
+    }
+    if (!dest.empty() && dest[0] == '/') {
+        std::string dir = dest;
+        while (dir.size() > 1 && dir.back() == '/') {
+            dir.pop_back();
+        }
+        auto it = pathModules.find(dir);
+        if (it == pathModules.end()) {
+            *why = "no daemon module serves the server directory " + dir;
+            return std::string();
+        }
+        return it->second + "/" + module + "/";
+    }
+    std::string rest = StripSlashes(dest);
+    return rest.empty() ? module + "/" : module + "/" + rest;
+}
+
+void RsyncWrapper::Impl::ConnectionOptions(std::vector<std::string>* argv) const {
+    if (timeout > 0) {
+        argv->push_back("--timeout=" + std::to_string(timeout));
+    }
+    if (!ssh) {
+        if (connectTimeout > 0) {
+            argv->push_back("--contimeout=" + std::to_string(connectTimeout));
+        }
+        return;
+    }
+    // rsync splits this at blanks itself; every piece was checked to hold no blank or quote.
+    std::string rsh;
+    bool withPassword = !password.empty() && identity.empty();
+    if (withPassword) {
+        rsh = "sshpass -e ";
+    }
+    rsh += "ssh";
+    if (port > 0) {
+        rsh += " -p " + std::to_string(port);
+    }
+    if (connectTimeout > 0) {
+        rsh += " -o ConnectTimeout=" + std::to_string(connectTimeout);
+    }
+    rsh += " -o StrictHostKeyChecking=accept-new";
+    if (!knownHosts.empty()) {
+        rsh += " -o UserKnownHostsFile=" + knownHosts;
+    }
+    if (!identity.empty()) {
+        rsh += " -i " + identity + " -o BatchMode=yes";
+    } else if (!withPassword) {
+        rsh += " -o BatchMode=yes";
+    } else {
+        rsh += " -o PubkeyAuthentication=no";
+    }
+    if (auth) {
+        rsh += " -l " + user;
+    }
+    argv->push_back("--rsh=" + rsh);
+    std::string config = remoteConfig.empty() ? S2SPath(kDefaultRemoteConfig) : remoteConfig;
+    argv->push_back("--rsync-path=rsync --config=" + config);
+}
+
+void RsyncWrapper::Impl::Environment(ChildSpec* spec) const {
+    spec->unset_env = {"RSYNC_PASSWORD", "SSHPASS", "RSYNC_CONNECT_PROG", "RSYNC_RSH",
+                       "RSYNC_PROXY"};
+    if (auth && !password.empty()) {
+        spec->set_env.push_back(std::make_pair("RSYNC_PASSWORD", password));
+        if (ssh && identity.empty()) {
+            spec->set_env.push_back(std::make_pair("SSHPASS", password));
+        }
+    }
+}
+
+int RsyncWrapper::Impl::Run(ChildSpec& spec, const boost::function<bool()>& cancel,
+                            bool commandRun) {
+    std::list<std::string> errors;
+    bool unknownCommandModule = false;
+    const std::string unknownModule = "Unknown module '" + commandModule + "'";
+    auto sink = [&](const std::string& raw) {
+        std::string line = raw;
+        if (password.size() >= 4) {
+            for (size_t at = line.find(password); at != std::string::npos;
+                 at = line.find(password, at)) {
+                line.replace(at, password.size(), "***");
+            }
+        }
+        int percent = ProgressPercent(line);
+        if (percent >= 0) {
+            if (progress) {
+                progress(percent);
+            }
+            return;
+        }
+        if (commandRun && line.find(unknownModule) != std::string::npos) {
+            unknownCommandModule = true;
+        }
+        errors.push_back(line);
+        if (errors.size() > kKeptErrorLines) {
+            errors.pop_front();
+        }
+    };
+    spec.argv.insert(spec.argv.begin(), rsyncPath);
+    ChildOutcome outcome = S2S::rsync_internal::RunChild(spec, cancel, sink);
+    lastError.clear();
+    for (const auto& e : errors) {
+        lastError += e + "\n";
+    }
+    if (!outcome.started) {
+        lastError = outcome.error;
+        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): Fail to start rsync: %s\n",
+                       __LINE__, outcome.error.c_str());
+        return kResultSpawn;
+    }
+    if (outcome.cancelled) {
+        Logger::LogMsg(Logger::Info, "[INFO] rsync_wrapper.cpp(%d): rsync cancelled\n", __LINE__);
+        return kResultCancelled;
+    }
+    if (outcome.signal != 0) {
+        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): rsync killed by signal %d\n",
+                       __LINE__, outcome.signal);
+        return kResultCancelled;
+    }
+    if (outcome.exit_code == 127) {
+        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): Fail to execute %s\n",
+                       __LINE__, rsyncPath.c_str());
+        return kResultSpawn;
+    }
+    if (outcome.exit_code != 0) {
+        std::string last = errors.empty() ? std::string() : errors.back();
+        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): rsync failed [%d]: %s\n",
+                       __LINE__, outcome.exit_code, last.c_str());
+        if (unknownCommandModule) {
+            return kResultNoCommands;
+        }
+    }
+    return outcome.exit_code;
+}
+
+int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
+    std::string why = CheckConnection();
+    std::string target;
+    if (why.empty()) {
+        target = TransferTarget(&why);
+    }
+    if (why.empty() && (src.empty() || HasControl(src))) {
+        why = "no usable source path";
+    }
+    if (!why.empty()) {
+        lastError = why;
+        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__, why.c_str());
+        return kResultUsage;
+    }
+
+    ChildSpec spec;
+    std::vector<std::string>& a = spec.argv;
+    a = {"--recursive", "--links", "--perms", "--times", "--hard-links", "--sparse"};
+    if (pseudoRoot) {
+        // The daemon writes as root: owners, groups and special files are kept as sent.
+        a.insert(a.end(), {"--owner", "--group", "--devices", "--specials"});
+    }
+    if (numericIds) {
+        a.push_back("--numeric-ids");
+    }
+    if (deleteExtraneous) {
+        a.push_back("--delete");
+    }
+    if (compress) {
+        a.push_back("--compress");
+    }
+    a.push_back(delta ? "--no-whole-file" : "--whole-file");
+    if (listOnly) {
+        a.push_back("--list-only");
+    }
+    if (relative) {
+        a.push_back("--relative");
+    }
+    if (acl) {
+        a.insert(a.end(), {"--acls", "--xattrs"});
+    }
+    if (debugLog) {
+        std::string log = logFile.empty() ? S2SPath(kDefaultLogFile) : logFile;
+        MakeParentDir(log);
+        a.push_back("--log-file=" + log);
+    }
+    if (progress) {
+        a.push_back("--info=progress2");
+    }
+    ConnectionOptions(&a);
+    for (const auto& rule : excludes) {
+        a.push_back("--exclude=" + rule);
+    }
+    a.push_back("--");
+    a.push_back(src);
+    a.push_back(Url(target));
+    Environment(&spec);
+    return Run(spec, cancel, false);
+}
+
+RsyncWrapper::RsyncWrapper() : impl_(new Impl) {}
+RsyncWrapper::~RsyncWrapper() = default;
+
+void RsyncWrapper::setSrcPath(std::string path) {
+    impl_->src = std::move(path);
+}
+void RsyncWrapper::setDestPath(std::string server, std::string user, std::string password,
+                               std::string dest, std::string module) {
+    impl_->server = std::move(server);
+    impl_->user = std::move(user);
+    impl_->password = std::move(password);
+    impl_->dest = std::move(dest);
+    impl_->module = std::move(module);
+}
+void RsyncWrapper::setSsh(bool on) {
+    impl_->ssh = on;
+}
+void RsyncWrapper::setPort(int port) {
+    impl_->port = port;
+}
+void RsyncWrapper::setCompress(bool on) {
+    impl_->compress = on;
+}
+void RsyncWrapper::setDeltaCopy(bool on) {
+    impl_->delta = on;
+}
+void RsyncWrapper::setListOnly(bool on) {
+    impl_->listOnly = on;
+}
+void RsyncWrapper::setRelativePath(bool on) {
+    impl_->relative = on;
+}
+void RsyncWrapper::setNumericIds(bool on) {
+    impl_->numericIds = on;
+}
+void RsyncWrapper::setDelete(bool on) {
+    impl_->deleteExtraneous = on;
+}
+void RsyncWrapper::setTimeout(int seconds) {
+    impl_->timeout = seconds;
+}
+void RsyncWrapper::setDebugLog(bool on) {
+    impl_->debugLog = on;
+}
+void RsyncWrapper::setExcludeRule(std::list<std::string> rules) {
+    impl_->excludes = std::move(rules);
+}
+void RsyncWrapper::setVurnAcl(bool on) {
+    impl_->acl = on;
+}
+void RsyncWrapper::setVurnAuth(bool on, bool strict) {
+    impl_->auth = on;
+    impl_->authStrict = strict;
+}
+void RsyncWrapper::setVurnPseudoRoot(bool on) {
+    impl_->pseudoRoot = on;
+}
+void RsyncWrapper::setVurnCustCmdRule(std::list<std::string> lines) {
+    impl_->cmdLines = std::move(lines);
+}
+void RsyncWrapper::setRsyncPath(std::string path) {
+    impl_->rsyncPath = std::move(path);
+}
+void RsyncWrapper::setConnectTimeout(int seconds) {
+    impl_->connectTimeout = seconds;
+}
+void RsyncWrapper::setCommandModule(std::string module) {
+    impl_->commandModule = std::move(module);
+}
+void RsyncWrapper::setServerPathModule(std::string serverPath, std::string module) {
+    while (serverPath.size() > 1 && serverPath.back() == '/') {
+        serverPath.pop_back();
+    }
+    impl_->pathModules[serverPath] = std::move(module);
+}
+void RsyncWrapper::setLogFile(std::string path) {
+    impl_->logFile = std::move(path);
+}
+void RsyncWrapper::setRemoteConfig(std::string path) {
+    impl_->remoteConfig = std::move(path);
+}
+void RsyncWrapper::setSshKnownHostsFile(std::string path) {
+    impl_->knownHosts = std::move(path);
+}
+void RsyncWrapper::setSshIdentityFile(std::string path) {
+    impl_->identity = std::move(path);
+}
+void RsyncWrapper::setProgressCallback(boost::function<void(int)> callback) {
+    impl_->progress = std::move(callback);
+}
+
+int RsyncWrapper::execute(boost::function<bool()> cancel) {
+    impl_->lastError.clear();
+    if (!impl_->cmdLines.empty()) {
+        return impl_->ExecuteCommand(cancel);
+    }
+    return impl_->ExecuteTransfer(cancel);
+}
+
+std::string RsyncWrapper::lastError() const {
+    return impl_->lastError;
+}
+
+}  // namespace Backup
+}  // namespace VURN

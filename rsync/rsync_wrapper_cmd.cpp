@@ -1,0 +1,195 @@
+// Custom commands: the command lines travel as rsync's early input to the server's command module,
+// prefixed by a reply token of the client's choosing; the same run pulls the reply directory of
+// that token, which holds the handler's result code and output file.
+#include <fcntl.h>
+#include <sys/random.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <sstream>
+
+#include "rsync/command_reply.h"
+#include "rsync/rsync_wrapper_impl.h"
+#include "s2s_logger.h"
+
+namespace VURN {
+namespace Backup {
+
+namespace {
+
+using S2S::Logger;
+using S2S::rsync_internal::ChildSpec;
+namespace reply = S2S::command_reply;
+
+// A directory private to this run (mode 0700), removed with its content on every path.
+class PrivateDir {
+  public:
+    PrivateDir() {
+        const char* base = std::getenv("TMPDIR");
+        std::string pattern =
+            std::string(base != nullptr && *base == '/' ? base : "/tmp") + "/s2s-cmd.XXXXXX";
+        std::vector<char> buffer(pattern.begin(), pattern.end());
+        buffer.push_back('\0');
+        if (mkdtemp(buffer.data()) != nullptr) {
+            path_ = buffer.data();
+        }
+    }
+    ~PrivateDir() {
+        if (!path_.empty()) {
+            reply::RemoveTree(path_);
+        }
+    }
+    PrivateDir(const PrivateDir&) = delete;
+    PrivateDir& operator=(const PrivateDir&) = delete;
+    const std::string& path() const { return path_; }
+
+  private:
+    std::string path_;
+};
+
+bool RandomToken(std::string* token) {
+    unsigned char bytes[reply::kTokenBytes];
+    size_t got = 0;
+    while (got < sizeof bytes) {
+        ssize_t n = getrandom(bytes + got, sizeof bytes - got, 0);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            return false;
+        }
+        got += static_cast<size_t>(n);
+    }
+    static const char kHex[] = "0123456789abcdef";
+    token->clear();
+    for (unsigned char b : bytes) {
+        token->push_back(kHex[b >> 4]);
+        token->push_back(kHex[b & 0xf]);
+    }
+    return true;
+}
+
+bool WriteWhole(const std::string& path, const std::string& content, int flags, mode_t mode) {
+    int fd = open(path.c_str(), flags | O_WRONLY | O_CLOEXEC, mode);
+    if (fd < 0) {
+        return false;
+    }
+    size_t done = 0;
+    bool ok = true;
+    while (done < content.size()) {
+        ssize_t n = write(fd, content.data() + done, content.size() - done);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            ok = false;
+            break;
+        }
+        done += static_cast<size_t>(n);
+    }
+    return close(fd) == 0 && ok;
+}
+
+// The local path the caller named in outfile="...", or "".
+std::string OutfileOf(const std::list<std::string>& lines) {
+    static const std::string kPrefix = "outfile=\"";
+    for (const auto& line : lines) {
+        if (line.size() > kPrefix.size() && line.compare(0, kPrefix.size(), kPrefix) == 0 &&
+            line.back() == '"') {
+            return line.substr(kPrefix.size(), line.size() - kPrefix.size() - 1);
+        }
+    }
+    return std::string();
+}
+
+}  // namespace
+
+int RsyncWrapper::Impl::ExecuteCommand(const boost::function<bool()>& cancel) {
+    std::string why = CheckConnection();
+    std::string input;
+    std::string token;
+    if (why.empty() && !RandomToken(&token)) {
+        why = "no random numbers for the reply token";
+    }
+    if (why.empty()) {
+        input = reply::TokenLine(token);
+        for (const auto& line : cmdLines) {
+            if (line.find('\n') != std::string::npos || line.find('\0') != std::string::npos) {
+                why = "a command line holds a line break or NUL";
+                break;
+            }
+            input += line + "\n";
+        }
+        if (input.size() > reply::kMaxCommandFile) {
+            why = "the command file is larger than the server accepts";
+        }
+    }
+    if (!why.empty()) {
+        lastError = why;
+        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__, why.c_str());
+        return kResultUsage;
+    }
+
+    PrivateDir dir;
+    const std::string inputFile = dir.path() + "/command";
+    const std::string replyDir = dir.path() + "/reply";
+    if (dir.path().empty() || !WriteWhole(inputFile, input, O_CREAT | O_EXCL, 0600)) {
+        lastError = std::string("cannot write the command file: ") + strerror(errno);
+        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__,
+                       lastError.c_str());
+        return kResultLocalFile;
+    }
+
+    ChildSpec spec;
+    // The reply is pulled whatever the list-only setting says: a command run copies nothing else.
+    spec.argv = {"--recursive", "--max-size=" + std::to_string(reply::kMaxOutput),
+                 "--early-input=" + inputFile};
+    ConnectionOptions(&spec.argv);
+    spec.argv.push_back("--");
+    spec.argv.push_back(Url(commandModule + "/" + token + "/"));
+    spec.argv.push_back(replyDir + "/");
+    Environment(&spec);
+    int rc = Run(spec, cancel, true);
+    if (rc != 0) {
+        return rc;
+    }
+
+    int result = 0;
+    std::ifstream resultFile(replyDir + "/" + reply::kResultFile);
+    std::stringstream text;
+    text << resultFile.rdbuf();
+    if (!resultFile.is_open() || !reply::ParseResult(text.str(), &result)) {
+        lastError = "the server's reply holds no result code";
+        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__,
+                       lastError.c_str());
+        return kResultBadReply;
+    }
+
+    std::string outfile = OutfileOf(cmdLines);
+    const std::string output = replyDir + "/" + reply::kOutputFile;
+    struct stat st;
+    if (!outfile.empty() && lstat(output.c_str(), &st) == 0) {
+        if (!S_ISREG(st.st_mode) || st.st_size > static_cast<off_t>(reply::kMaxOutput)) {
+            lastError = "the server's output file is not a plain file of at most 1 MiB";
+            return kResultBadReply;
+        }
+        std::ifstream in(output, std::ios::binary);
+        std::stringstream content;
+        content << in.rdbuf();
+        // The caller's file (from its temporary-file service) keeps its owner and mode.
+        if (!in.is_open() || !WriteWhole(outfile, content.str(), O_CREAT | O_TRUNC, 0600)) {
+            lastError = "cannot write the output file " + outfile + ": " + strerror(errno);
+            Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__,
+                           lastError.c_str());
+            return kResultLocalFile;
+        }
+    }
+    return result;
+}
+
+}  // namespace Backup
+}  // namespace VURN

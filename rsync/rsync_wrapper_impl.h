@@ -1,0 +1,76 @@
+// The wrapper's settings and the pieces of a run shared by its transfer and command paths.
+#ifndef S2S_RSYNC_RSYNC_WRAPPER_IMPL_H
+#define S2S_RSYNC_RSYNC_WRAPPER_IMPL_H
+
+#include <boost/function.hpp>
+#include <list>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "rsync/child_process.h"
+#include "s2s_rsync_wrapper.h"
+
+namespace VURN {
+namespace Backup {
+
+struct RsyncWrapper::Impl {
+    std::string src;
+    std::string server;
+    std::string user;
+    std::string password;  // only ever placed in the child's environment
+    std::string dest;
+    std::string module;
+    bool ssh = false;
+    int port = 0;  // 0: rsync's default port (873) or ssh's (22)
+    bool compress = false;
+    bool delta = true;
+    bool listOnly = false;
+    bool relative = false;
+    bool numericIds = false;
+    bool deleteExtraneous = false;
+    int timeout = 0;
+    int connectTimeout = 30;
+    bool debugLog = false;
+    std::list<std::string> excludes;
+    bool acl = false;
+    bool auth = false;
+    bool authStrict = false;
+    bool pseudoRoot = false;
+    std::list<std::string> cmdLines;
+
+    std::string rsyncPath = "rsync";
+    std::string commandModule = "@s2s-cmd";
+    std::map<std::string, std::string> pathModules;
+    std::string logFile;
+    std::string remoteConfig;
+    std::string knownHosts;
+    std::string identity;
+    boost::function<void(int)> progress;
+
+    std::string lastError;
+
+    Impl();
+
+    // "" when the connection settings are usable, else why not.
+    std::string CheckConnection() const;
+    // The rsync:// URL of `target` (a module, or module/path) on the server.
+    std::string Url(const std::string& target) const;
+    // The daemon target of setDestPath's dest/module; "" with `*why` set when there is none.
+    std::string TransferTarget(std::string* why) const;
+    // Options shared by every run: time-outs, the remote shell for ssh.
+    void ConnectionOptions(std::vector<std::string>* argv) const;
+    // The password and the remote shell's password in the child's environment only.
+    void Environment(S2S::rsync_internal::ChildSpec* spec) const;
+    // Runs rsync; keeps the last error lines; maps spawn failures and cancellation.
+    int Run(S2S::rsync_internal::ChildSpec& spec, const boost::function<bool()>& cancel,
+            bool commandRun);
+
+    int ExecuteTransfer(const boost::function<bool()>& cancel);
+    int ExecuteCommand(const boost::function<bool()>& cancel);
+};
+
+}  // namespace Backup
+}  // namespace VURN
+
+#endif  // S2S_RSYNC_RSYNC_WRAPPER_IMPL_H
