@@ -1,0 +1,139 @@
+// PStream: writes one PObject to a Channel in the library's compact tagged form and reads one
+// back (docs/wire-format.md describes the bytes). Each tag is one byte: 0x00 null (followed by a
+// length byte 0), 0x01 integer (length byte n in 1..8, then n big-endian bytes), 0x10 string
+// (16-bit big-endian length, then the bytes), 0x41 array and 0x42 map (contents, then the end tag
+// 0x40). There is no count, no overall length and no nesting limit.
+//
+// The reader takes bytes from other processes: whatever arrives, it ends with a status. Nesting
+// is followed on the heap, not on the call stack, so depth costs memory in proportion to the
+// bytes received and never the stack.
+//
+// Besides the codec a stream keeps diagnostics: the key path it is inside (logged on a failure),
+// the nesting depth (indentation of debug lines) and two status counters. Another thread may read
+// them (GetStatus) while one thread transfers a message.
+#ifndef S2S_STREAM_H
+#define S2S_STREAM_H
+
+#include <pthread.h>
+
+#include <atomic>
+#include <cstddef>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "s2s_channel.h"
+#include "s2s_export.h"
+#include "s2s_pobject.h"
+
+namespace S2S {
+
+class S2S_EXPORT PStream {
+  public:
+    enum : unsigned char {
+        kTagNull = 0x00,
+        kTagInteger = 0x01,
+        kTagString = 0x10,
+        kTagEnd = 0x40,    // '@'
+        kTagArray = 0x41,  // 'A'
+        kTagMap = 0x42,    // 'B'
+    };
+
+    PStream();
+    ~PStream();
+    PStream(const PStream&) = delete;
+    PStream& operator=(const PStream&) = delete;
+
+    // One whole message: the object, then a flush. The state is cleared afterwards, and after a
+    // failure the key path is logged first. Results: 0, -1 (unknown type code), -2 (channel).
+    int Send(Channel& channel, const PObject& object);
+    // One whole message. Receiving into a non-empty container adds to it (arrays append, maps
+    // merge key by key); a failure keeps what was received so far. Results: 0, -2, -5.
+    int Recv(Channel& channel, PObject& object);
+
+    int SendObject(Channel& channel, const PObject& object);
+    // Reads a tag, then the value that follows it.
+    int RecvObject(Channel& channel, PObject& object);
+    int RecvTag(Channel& channel, unsigned char& tag);
+    // Reads the value that follows `tag` into `object`.
+    int RecvDispatch(Channel& channel, unsigned char tag, PObject& object);
+
+    // The sends write their own tag; the receives expect it consumed already.
+    int Send(Channel& channel, unsigned long long value);
+    int Recv(Channel& channel, unsigned long long& value);
+    // Only the low 16 bits of the length go on the wire, then every byte: callers keep strings
+    // shorter than 65536 bytes. The reader keeps a string only up to its first NUL byte.
+    int Send(Channel& channel, const std::string& value);
+    int Recv(Channel& channel, std::string& value);
+    int SendNull(Channel& channel);
+    int Send(Channel& channel, const std::vector<PObject>& array);
+    int Recv(Channel& channel, std::vector<PObject>& array);
+    // A key's one leading underscore is dropped on the wire (and not restored by the reader).
+    int Send(Channel& channel, const std::map<std::string, PObject>& map);
+    int Recv(Channel& channel, std::map<std::string, PObject>& map);
+    // Unknown tags cannot be skipped: the format carries no length for them. Always -5.
+    int Skip(Channel& channel, unsigned char tag);
+
+    // Wire tag and PObject type code of a storage type (unsigned long long, std::string,
+    // PObject::Array, PObject::Map).
+    template <typename T>
+    static unsigned char GetTag();
+    template <typename T>
+    static int GetType() {
+        return PObject::type_trait<T>();
+    }
+    static void GetVersion(unsigned& major, unsigned& minor, unsigned& patch);
+
+    void UpdateStatus(unsigned long long a, unsigned long long b);
+    void GetStatus(std::string& path, unsigned long long& a, unsigned long long& b);
+    // The key path joined with "."; takes no lock (callers hold it or own the stream).
+    std::string GetHistory();
+    void DumpHistory();
+    void ClearHistory();
+    // Stored only.
+    void SetDefaultRecvLocation(const std::string& path);
+
+  private:
+    struct Frame;
+
+    int Decode(Channel& channel, PObject* slot, bool have_tag, unsigned char tag,
+               std::vector<PObject>* array, std::map<std::string, PObject>* map);
+    int Encode(Channel& channel, const PObject* object, const std::vector<PObject>* array,
+               const std::map<std::string, PObject>* map);
+    int SendKey(Channel& channel, const char* key, size_t length);
+    int ChannelFailure(int status);
+    void ResetStatus();
+    void PushKey(const char* key, size_t length);
+    void PopKey();
+    const char* Indent() const;
+
+    // The key path is history_[0 .. history_size_): popped entries keep their storage for reuse.
+    std::vector<std::string> history_;
+    size_t history_size_ = 0;
+    std::atomic<unsigned long long> status_b_{0};
+    std::atomic<unsigned long long> status_a_{0};
+    pthread_mutex_t mutex_;
+    int depth_ = 0;
+    std::string recv_location_;
+};
+
+template <>
+inline unsigned char PStream::GetTag<unsigned long long>() {
+    return kTagInteger;
+}
+template <>
+inline unsigned char PStream::GetTag<std::string>() {
+    return kTagString;
+}
+template <>
+inline unsigned char PStream::GetTag<PObject::Array>() {
+    return kTagArray;
+}
+template <>
+inline unsigned char PStream::GetTag<PObject::Map>() {
+    return kTagMap;
+}
+
+}  // namespace S2S
+
+#endif  // S2S_STREAM_H

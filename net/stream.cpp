@@ -1,0 +1,601 @@
+#include "s2s_stream.h"
+
+#include <algorithm>
+#include <cstring>
+#include <memory>
+
+#include "s2s_logger.h"
+#include "s2s_status.h"
+
+namespace S2S {
+
+namespace {
+
+// Debug lines are indented two blanks per level, up to eleven levels; nesting itself is unlimited.
+const char* const kIndent[] = {
+    "",
+    "  ",
+    "    ",
+    "      ",
+    "        ",
+    "          ",
+    "            ",
+    "              ",
+    "                ",
+    "                  ",
+    "                    ",
+    "                      ",
+};
+constexpr int kMaxIndent = 11;
+
+// The byte count of the smallest of 1, 2, 4, 8 that holds the value.
+unsigned char IntegerLength(unsigned long long value) {
+    if ((value >> 8) == 0) {
+        return 1;
+    }
+    if ((value >> 16) == 0) {
+        return 2;
+    }
+    if ((value >> 32) == 0) {
+        return 4;
+    }
+    return 8;
+}
+
+// The wire form of a map key: one leading underscore is dropped.
+const char* WireKey(const std::string& key, size_t& length) {
+    if (!key.empty() && key[0] == '_') {
+        length = key.size() - 1;
+        return key.data() + 1;
+    }
+    length = key.size();
+    return key.data();
+}
+
+}  // namespace
+
+// One open container of the decoder. The decoder keeps these on the heap so that nesting depth
+// never reaches the call stack. `pending` is set while the container's current entry is being
+// read: for an array that entry is its last element, which is dropped again if it fails.
+struct PStream::Frame {
+    std::vector<PObject>* array;
+    std::map<std::string, PObject>* map;
+    bool pending;
+};
+
+PStream::PStream() {
+    pthread_mutex_init(&mutex_, nullptr);
+}
+
+PStream::~PStream() {
+    pthread_mutex_destroy(&mutex_);
+}
+
+int PStream::Send(Channel& channel, const PObject& object) {
+    int ret = SendObject(channel, object);
+    if (ret < 0) {
+        DumpHistory();
+        ClearHistory();
+        return ret;
+    }
+    ret = channel.FlushWrite(0);
+    if (ret < 0) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_stream.cpp(%d): Channel: %d\n", __LINE__,
+                       ret);
+        ClearHistory();
+        return kStatusIOError;
+    }
+    ClearHistory();
+    return kStatusSuccessful;
+}
+
+int PStream::Recv(Channel& channel, PObject& object) {
+    int ret = RecvObject(channel, object);
+    if (ret < 0) {
+        DumpHistory();
+    }
+    ClearHistory();
+    return ret < 0 ? ret : kStatusSuccessful;
+}
+
+int PStream::SendObject(Channel& channel, const PObject& object) {
+    return Encode(channel, &object, nullptr, nullptr);
+}
+
+int PStream::RecvObject(Channel& channel, PObject& object) {
+    return Decode(channel, &object, false, 0, nullptr, nullptr);
+}
+
+int PStream::RecvTag(Channel& channel, unsigned char& tag) {
+    int ret = channel.ReadByte(&tag);
+    return ret < 0 ? ChannelFailure(ret) : kStatusSuccessful;
+}
+
+int PStream::RecvDispatch(Channel& channel, unsigned char tag, PObject& object) {
+    return Decode(channel, &object, true, tag, nullptr, nullptr);
+}
+
+int PStream::Send(Channel& channel, unsigned long long value) {
+    ResetStatus();
+    unsigned char length = IntegerLength(value);
+    unsigned char bytes[8];
+    for (int i = length - 1; i >= 0; --i) {
+        bytes[i] = static_cast<unsigned char>(value >> (8 * (length - 1 - i)));
+    }
+    int ret = channel.WriteByte(kTagInteger);
+    if (ret >= 0) {
+        ret = channel.WriteByte(length);
+    }
+    if (ret >= 0) {
+        ret = channel.Write(reinterpret_cast<const char*>(bytes), length);
+    }
+    if (ret < 0) {
+        return ChannelFailure(ret);
+    }
+    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%llu\n", __LINE__, Indent(),
+                   value);
+    return kStatusSuccessful;
+}
+
+int PStream::Recv(Channel& channel, unsigned long long& value) {
+    ResetStatus();
+    unsigned char length = 0;
+    int ret = channel.ReadByte(&length);
+    if (ret < 0) {
+        return ChannelFailure(ret);
+    }
+    // A conforming writer never uses more than 8 bytes; reading more would lose the high bytes.
+    if (length > 8) {
+        Logger::LogMsg(Logger::Error,
+                       "[ERROR] s2s_stream.cpp(%d): integer length %u is more than 8 bytes\n",
+                       __LINE__, length);
+        return kStatusProtocolError;
+    }
+    unsigned char bytes[8];
+    if (length > 0) {
+        ret = channel.Read(reinterpret_cast<char*>(bytes), length);
+        if (ret < 0) {
+            return ChannelFailure(ret);
+        }
+    }
+    unsigned long long result = 0;
+    for (unsigned i = 0; i < length; ++i) {
+        result = (result << 8) + bytes[i];
+    }
+    value = result;
+    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%llu\n", __LINE__, Indent(),
+                   value);
+    return kStatusSuccessful;
+}
+
+int PStream::Send(Channel& channel, const std::string& value) {
+    ResetStatus();
+    int ret = channel.WriteByte(kTagString);
+    if (ret >= 0) {
+        // Only the low 16 bits of the length fit, but every byte is written: the format's own
+        // limit, which callers respect.
+        ret = channel.WriteInt16(static_cast<unsigned short>(value.size() & 0xFFFF));
+    }
+    // One channel write carries at most its capacity.
+    const size_t step = std::max(1u, channel.GetCapacity());
+    for (size_t done = 0; ret >= 0 && done < value.size(); done += step) {
+        size_t len = std::min(step, value.size() - done);
+        ret = channel.Write(value.data() + done, static_cast<unsigned int>(len));
+    }
+    if (ret < 0) {
+        return ChannelFailure(ret);
+    }
+    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(),
+                   value.c_str());
+    return kStatusSuccessful;
+}
+
+int PStream::Recv(Channel& channel, std::string& value) {
+    ResetStatus();
+    unsigned short length = 0;
+    int ret = channel.ReadInt16(&length);
+    if (ret < 0) {
+        return ChannelFailure(ret);
+    }
+    // Short strings (keys, most values) are read on the stack; a length is at most 65535.
+    char small[256];
+    std::unique_ptr<char[]> large;
+    char* buf = small;
+    if (length > sizeof(small)) {
+        large.reset(new char[length]);
+        buf = large.get();
+    }
+    if (length > 0) {
+        ret = channel.Read(buf, length);
+        if (ret < 0) {
+            return ChannelFailure(ret);
+        }
+    }
+    // Only the bytes up to the first NUL are kept, as the format always did.
+    value.assign(buf, strnlen(buf, length));
+    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(),
+                   value.c_str());
+    return kStatusSuccessful;
+}
+
+int PStream::SendNull(Channel& channel) {
+    ResetStatus();
+    int ret = channel.WriteByte(kTagNull);
+    if (ret >= 0) {
+        ret = channel.WriteByte(0);
+    }
+    return ret < 0 ? ChannelFailure(ret) : kStatusSuccessful;
+}
+
+int PStream::Send(Channel& channel, const std::vector<PObject>& array) {
+    return Encode(channel, nullptr, &array, nullptr);
+}
+
+int PStream::Recv(Channel& channel, std::vector<PObject>& array) {
+    return Decode(channel, nullptr, false, 0, &array, nullptr);
+}
+
+int PStream::Send(Channel& channel, const std::map<std::string, PObject>& map) {
+    return Encode(channel, nullptr, nullptr, &map);
+}
+
+int PStream::Recv(Channel& channel, std::map<std::string, PObject>& map) {
+    return Decode(channel, nullptr, false, 0, nullptr, &map);
+}
+
+int PStream::Skip(Channel& /*channel*/, unsigned char /*tag*/) {
+    return kStatusProtocolError;
+}
+
+void PStream::GetVersion(unsigned& major, unsigned& minor, unsigned& patch) {
+    major = 1;
+    minor = 0;
+    patch = 0;
+}
+
+void PStream::UpdateStatus(unsigned long long a, unsigned long long b) {
+    pthread_mutex_lock(&mutex_);
+    status_a_.store(a, std::memory_order_relaxed);
+    status_b_.store(b, std::memory_order_relaxed);
+    pthread_mutex_unlock(&mutex_);
+}
+
+void PStream::GetStatus(std::string& path, unsigned long long& a, unsigned long long& b) {
+    pthread_mutex_lock(&mutex_);
+    path = GetHistory();
+    a = status_a_.load(std::memory_order_relaxed);
+    b = status_b_.load(std::memory_order_relaxed);
+    pthread_mutex_unlock(&mutex_);
+}
+
+std::string PStream::GetHistory() {
+    std::string path;
+    for (size_t i = 0; i < history_size_; ++i) {
+        if (i > 0) {
+            path += '.';
+        }
+        path += history_[i];
+    }
+    return path;
+}
+
+void PStream::DumpHistory() {
+    pthread_mutex_lock(&mutex_);
+    Logger::LogMsg(Logger::Error, "[ERROR] s2s_stream.cpp(%d): Error stack: %s\n", __LINE__,
+                   GetHistory().c_str());
+    pthread_mutex_unlock(&mutex_);
+}
+
+void PStream::ClearHistory() {
+    pthread_mutex_lock(&mutex_);
+    history_.clear();
+    history_size_ = 0;
+    status_a_.store(0, std::memory_order_relaxed);
+    status_b_.store(0, std::memory_order_relaxed);
+    pthread_mutex_unlock(&mutex_);
+    depth_ = 0;
+}
+
+void PStream::SetDefaultRecvLocation(const std::string& path) {
+    recv_location_ = path;
+}
+
+int PStream::ChannelFailure(int status) {
+    Logger::LogMsg(Logger::Warning, "[WARNING] s2s_stream.cpp(%d): Channel: %d\n", __LINE__,
+                   status);
+    return kStatusIOError;
+}
+
+void PStream::ResetStatus() {
+    // Every primitive resets the counters. When both already read 0 the reset changes nothing, so
+    // the common case skips the lock; a concurrent UpdateStatus is simply ordered after it.
+    if (status_a_.load(std::memory_order_relaxed) == 0 &&
+        status_b_.load(std::memory_order_relaxed) == 0) {
+        return;
+    }
+    UpdateStatus(0, 0);
+}
+
+void PStream::PushKey(const char* key, size_t length) {
+    pthread_mutex_lock(&mutex_);
+    // Popped entries keep their storage, so a steady stream of maps does not allocate here.
+    if (history_size_ == history_.size()) {
+        history_.emplace_back();
+    }
+    history_[history_size_++].assign(key, length);
+    pthread_mutex_unlock(&mutex_);
+}
+
+void PStream::PopKey() {
+    pthread_mutex_lock(&mutex_);
+    if (history_size_ > 0) {
+        --history_size_;
+    }
+    pthread_mutex_unlock(&mutex_);
+}
+
+const char* PStream::Indent() const {
+    return kIndent[std::min(std::max(depth_, 0), kMaxIndent)];
+}
+
+int PStream::Encode(Channel& channel, const PObject* object, const std::vector<PObject>* array,
+                    const std::map<std::string, PObject>* map) {
+    // Containers are walked with an explicit stack, like the decoder, so that any tree the
+    // decoder accepted can be sent on again whatever its depth.
+    struct Walk {
+        const std::vector<PObject>* array;
+        size_t index;
+        const std::map<std::string, PObject>* map;
+        std::map<std::string, PObject>::const_iterator next;
+        bool key_pushed;
+    };
+    std::vector<Walk> stack;
+    auto open_array = [&](const std::vector<PObject>& a) {
+        int ret = channel.WriteByte(kTagArray);
+        if (ret < 0) {
+            return ChannelFailure(ret);
+        }
+        Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s[\n", __LINE__, Indent());
+        ++depth_;
+        stack.push_back(Walk{&a, 0, nullptr, {}, false});
+        return 0;
+    };
+    auto open_map = [&](const std::map<std::string, PObject>& m) {
+        int ret = channel.WriteByte(kTagMap);
+        if (ret < 0) {
+            return ChannelFailure(ret);
+        }
+        Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s{\n", __LINE__, Indent());
+        ++depth_;
+        stack.push_back(Walk{nullptr, 0, &m, m.begin(), false});
+        return 0;
+    };
+
+    int ret = 0;
+    if (array != nullptr) {
+        ret = open_array(*array);
+    } else if (map != nullptr) {
+        ret = open_map(*map);
+    }
+    const PObject* value = object;
+    while (ret >= 0) {
+        if (value != nullptr) {
+            const PObject& current = *value;
+            value = nullptr;
+            if (current.isNull()) {
+                ret = SendNull(channel);
+            } else if (current.isInteger()) {
+                ret = Send(channel, current.asUInt64());
+            } else if (current.isString()) {
+                ret = Send(channel, current.asString());
+            } else if (current.isMap()) {
+                ret = open_map(current.asMap());
+                continue;
+            } else if (current.isArray()) {
+                ret = open_array(current.asArray());
+                continue;
+            } else {
+                return kStatusInterrupted;  // unknown type code: nothing is written
+            }
+            if (ret < 0) {
+                break;
+            }
+        }
+        if (stack.empty()) {
+            return kStatusSuccessful;
+        }
+        Walk& top = stack.back();
+        if (top.key_pushed) {  // the previous value went out whole
+            PopKey();
+            top.key_pushed = false;
+        }
+        bool at_end =
+            top.array != nullptr ? top.index == top.array->size() : top.next == top.map->end();
+        if (at_end) {
+            bool is_array = top.array != nullptr;
+            ret = channel.WriteByte(kTagEnd);
+            if (ret < 0) {
+                return ChannelFailure(ret);
+            }
+            --depth_;
+            Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
+                           is_array ? "]" : "}");
+            stack.pop_back();
+            continue;
+        }
+        if (top.array != nullptr) {
+            value = &(*top.array)[top.index++];
+            continue;
+        }
+        size_t length = 0;
+        const char* key = WireKey(top.next->first, length);
+        ret = SendKey(channel, key, length);
+        if (ret < 0) {
+            break;
+        }
+        PushKey(key, length);
+        top.key_pushed = true;
+        value = &top.next->second;
+        ++top.next;
+    }
+    // A failure leaves the key path of the failing value on the history.
+    return ret;
+}
+
+int PStream::SendKey(Channel& channel, const char* key, size_t length) {
+    // Keys are strings on the wire; written here without building a copy of the key.
+    ResetStatus();
+    int ret = channel.WriteByte(kTagString);
+    if (ret >= 0) {
+        ret = channel.WriteInt16(static_cast<unsigned short>(length & 0xFFFF));
+    }
+    const size_t step = std::max(1u, channel.GetCapacity());
+    for (size_t done = 0; ret >= 0 && done < length; done += step) {
+        ret = channel.Write(key + done, static_cast<unsigned int>(std::min(step, length - done)));
+    }
+    if (ret < 0) {
+        return ChannelFailure(ret);
+    }
+    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s\"%.*s\"\n", __LINE__, Indent(),
+                   static_cast<int>(length), key);
+    return kStatusSuccessful;
+}
+
+int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned char tag,
+                    std::vector<PObject>* array, std::map<std::string, PObject>* map) {
+    std::vector<Frame> stack;
+    auto open = [&](std::vector<PObject>* a, std::map<std::string, PObject>* m) {
+        Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
+                       a != nullptr ? "[" : "{");
+        ++depth_;
+        stack.push_back(Frame{a, m, false});
+    };
+    if (array != nullptr || map != nullptr) {
+        open(array, map);
+    }
+
+    int ret = 0;
+    std::string text;
+    for (;;) {
+        bool completed = false;  // a whole value (primitive or closed container) was read
+        if (slot != nullptr) {
+            PObject& target = *slot;
+            slot = nullptr;
+            if (!have_tag) {
+                ret = RecvTag(channel, tag);
+                if (ret < 0) {
+                    break;
+                }
+            }
+            have_tag = false;
+            switch (tag) {
+                case kTagString:
+                    // A string object is read into in place; anything else becomes one first.
+                    if (!target.isString() || target.isNull()) {
+                        target = std::string();
+                    }
+                    ret = Recv(channel, text);
+                    if (ret >= 0) {
+                        target = text;
+                    }
+                    break;
+                case kTagInteger: {
+                    if (!target.isInteger() || target.isNull()) {
+                        target = 0ULL;
+                    }
+                    unsigned long long value = 0;
+                    ret = Recv(channel, value);
+                    if (ret >= 0) {
+                        target = value;
+                    }
+                    break;
+                }
+                case kTagArray:
+                    open(&target.asArray(), nullptr);  // appends to an array already there
+                    continue;
+                case kTagMap:
+                    open(nullptr, &target.asMap());  // merges into a map already there
+                    continue;
+                case kTagNull: {
+                    unsigned char length = 0;
+                    ret = channel.ReadByte(&length);
+                    if (ret < 0) {
+                        ret = ChannelFailure(ret);
+                    } else if (length != 0) {
+                        Logger::LogMsg(
+                            Logger::Error,
+                            "[ERROR] s2s_stream.cpp(%d): expect length 0, but we've got %u\n",
+                            __LINE__, length);
+                        ret = kStatusProtocolError;
+                    } else {
+                        target.clear();
+                    }
+                    break;
+                }
+                default:  // the end tag where a value belongs, or a tag this format lacks
+                    ret = Skip(channel, tag);
+                    break;
+            }
+            if (ret < 0) {
+                break;
+            }
+            completed = true;
+        } else {
+            Frame& top = stack.back();
+            ret = RecvTag(channel, tag);
+            if (ret < 0) {
+                break;
+            }
+            if (tag == kTagEnd) {
+                bool is_array = top.array != nullptr;
+                --depth_;
+                Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__,
+                               Indent(), is_array ? "]" : "}");
+                stack.pop_back();
+                completed = true;
+            } else if (top.array != nullptr) {
+                top.array->emplace_back();
+                top.pending = true;
+                slot = &top.array->back();
+                have_tag = true;
+            } else if (tag != kTagString) {
+                Logger::LogMsg(Logger::Error,
+                               "[ERROR] s2s_stream.cpp(%d): PStream: expect string, but get tag "
+                               "%u\n",
+                               __LINE__, tag);
+                ret = kStatusProtocolError;
+                break;
+            } else {
+                ret = Recv(channel, text);
+                if (ret < 0) {
+                    break;
+                }
+                PushKey(text.data(), text.size());
+                top.pending = true;
+                slot = &(*top.map)[text];
+            }
+        }
+        if (completed) {
+            if (stack.empty()) {
+                return kStatusSuccessful;
+            }
+            Frame& top = stack.back();
+            if (top.pending) {
+                if (top.map != nullptr) {
+                    PopKey();
+                }
+                top.pending = false;
+            }
+        }
+    }
+    // An array element that failed is not kept; a map entry keeps what arrived of its value, and
+    // the key path of the failure stays on the history.
+    for (auto it = stack.rbegin(); it != stack.rend(); ++it) {
+        if (it->array != nullptr && it->pending) {
+            it->array->pop_back();
+        }
+    }
+    return ret;
+}
+
+}  // namespace S2S
