@@ -1,0 +1,175 @@
+// The per-thread last platform error, and small helpers the platform sources share.
+#include <errno.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "platform/platform_internal.h"
+#include "s2s_platform.h"
+
+namespace s2s_platform {
+
+// Not in an anonymous namespace: the exported C accessors below reach it by name.
+thread_local int last_error = VLIB_ERR_NONE;
+
+void SetError(int err) {
+    last_error = err;
+}
+
+int Fail(int err) {
+    last_error = err;
+    return -1;
+}
+
+int Succeed(int result) {
+    last_error = VLIB_ERR_NONE;
+    return result;
+}
+
+int ErrorFromErrno(int errnum) {
+    switch (errnum) {
+        case ENOENT:
+        case ENOTDIR:
+            return VLIB_ERR_FILE_NOT_FOUND;
+        case EACCES:
+        case EPERM:
+        case EROFS:
+            return VLIB_ERR_ACCESS;
+        case ENOMEM:
+            return VLIB_ERR_OUT_OF_MEMORY;
+        default:
+            return VLIB_ERR_IO;
+    }
+}
+
+int ReadWholeFd(int fd, std::string& out, size_t limit) {
+    out.clear();
+    char chunk[65536];
+    for (;;) {
+        ssize_t n = read(fd, chunk, sizeof(chunk));
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            return -1;
+        }
+        if (n == 0) {
+            return 0;
+        }
+        if (out.size() + static_cast<size_t>(n) > limit) {
+            errno = EFBIG;
+            return -1;
+        }
+        out.append(chunk, static_cast<size_t>(n));
+    }
+}
+
+int ReadWholeFile(const std::string& path, std::string& out, size_t limit) {
+    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+        return -1;
+    }
+    int rc = ReadWholeFd(fd, out, limit);
+    int saved = errno;
+    close(fd);
+    errno = saved;
+    return rc;
+}
+
+int MakeDirs(const std::string& dir) {
+    if (dir.empty()) {
+        errno = EINVAL;
+        return -1;
+    }
+    struct stat st;
+    if (stat(dir.c_str(), &st) == 0) {
+        if (S_ISDIR(st.st_mode)) {
+            return 0;
+        }
+        errno = ENOTDIR;
+        return -1;
+    }
+    size_t slash = dir.find_last_of('/');
+    if (slash != std::string::npos && slash > 0) {
+        if (MakeDirs(dir.substr(0, slash)) != 0) {
+            return -1;
+        }
+    }
+    if (mkdir(dir.c_str(), 0755) != 0 && errno != EEXIST) {
+        return -1;
+    }
+    return 0;
+}
+
+std::string Trim(const std::string& text) {
+    const char* blanks = " \t\r\n";
+    size_t begin = text.find_first_not_of(blanks);
+    if (begin == std::string::npos) {
+        return std::string();
+    }
+    size_t end = text.find_last_not_of(blanks);
+    return text.substr(begin, end - begin + 1);
+}
+
+int CopyOut(const std::string& value, char* buf, int size) {
+    if (buf == nullptr || size <= 0) {
+        return Fail(VLIB_ERR_BAD_PARAMETER);
+    }
+    if (value.size() >= static_cast<size_t>(size)) {
+        buf[0] = '\0';
+        return Fail(VLIB_ERR_BUFFER_TOO_SMALL);
+    }
+    std::memcpy(buf, value.c_str(), value.size() + 1);
+    return Succeed(static_cast<int>(value.size()));
+}
+
+}  // namespace s2s_platform
+
+extern "C" {
+
+int VLIBCErrGet(void) {
+    return s2s_platform::last_error;
+}
+
+void VLIBCErrSet(int err) {
+    s2s_platform::last_error = err;
+}
+
+const char* VLIBCErrStr(int err) {
+    switch (err) {
+        case VLIB_ERR_NONE:
+            return "Success";
+        case VLIB_ERR_BAD_PARAMETER:
+            return "Invalid parameter";
+        case VLIB_ERR_OUT_OF_MEMORY:
+            return "Out of memory";
+        case VLIB_ERR_FILE_NOT_FOUND:
+            return "No such file";
+        case VLIB_ERR_ACCESS:
+            return "Permission denied";
+        case VLIB_ERR_IO:
+            return "Input/output error";
+        case VLIB_ERR_BUFFER_TOO_SMALL:
+            return "Buffer too small";
+        case VLIB_ERR_RESOLVE:
+            return "Name resolution failed";
+        case VLIB_ERR_SEMAPHORE:
+            return "Semaphore operation failed";
+        case VLIB_ERR_NOT_FOUND:
+            return "No such section, key or share";
+        case VLIB_ERR_BAD_FORMAT:
+            return "Malformed file content";
+        case VLIB_ERR_SERVICE_ALREADY:
+            return "Service already in the wanted state";
+        case VLIB_ERR_SERVICE_UNKNOWN:
+            return "No such service";
+        case VLIB_ERR_SERVICE_FAILED:
+            return "Service control failed";
+        default:
+            return "Unknown error";
+    }
+}
+
+}  // extern "C"
