@@ -1,0 +1,369 @@
+#include "s2s_stream.h"
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "net/transport_test_util.h"
+#include "s2s_status.h"
+
+namespace {
+
+using S2S::Channel;
+using S2S::PObject;
+using S2S::PStream;
+using s2s_test::LogCapture;
+using s2s_test::Peer;
+using s2s_test::SocketPair;
+using s2s_test::WriteAll;
+
+// One message sent through a real channel; the bytes that reached the peer.
+std::string Encode(const PObject& object, unsigned int capacity = 4096) {
+    SocketPair pair;
+    std::string bytes;
+    Peer reader([&] { bytes = s2s_test::ReadToEnd(pair.b()); });
+    {
+        Channel channel(capacity);
+        EXPECT_EQ(0, channel.Open(pair.ReleaseA(), true));
+        PStream stream;
+        EXPECT_EQ(0, stream.Send(channel, object));
+    }  // closing the channel ends the reader
+    reader.Join();
+    return bytes;
+}
+
+// Receives one message from `bytes` (the peer closes after them) into `object`.
+int Decode(const std::string& bytes, PObject& object, unsigned int capacity = 4096) {
+    SocketPair pair;
+    Peer writer([&] {
+        WriteAll(pair.b(), bytes);
+        pair.CloseB();
+    });
+    Channel channel(capacity);
+    EXPECT_EQ(0, channel.Open(pair.ReleaseA(), true));
+    PStream stream;
+    int ret = stream.Recv(channel, object);
+    writer.Join();
+    return ret;
+}
+
+std::string Bytes(std::initializer_list<int> values) {
+    std::string out;
+    for (int v : values) {
+        out.push_back(static_cast<char>(v));
+    }
+    return out;
+}
+
+PObject Array(std::initializer_list<PObject> items) {
+    PObject out;
+    out = PObject::Array(items);
+    return out;
+}
+
+TEST(PStreamTest, PrimitiveEncodings) {
+    EXPECT_EQ(Bytes({0x00, 0x00}), Encode(PObject()));
+    EXPECT_EQ(Bytes({0x01, 0x01, 0x00}), Encode(PObject(0ULL)));
+    EXPECT_EQ(Bytes({0x01, 0x01, 0xFF}), Encode(PObject(255ULL)));
+    EXPECT_EQ(Bytes({0x01, 0x02, 0x01, 0x00}), Encode(PObject(256ULL)));
+    EXPECT_EQ(Bytes({0x01, 0x04, 0x00, 0x01, 0x00, 0x00}), Encode(PObject(65536ULL)));
+    EXPECT_EQ(Bytes({0x01, 0x08, 0x00, 0x00, 0x00, 0x01, 0x00, 0x00, 0x00, 0x00}),
+              Encode(PObject(4294967296ULL)));
+    EXPECT_EQ(Bytes({0x10, 0x00, 0x00}), Encode(PObject("")));
+    EXPECT_EQ(Bytes({0x10, 0x00, 0x03, 'a', 'b', 'c'}), Encode(PObject("abc")));
+    PObject array;
+    array.asArray();
+    EXPECT_EQ(Bytes({0x41, 0x40}), Encode(array));
+    PObject map;
+    map.asMap();
+    EXPECT_EQ(Bytes({0x42, 0x40}), Encode(map));
+}
+
+TEST(PStreamTest, MapKeysLoseOneLeadingUnderscore) {
+    PObject map;
+    map["_a"] = 1ULL;
+    EXPECT_EQ(Bytes({0x42, 0x10, 0x00, 0x01, 'a', 0x01, 0x01, 0x01, 0x40}), Encode(map));
+    PObject back;
+    ASSERT_EQ(0, Decode(Encode(map), back));
+    EXPECT_EQ("{\"a\": 1}", back.toString());
+
+    PObject keys;
+    keys["__x"] = "v";
+    keys[""] = PObject();
+    ASSERT_EQ(0, Decode(Encode(keys), back = PObject()));
+    EXPECT_EQ("{\"\": null, \"_x\": \"v\"}", back.toString());
+}
+
+TEST(PStreamTest, NestedValuesRoundTripAcrossSmallRings) {
+    // A task-like map: every kind, nested, with strings longer than the channel capacity.
+    PObject task;
+    task["name"] = "nightly";
+    task["id"] = 42ULL;
+    task["big"] = 18446744073709551615ULL;
+    task["none"] = PObject();
+    task["shares"] = Array({PObject("music"), PObject("photos"), PObject(std::string(300, 'p'))});
+    task["sync_info"]["server"] = "10.0.0.2";
+    task["sync_info"]["options"]["compress"] = 1ULL;
+    task["sync_info"]["options"]["list"] = Array({Array({}), PObject(), PObject(7ULL)});
+    std::string bytes = Encode(task, 16);
+    EXPECT_EQ(bytes, Encode(task, 4096));  // the ring size never shows on the wire
+    PObject back;
+    ASSERT_EQ(0, Decode(bytes, back, 16));
+    EXPECT_EQ(task.toString(), back.toString());
+}
+
+TEST(PStreamTest, StringsKeepOnlyTheBytesBeforeANul) {
+    PObject back;
+    ASSERT_EQ(0, Decode(Bytes({0x10, 0x00, 0x04, 'a', 'b', 0x00, 'c'}), back));
+    EXPECT_TRUE(back.isString());
+    EXPECT_EQ("ab", back.asString());
+    // The bytes after the NUL were consumed: the next value follows them.
+    ASSERT_EQ(0, Decode(Bytes({0x41, 0x10, 0x00, 0x02, 0x00, 'x', 0x01, 0x01, 0x05, 0x40}),
+                        back = PObject()));
+    EXPECT_EQ("[\"\", 5]", back.toString());
+}
+
+TEST(PStreamTest, NullWithLengthIsAProtocolError) {
+    LogCapture log;
+    PObject back("before");
+    EXPECT_EQ(S2S::kStatusProtocolError, Decode(Bytes({0x00, 0x05}), back));
+    EXPECT_TRUE(log.Contains("[ERROR] s2s_stream.cpp("));
+    EXPECT_TRUE(log.Contains("): expect length 0, but we've got 5\n"));
+    EXPECT_TRUE(log.Contains("): Error stack: \n"));
+    EXPECT_EQ("before", back.asString());
+}
+
+TEST(PStreamTest, IntegerLengthAboveEightIsRefused) {
+    PObject back;
+    EXPECT_EQ(S2S::kStatusProtocolError,
+              Decode(Bytes({0x01, 0x09, 1, 2, 3, 4, 5, 6, 7, 8, 9}), back));
+    ASSERT_EQ(0, Decode(Bytes({0x01, 0x00}), back));  // no value bytes: 0
+    EXPECT_TRUE(back.isInteger());
+    EXPECT_EQ(0u, back.asUInt64());
+}
+
+TEST(PStreamTest, FailingArrayElementIsNotAppended) {
+    PObject back;
+    EXPECT_EQ(S2S::kStatusProtocolError, Decode(Bytes({0x41, 0x01, 0x01, 0x09, 0x07, 0x40}), back));
+    EXPECT_EQ("[9]", back.toString());
+    // The end tag where a value belongs is an unknown value too.
+    EXPECT_EQ(S2S::kStatusProtocolError, Decode(Bytes({0x40}), back = PObject()));
+    // A nested array that fails is dropped whole.
+    EXPECT_EQ(S2S::kStatusProtocolError,
+              Decode(Bytes({0x41, 0x41, 0x41, 0x01, 0x01, 0x01, 0x41, 0x99}), back = PObject()));
+    EXPECT_EQ("[]", back.toString());
+}
+
+TEST(PStreamTest, FailureInsideMapsLogsTheKeyPath) {
+    LogCapture log;
+    // {"a": {"b": {"c": <tag 0x07>}}}
+    std::string bytes = Bytes({0x42, 0x10, 0x00, 0x01, 'a', 0x42, 0x10, 0x00, 0x01, 'b', 0x42, 0x10,
+                               0x00, 0x01, 'c', 0x07});
+    SocketPair pair;
+    ASSERT_TRUE(WriteAll(pair.b(), bytes));
+    Channel channel(64);
+    ASSERT_EQ(0, channel.Open(pair.ReleaseA(), true));
+    PStream stream;
+    PObject back;
+    EXPECT_EQ(S2S::kStatusProtocolError, stream.Recv(channel, back));
+    EXPECT_TRUE(log.Contains("): Error stack: a.b.c\n"));
+    EXPECT_EQ("", stream.GetHistory());
+    // The entries received so far stay; the failing key holds what arrived of its value.
+    EXPECT_EQ("{\"a\": {\"b\": {\"c\": null}}}", back.toString());
+}
+
+TEST(PStreamTest, MapEntryMustStartWithAString) {
+    LogCapture log;
+    PObject back;
+    EXPECT_EQ(S2S::kStatusProtocolError, Decode(Bytes({0x42, 0x01, 0x01, 0x01, 0x40}), back));
+    EXPECT_TRUE(log.Contains("): PStream: expect string, but get tag 1\n"));
+}
+
+TEST(PStreamTest, ReceivingIntoContainersAddsToThem) {
+    PObject back = Array({PObject(1ULL)});
+    ASSERT_EQ(0, Decode(Encode(Array({PObject(2ULL)})), back));
+    EXPECT_EQ("[1, 2]", back.toString());
+
+    PObject held;
+    held["keep"] = "k";
+    held["list"] = Array({PObject("x")});
+    held["text"] = "old";
+    PObject incoming;
+    incoming["list"] = Array({PObject("y")});
+    incoming["text"] = "new";
+    incoming["more"] = 3ULL;
+    ASSERT_EQ(0, Decode(Encode(incoming), held));
+    EXPECT_EQ("{\"keep\": \"k\", \"list\": [\"x\", \"y\"], \"more\": 3, \"text\": \"new\"}",
+              held.toString());
+
+    // A value of another kind is replaced.
+    PObject number(5ULL);
+    ASSERT_EQ(0, Decode(Encode(Array({})), number));
+    EXPECT_EQ("[]", number.toString());
+}
+
+TEST(PStreamTest, TruncatedStalledAndClosedPeersEndWithAStatus) {
+    LogCapture log(S2S::Logger::Warning);
+    PObject message;
+    message["list"] = Array({PObject("abc"), PObject(1ULL)});
+    std::string bytes = Encode(message);
+    for (size_t cut = 0; cut < bytes.size(); ++cut) {
+        PObject back;
+        EXPECT_EQ(S2S::kStatusIOError, Decode(bytes.substr(0, cut), back)) << cut;
+    }
+    EXPECT_TRUE(log.Contains("[WARNING] s2s_stream.cpp("));
+    EXPECT_TRUE(log.Contains("): Channel: -2\n"));
+
+    // A peer that stalls half-way: the channel's inactivity timeout ends the wait.
+    SocketPair pair;
+    ASSERT_TRUE(WriteAll(pair.b(), bytes.substr(0, 5)));
+    Channel channel(64);
+    ASSERT_EQ(0, channel.Open(pair.ReleaseA(), true));
+    channel.SetTimeout(1);
+    PStream stream;
+    PObject back;
+    EXPECT_EQ(S2S::kStatusIOError, stream.Recv(channel, back));
+    EXPECT_TRUE(log.Contains("): Channel: -9\n"));
+}
+
+TEST(PStreamTest, SendFailureLogsTheKeyPathOfTheFailingValue) {
+    LogCapture log(S2S::Logger::Warning);
+    PObject message;
+    message["a"]["_b"] = std::string(100, 'x');
+    SocketPair pair;
+    pair.CloseB();
+    Channel channel(16);  // the long string forces a send while "a.b" is being written
+    ASSERT_EQ(0, channel.Open(pair.ReleaseA(), true));
+    PStream stream;
+    EXPECT_EQ(S2S::kStatusIOError, stream.Send(channel, message));
+    EXPECT_TRUE(log.Contains("): Error stack: a.b\n"));
+    EXPECT_EQ("", stream.GetHistory());
+}
+
+TEST(PStreamTest, GarbageNeverCrashes) {
+    LogCapture log(S2S::Logger::Error);
+    std::mt19937 random(1234);
+    for (int round = 0; round < 300; ++round) {
+        std::string bytes(random() % 64, '\0');
+        for (char& c : bytes) {
+            // Mostly tags, so that the decoder goes deep into the format.
+            static const char kTags[] = {0x00, 0x01, 0x10, 0x40, 0x41, 0x42, 0x02, 0x08};
+            c = random() % 3 ? kTags[random() % 8] : static_cast<char>(random());
+        }
+        PObject back;
+        int ret = Decode(bytes, back, 32);
+        EXPECT_TRUE(ret == 0 || ret == S2S::kStatusIOError || ret == S2S::kStatusProtocolError);
+    }
+}
+
+TEST(PStreamTest, MillionNestedArraysDecodeWithoutTheCallStack) {
+    LogCapture log(S2S::Logger::Error);
+    // The format has no nesting limit; the decoder keeps depth on the heap.
+    const size_t depth = 1000000;
+    std::string bytes = std::string(depth, '\x41') + std::string(depth, '\x40');
+    PObject back;
+    ASSERT_EQ(0, Decode(bytes, back, 81920));
+    const PObject* level = &back;
+    size_t seen = 0;
+    while (level->isArray() && !level->asArray().empty()) {
+        level = &level->asArray()[0];
+        ++seen;
+    }
+    EXPECT_EQ(depth - 1, seen);
+    // Sending it back needs no call stack either, and gives the same bytes.
+    EXPECT_TRUE(Encode(back, 81920) == bytes);
+
+    // Cut before the end tags: the peer's close ends it with a status.
+    PObject partial;
+    EXPECT_EQ(S2S::kStatusIOError, Decode(std::string(depth, '\x41'), partial, 81920));
+    EXPECT_TRUE(partial.isArray());
+}
+
+TEST(PStreamTest, DeeplyNestedMapsKeepTheWholeKeyPath) {
+    LogCapture log(S2S::Logger::Error);
+    const size_t depth = 100000;
+    std::string level = Bytes({0x42, 0x10, 0x00, 0x01, 'k'});
+    std::string bytes;
+    bytes.reserve(level.size() * depth + 1);
+    for (size_t i = 0; i < depth; ++i) {
+        bytes += level;
+    }
+    bytes += '\x07';
+    PObject back;
+    EXPECT_EQ(S2S::kStatusProtocolError, Decode(bytes, back, 81920));
+    std::string path;
+    for (size_t i = 0; i < depth; ++i) {
+        path += i ? ".k" : "k";
+    }
+    EXPECT_TRUE(log.Contains("): Error stack: " + path + "\n"));
+}
+
+TEST(PStreamTest, StatusIsReadableFromAnotherThreadDuringTransfer) {
+    PObject message;
+    for (int i = 0; i < 2000; ++i) {
+        message["k" + std::to_string(i)]["inner"] = static_cast<unsigned long long>(i);
+    }
+    SocketPair pair;
+    PStream stream;
+    std::atomic<bool> done{false};
+    Peer watcher([&] {
+        while (!done.load()) {
+            std::string path;
+            unsigned long long a = 1;
+            unsigned long long b = 1;
+            stream.GetStatus(path, a, b);
+            // Nothing sets the counters but UpdateStatus; a path is always whole keys.
+            EXPECT_TRUE(path.empty() || path.compare(0, 1, "k") == 0) << path;
+        }
+    });
+    Peer reader([&] { s2s_test::ReadToEnd(pair.b()); });
+    {
+        Channel channel(256);
+        ASSERT_EQ(0, channel.Open(pair.ReleaseA(), true));
+        ASSERT_EQ(0, stream.Send(channel, message));
+    }
+    done = true;
+    watcher.Join();
+    reader.Join();
+
+    stream.UpdateStatus(3, 4);
+    std::string path = "x";
+    unsigned long long a = 0;
+    unsigned long long b = 0;
+    stream.GetStatus(path, a, b);
+    EXPECT_EQ("", path);
+    EXPECT_EQ(3u, a);
+    EXPECT_EQ(4u, b);
+    stream.ClearHistory();
+    stream.GetStatus(path, a, b);
+    EXPECT_EQ(0u, a);
+    EXPECT_EQ(0u, b);
+}
+
+TEST(PStreamTest, ConstantsAndSkip) {
+    EXPECT_EQ(0x01, PStream::GetTag<unsigned long long>());
+    EXPECT_EQ(0x10, PStream::GetTag<std::string>());
+    EXPECT_EQ(0x41, PStream::GetTag<PObject::Array>());
+    EXPECT_EQ(0x42, PStream::GetTag<PObject::Map>());
+    EXPECT_EQ(3, PStream::GetType<unsigned long long>());
+    EXPECT_EQ(4, PStream::GetType<std::string>());
+    EXPECT_EQ(1, PStream::GetType<PObject::Array>());
+    EXPECT_EQ(2, PStream::GetType<PObject::Map>());
+    unsigned major = 9;
+    unsigned minor = 9;
+    unsigned patch = 9;
+    PStream::GetVersion(major, minor, patch);
+    EXPECT_EQ(1u, major);
+    EXPECT_EQ(0u, minor);
+    EXPECT_EQ(0u, patch);
+    Channel channel(16);
+    PStream stream;
+    EXPECT_EQ(S2S::kStatusProtocolError, stream.Skip(channel, 0x07));
+}
+
+}  // namespace
