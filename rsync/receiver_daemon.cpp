@@ -1,0 +1,523 @@
+// The receiver's rsync daemon: its configuration written from the share registry, its start and
+// stop, and the status a status page shows.
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cctype>
+#include <cerrno>
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <memory>
+#include <sstream>
+#include <thread>
+#include <vector>
+
+#include "rsync/child_process.h"
+#include "rsync/receiver_internal.h"
+#include "s2s_logger.h"
+#include "s2s_platform.h"
+#include "s2s_receiver.h"
+#include "s2s_server.h"
+
+namespace S2S {
+
+namespace {
+
+constexpr auto kStartWait = std::chrono::seconds(10);
+constexpr auto kStopWait = std::chrono::seconds(10);
+
+struct ListDeleter {
+    void operator()(VLIBSzList* l) const { VLIBCSzListFree(l); }
+};
+struct HashDeleter {
+    void operator()(VLIBSzHash* h) const { VLIBCSzHashFree(h); }
+};
+struct ShareDeleter {
+    void operator()(VURNShare* s) const { VURNShareFree(s); }
+};
+
+int Fail(std::string* error, const std::string& text) {
+    Logger::LogMsg(Logger::Error, "[ERROR] receiver_daemon.cpp(%d): %s\n", __LINE__, text.c_str());
+    if (error != nullptr) {
+        *error = text;
+    }
+    return -1;
+}
+
+bool HasControl(const std::string& s) {
+    for (unsigned char c : s) {
+        if (c < 0x20 || c == 0x7f) {
+            return true;
+        }
+    }
+    return false;
+}
+
+// A value rsyncd.conf takes literally: no line breaks, no %VAR% expansion, no outer blanks, and
+// (for what goes into a hook's shell command) no single quote.
+bool ConfSafe(const std::string& s) {
+    return !s.empty() && !HasControl(s) && s.find_first_of("%'\\") == std::string::npos &&
+           s.front() != ' ' && s.back() != ' ';
+}
+
+bool ValidAccount(const std::string& s) {
+    if (s.empty() || s.size() > 64 || s[0] == '-') {
+        return false;
+    }
+    for (unsigned char c : s) {
+        if (!(std::isalnum(c) || c == '.' || c == '_' || c == '-')) {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool ValidAddress(const std::string& s) {
+    if (s.empty()) {
+        return true;
+    }
+    unsigned char buf[sizeof(struct in6_addr)];
+    return inet_pton(AF_INET, s.c_str(), buf) == 1 || inet_pton(AF_INET6, s.c_str(), buf) == 1;
+}
+
+void MakeDirs(const std::string& dir, mode_t mode) {
+    for (size_t pos = 1; pos <= dir.size(); ++pos) {
+        if (pos == dir.size() || dir[pos] == '/') {
+            mkdir(dir.substr(0, pos).c_str(), mode);
+        }
+    }
+}
+
+std::string Parent(const std::string& path) {
+    size_t slash = path.rfind('/');
+    return slash == std::string::npos || slash == 0 ? std::string("/") : path.substr(0, slash);
+}
+
+// Writes a file through a temporary name and a rename, with `mode` from the start.
+bool WriteFileAtomic(const std::string& path, const std::string& content, mode_t mode) {
+    std::string tmp = path + ".tmp";
+    int fd = open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, mode);
+    if (fd < 0) {
+        return false;
+    }
+    bool ok = fchmod(fd, mode) == 0;
+    size_t done = 0;
+    while (ok && done < content.size()) {
+        ssize_t n = write(fd, content.data() + done, content.size() - done);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        ok = n > 0;
+        if (ok) {
+            done += static_cast<size_t>(n);
+        }
+    }
+    ok = fsync(fd) == 0 && ok;
+    ok = close(fd) == 0 && ok;
+    if (!ok || rename(tmp.c_str(), path.c_str()) != 0) {
+        unlink(tmp.c_str());
+        return false;
+    }
+    return true;
+}
+
+std::string Quote(const std::string& s) {
+    return "'" + s + "'";
+}
+
+pid_t PidFromFile() {
+    std::ifstream in(S2SPath(S2S_PATH_RSYNCD_PID));
+    long pid = 0;
+    if (!(in >> pid) || pid <= 1) {
+        return -1;
+    }
+    return static_cast<pid_t>(pid);
+}
+
+// Alive and not a zombie (a daemon whose parent left may stay a zombie for a while).
+bool ProcessAlive(pid_t pid) {
+    std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+    std::string stat;
+    if (!std::getline(in, stat)) {
+        return false;
+    }
+    size_t paren = stat.rfind(')');
+    return paren != std::string::npos && paren + 2 < stat.size() && stat[paren + 2] != 'Z';
+}
+
+bool Accepting(const std::string& address, int port) {
+    std::string host = address.empty() ? "127.0.0.1" : address;
+    bool v6 = host.find(':') != std::string::npos;
+    int fd = socket(v6 ? AF_INET6 : AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0) {
+        return false;
+    }
+    int rc = -1;
+    if (v6) {
+        sockaddr_in6 a{};
+        a.sin6_family = AF_INET6;
+        a.sin6_port = htons(static_cast<uint16_t>(port));
+        inet_pton(AF_INET6, host.c_str(), &a.sin6_addr);
+        rc = connect(fd, reinterpret_cast<sockaddr*>(&a), sizeof a);
+    } else {
+        sockaddr_in a{};
+        a.sin_family = AF_INET;
+        a.sin_port = htons(static_cast<uint16_t>(port));
+        inet_pton(AF_INET, host.c_str(), &a.sin_addr);
+        rc = connect(fd, reinterpret_cast<sockaddr*>(&a), sizeof a);
+    }
+    close(fd);
+    return rc == 0;
+}
+
+// "port = N" and "address = A" back from the written configuration.
+void ListenSettings(int* port, std::string* address) {
+    std::ifstream in(S2SPath(S2S_PATH_RSYNCD_CONF));
+    std::string line;
+    *port = 873;
+    address->clear();
+    while (std::getline(in, line) && (line.empty() || line[0] != '[')) {
+        if (line.compare(0, 7, "port = ") == 0) {
+            *port = std::atoi(line.c_str() + 7);
+        } else if (line.compare(0, 10, "address = ") == 0) {
+            *address = line.substr(10);
+        }
+    }
+}
+
+int SetEnabled(bool on) {
+    std::unique_ptr<VLIBSzHash, HashDeleter> h(VLIBCSzHashAlloc(2));
+    VLIBSzHash* raw = h.release();
+    int rc = VLIBCSzHashSetValue(&raw, "s2sEnabled", on ? "yes" : "no");
+    h.reset(raw);
+    if (rc < 0) {
+        return -1;
+    }
+    S2SCheckServerInfo();
+    return S2SUpdateServerInfo("PairedClientInfo", h.get());
+}
+
+std::string LogTail() {
+    std::ifstream in(S2SPath(S2S_PATH_RSYNCD_LOG));
+    std::string line;
+    std::string last;
+    while (std::getline(in, line)) {
+        if (!line.empty()) {
+            last = line;
+        }
+    }
+    return last;
+}
+
+}  // namespace
+
+namespace receiver_internal {
+
+int ShareEncrypted(const std::string& name, bool* encrypted) {
+    VURNShare* raw = nullptr;
+    if (VURNShareGet(name.c_str(), &raw) < 0) {
+        return VLIBCErrGet() == VLIB_ERR_NOT_FOUND ? 0 : -1;
+    }
+    std::unique_ptr<VURNShare, ShareDeleter> share(raw);
+    int value = 0;
+    if (VLIBShareIsEncryptionGet(share.get(), &value) < 0) {
+        return -1;
+    }
+    *encrypted = value != 0;
+    return 1;
+}
+
+}  // namespace receiver_internal
+
+int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
+    if (s.port <= 0 || s.port > 65535) {
+        return Fail(error, "invalid port");
+    }
+    if (!ValidAddress(s.address)) {
+        return Fail(error, "invalid listen address");
+    }
+    if (!ValidAccount(s.user)) {
+        return Fail(error, "invalid user name (letters, digits, '.', '_', '-')");
+    }
+    if (s.password.empty() || HasControl(s.password)) {
+        return Fail(error, "the password must be one non-empty line");
+    }
+    if (s.handlerPath.empty() || s.handlerPath[0] != '/' || !ConfSafe(s.handlerPath)) {
+        return Fail(error, "the handler program needs an absolute path without quotes or '%'");
+    }
+    const std::string conf = S2SPath(S2S_PATH_RSYNCD_CONF);
+    const std::string secrets = S2SPath(S2S_PATH_RSYNCD_SECRETS);
+    const std::string spool = S2SPath(S2S_PATH_COMMAND_SPOOL);
+    const std::string keys = S2SPath(S2S_PATH_KEY_DIR);
+    const std::string pid = S2SPath(S2S_PATH_RSYNCD_PID);
+    const std::string log = S2SPath(S2S_PATH_RSYNCD_LOG);
+    const std::string lock = S2SPath(S2S_PATH_RSYNCD_LOCK);
+    for (const std::string* p : {&conf, &secrets, &spool, &keys, &pid, &log, &lock}) {
+        if (!ConfSafe(*p)) {
+            return Fail(error, "path not usable in the daemon configuration: " + *p);
+        }
+    }
+    const char* root = std::getenv("S2S_ROOT");
+    std::string rootValue = root != nullptr ? root : "";
+    if (!rootValue.empty() && !ConfSafe(rootValue)) {
+        return Fail(error, "S2S_ROOT not usable in the daemon configuration");
+    }
+    for (const std::string& dir : {Parent(conf), Parent(pid), Parent(log), Parent(lock)}) {
+        MakeDirs(dir, 0755);
+    }
+    MakeDirs(spool + "/replies", 0700);
+    MakeDirs(spool + "/conns", 0700);
+    MakeDirs(keys, 0700);
+
+    std::ostringstream c;
+    c << "# Written by s2s-receiver configure; rewritten on every configure.\n"
+      << "pid file = " << pid << "\n"
+      << "port = " << s.port << "\n";
+    if (!s.address.empty()) {
+        c << "address = " << s.address << "\n";
+    }
+    c << "lock file = " << lock << "\n"
+      << "log file = " << log
+      << "\n"
+      // Every module is a chroot: no client path can leave its module.
+      << "use chroot = yes\n"
+      << "numeric ids = yes\n"
+      << "uid = 0\n"
+      << "gid = 0\n"
+      << "read only = no\n"
+      << "list = no\n"
+      << "reverse lookup = no\n"
+      << "auth users = " << s.user << "\n"
+      << "secrets file = " << secrets << "\n"
+      << "strict modes = yes\n"
+      << "timeout = 900\n\n";
+
+    // The hooks run through the daemon's shell: every value is single-quoted and was checked to
+    // hold no quote.
+    std::string hook = "S2S_ROOT=" + Quote(rootValue) + " " + Quote(s.handlerPath) + " ";
+    c << "[" << S2S_COMMAND_MODULE << "]\n"
+      << "\tpath = " << spool << "/replies\n"
+      << "\tread only = yes\n"
+      << "\tearly exec = " << hook << "hook-early" << (s.oldServer ? " --old-server" : "") << "\n"
+      << "\tpre-xfer exec = " << hook << "hook-pre\n"
+      << "\tpost-xfer exec = " << hook << "hook-post\n\n";
+    c << "[" << S2S_KEY_MODULE << "]\n"
+      << "\tpath = " << keys << "\n"
+      << "\twrite only = yes\n"
+      << "\trefuse options = delete*\n\n";
+
+    VLIBSzList* rawNames = VLIBCSzListAlloc(16);
+    int count = VURNShareEnum(&rawNames);
+    std::unique_ptr<VLIBSzList, ListDeleter> names(rawNames);
+    if (count < 0 && VLIBCErrGet() != VLIB_ERR_FILE_NOT_FOUND) {
+        return Fail(error, "cannot read the share registry");
+    }
+    for (int i = 0; i < VLIBCSzListCount(names.get()); ++i) {
+        std::string name = VLIBCSzListGet(names.get(), i);
+        VURNShare* raw = nullptr;
+        if (VURNShareGet(name.c_str(), &raw) < 0) {
+            return Fail(error, "cannot read the share " + name);
+        }
+        std::unique_ptr<VURNShare, ShareDeleter> share(raw);
+        std::string lower = name;
+        for (char& ch : lower) {
+            ch = static_cast<char>(std::tolower(static_cast<unsigned char>(ch)));
+        }
+        std::string path = share->path;
+        if (!receiver_internal::ValidShareName(name) || !ConfSafe(name) || lower == "global" ||
+            path.empty() || path[0] != '/' || !ConfSafe(path)) {
+            Logger::LogMsg(Logger::Warning,
+                           "[WARNING] receiver_daemon.cpp(%d): share '%s' is not served (its name "
+                           "or path cannot be a daemon module)\n",
+                           __LINE__, HasControl(name) ? "?" : name.c_str());
+            continue;
+        }
+        c << "[" << name << "]\n\tpath = " << path << "\n\n";
+        if ((share->status & VURN_SHARE_STATUS_ENCRYPTED) != 0) {
+            char buf[4096];
+            if (VLIBShareEncryptPathGet(path.c_str(), buf, sizeof buf) < 0 || !ConfSafe(buf)) {
+                return Fail(error, "cannot find the encrypted directory of " + name);
+            }
+            MakeDirs(buf, 0700);
+            c << "[@" << name << "@]\n\tpath = " << buf << "\n\n";
+        }
+    }
+
+    if (!WriteFileAtomic(secrets, s.user + ":" + s.password + "\n", 0600)) {
+        return Fail(error, "cannot write " + secrets + ": " + strerror(errno));
+    }
+    if (!WriteFileAtomic(conf, c.str(), 0644)) {
+        return Fail(error, "cannot write " + conf + ": " + strerror(errno));
+    }
+    return 0;
+}
+
+bool ReceiverRunning() {
+    pid_t pid = PidFromFile();
+    return pid > 0 && ProcessAlive(pid);
+}
+
+int ReceiverStart(std::string* error) {
+    const std::string conf = S2SPath(S2S_PATH_RSYNCD_CONF);
+    struct stat st;
+    if (stat(conf.c_str(), &st) != 0) {
+        return Fail(error, "not configured: " + conf + " is missing");
+    }
+    if (ReceiverRunning()) {
+        return Fail(error, "the daemon is running already");
+    }
+    unlink(S2SPath(S2S_PATH_RSYNCD_PID));
+    std::string rsync = rsync_internal::FindProgram("rsync");
+    if (rsync.empty()) {
+        return Fail(error, "rsync is not installed");
+    }
+    int port = 873;
+    std::string address;
+    ListenSettings(&port, &address);
+
+    // The daemon gets a session of its own (it outlives this program) and stays in the
+    // foreground of it, so that the pid it writes is the one to stop.
+    std::string configArg = "--config=" + conf;
+    std::vector<char*> argv = {const_cast<char*>(rsync.c_str()), const_cast<char*>("--daemon"),
+                               const_cast<char*>("--no-detach"), &configArg[0], nullptr};
+    pid_t first = fork();
+    if (first < 0) {
+        return Fail(error, std::string("fork: ") + strerror(errno));
+    }
+    if (first == 0) {
+        if (setsid() < 0) {
+            _exit(1);
+        }
+        pid_t daemon = fork();
+        if (daemon != 0) {
+            _exit(daemon < 0 ? 1 : 0);
+        }
+        int devnull = open("/dev/null", O_RDWR);
+        if (devnull >= 0) {
+            dup2(devnull, 0);
+            dup2(devnull, 1);
+            dup2(devnull, 2);
+        }
+        for (int fd = 3; fd < 1024; ++fd) {
+            close(fd);
+        }
+        execv(rsync.c_str(), argv.data());
+        _exit(127);
+    }
+    int status = 0;
+    while (waitpid(first, &status, 0) < 0 && errno == EINTR) {
+    }
+    if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
+        return Fail(error, "cannot start the daemon");
+    }
+    auto deadline = std::chrono::steady_clock::now() + kStartWait;
+    for (;;) {
+        if (ReceiverRunning() && Accepting(address, port)) {
+            break;
+        }
+        if (std::chrono::steady_clock::now() >= deadline) {
+            std::string tail = LogTail();
+            ReceiverStop(nullptr);
+            return Fail(error, "the daemon did not start listening on port " +
+                                   std::to_string(port) + (tail.empty() ? "" : ": " + tail));
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    if (SetEnabled(true) != 0) {
+        return Fail(error, "cannot mark the service switched on in the pairing store");
+    }
+    return 0;
+}
+
+int ReceiverStop(std::string* error) {
+    pid_t pid = PidFromFile();
+    if (pid > 0 && ProcessAlive(pid)) {
+        // The daemon leads its own process group: its connections end with it.
+        pid_t group = getpgid(pid) == pid ? -pid : pid;
+        kill(group, SIGTERM);
+        auto deadline = std::chrono::steady_clock::now() + kStopWait;
+        while (ProcessAlive(pid) && std::chrono::steady_clock::now() < deadline) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        }
+        if (ProcessAlive(pid)) {
+            kill(group, SIGKILL);
+            std::this_thread::sleep_for(std::chrono::milliseconds(100));
+        }
+        if (ProcessAlive(pid)) {
+            return Fail(error, "the daemon would not stop");
+        }
+        if (group < 0) {
+            kill(group, SIGKILL);  // connections that ignored SIGTERM
+        }
+    }
+    unlink(S2SPath(S2S_PATH_RSYNCD_PID));
+    if (SetEnabled(false) != 0) {
+        return Fail(error, "cannot mark the service switched off in the pairing store");
+    }
+    return 0;
+}
+
+int ReceiverGetStatus(ReceiverStatus* out) {
+    *out = ReceiverStatus();
+    s2s_svr_status st{};
+    int rc = s2s_svr_get_status(&st);
+    out->running = st.running != 0;
+    out->busy = st.busy != 0;
+    out->pairedClientID = st.client_id != nullptr ? st.client_id : "";
+    out->pairedServerName = st.server_name != nullptr ? st.server_name : "";
+    s2s_svr_put_status(&st);
+    if (rc != 0) {
+        return -1;
+    }
+    VLIBSzList* rawSections = VLIBCSzListAlloc(64);
+    int count = VLIBCFileEnumSection(S2SPath(S2S_PATH_PAIRING_STORE), &rawSections);
+    std::unique_ptr<VLIBSzList, ListDeleter> sections(rawSections);
+    if (count < 0) {
+        return -1;
+    }
+    const std::string store = S2SPath(S2S_PATH_PAIRING_STORE);
+    for (int i = 0; i < VLIBCSzListCount(sections.get()); ++i) {
+        std::string section = VLIBCSzListGet(sections.get(), i);
+        std::unique_ptr<VLIBSzHash, HashDeleter> h(VLIBCSzHashAlloc(8));
+        VLIBSzHash* raw = h.release();
+        int found = VLIBCFileGetSection(store.c_str(), section.c_str(), &raw);
+        h.reset(raw);
+        if (found < 0) {
+            return -1;
+        }
+        auto value = [&](const char* key) {
+            const char* v = VLIBCSzHashGetValue(h.get(), key);
+            return std::string(v != nullptr ? v : "");
+        };
+        if (section.compare(0, 9, "CLIENTID_") == 0) {
+            out->clients.push_back({section.substr(9), value("ServerName")});
+        } else if (section.compare(0, 6, "SHARE_") == 0) {
+            ReceiverShareState share;
+            share.name = section.substr(6);
+            share.completeID = value("CompleteID");
+            std::string running = value("RunningID");
+            // The pairing store's own reading of the two IDs.
+            if (running.empty()) {
+                share.state = "free";
+            } else if (running == share.completeID) {
+                share.state = "completed";
+                share.owner = running;
+            } else {
+                share.state = "running";
+                share.owner = running;
+            }
+            out->shares.push_back(share);
+        }
+    }
+    return 0;
+}
+
+}  // namespace S2S

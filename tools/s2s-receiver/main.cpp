@@ -1,0 +1,149 @@
+// s2s-receiver: sets up and serves the receiving end of the sync over the stock rsync daemon.
+// Administration subcommands for people; hook subcommands for the daemon's command module.
+#include <limits.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <iostream>
+#include <string>
+
+#include "s2s_logger.h"
+#include "s2s_receiver.h"
+
+namespace {
+
+const char kUsage[] =
+    "usage: s2s-receiver configure --user NAME [--port N] [--address ADDR] [--old-server]\n"
+    "           (the password is read from the first line of standard input)\n"
+    "       s2s-receiver start | stop | status\n"
+    "       s2s-receiver hook-early [--old-server] | hook-pre | hook-post   (run by the daemon)\n";
+
+int Usage() {
+    std::fputs(kUsage, stderr);
+    return 2;
+}
+
+bool ParsePort(const char* text, int* port) {
+    char* end = nullptr;
+    long value = std::strtol(text, &end, 10);
+    if (end == text || *end != '\0' || value <= 0 || value > 65535) {
+        return false;
+    }
+    *port = static_cast<int>(value);
+    return true;
+}
+
+std::string SelfPath() {
+    char buf[PATH_MAX];
+    ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
+    if (n <= 0) {
+        return std::string();
+    }
+    buf[n] = '\0';
+    return buf;
+}
+
+int Configure(int argc, char** argv) {
+    S2S::ReceiverSettings s;
+    for (int i = 2; i < argc; ++i) {
+        std::string a = argv[i];
+        if (a == "--old-server") {
+            s.oldServer = true;
+        } else if (a == "--port" && i + 1 < argc) {
+            if (!ParsePort(argv[++i], &s.port)) {
+                return Usage();
+            }
+        } else if (a == "--address" && i + 1 < argc) {
+            s.address = argv[++i];
+        } else if (a == "--user" && i + 1 < argc) {
+            s.user = argv[++i];
+        } else {
+            return Usage();
+        }
+    }
+    if (s.user.empty()) {
+        return Usage();
+    }
+    // Never from the command line: other users can read a process's arguments.
+    if (!std::getline(std::cin, s.password)) {
+        std::fputs("s2s-receiver: no password on standard input\n", stderr);
+        return 1;
+    }
+    s.handlerPath = SelfPath();
+    std::string error;
+    if (S2S::ReceiverConfigure(s, &error) != 0) {
+        std::fprintf(stderr, "s2s-receiver: %s\n", error.c_str());
+        return 1;
+    }
+    return 0;
+}
+
+int Status() {
+    S2S::ReceiverStatus st;
+    int rc = S2S::ReceiverGetStatus(&st);
+    std::printf("service: %s\n", st.running ? "running" : "stopped");
+    std::printf("activity: %s\n", st.busy ? "busy" : "idle");
+    if (rc != 0) {
+        std::fputs("s2s-receiver: cannot read the pairing store\n", stderr);
+        return 1;
+    }
+    if (!st.pairedClientID.empty()) {
+        std::printf("paired: %s (%s)\n", st.pairedClientID.c_str(), st.pairedServerName.c_str());
+    }
+    for (const auto& c : st.clients) {
+        std::printf("client: %s %s\n", c.clientID.c_str(), c.serverName.c_str());
+    }
+    for (const auto& s : st.shares) {
+        std::printf("share: %s %s%s%s\n", s.name.c_str(), s.state.c_str(),
+                    s.owner.empty() ? "" : " ", s.owner.c_str());
+    }
+    return 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    if (argc < 2) {
+        return Usage();
+    }
+    std::string cmd = argv[1];
+    bool hook = cmd.compare(0, 5, "hook-") == 0;
+    // Hooks have no terminal: their standard streams go to the daemon (or, for hook-pre's
+    // refusal, to the client), so their log goes to syslog.
+    S2S::Logger::Initialize(hook ? S2S::Logger::Syslog : S2S::Logger::Stderr, S2S::Logger::Warning,
+                            "", 0);
+    std::string error;
+    if (cmd == "configure") {
+        return Configure(argc, argv);
+    }
+    if (cmd == "start" && argc == 2) {
+        if (S2S::ReceiverStart(&error) != 0) {
+            std::fprintf(stderr, "s2s-receiver: %s\n", error.c_str());
+            return 1;
+        }
+        return 0;
+    }
+    if (cmd == "stop" && argc == 2) {
+        if (S2S::ReceiverStop(&error) != 0) {
+            std::fprintf(stderr, "s2s-receiver: %s\n", error.c_str());
+            return 1;
+        }
+        return 0;
+    }
+    if (cmd == "status" && argc == 2) {
+        return Status();
+    }
+    if (cmd == "hook-early" &&
+        (argc == 2 || (argc == 3 && std::strcmp(argv[2], "--old-server") == 0))) {
+        return S2S::ReceiverHookEarly(0, argc == 3);
+    }
+    if (cmd == "hook-pre" && argc == 2) {
+        return S2S::ReceiverHookPre();
+    }
+    if (cmd == "hook-post" && argc == 2) {
+        return S2S::ReceiverHookPost();
+    }
+    return Usage();
+}
