@@ -1,0 +1,473 @@
+// Section files on real files: the format, every read and write function, refusal of what the
+// format cannot carry, failed and interrupted writes, and concurrent writers in real processes.
+#include <dirent.h>
+#include <errno.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <random>
+#include <string>
+#include <vector>
+
+#include "platform/platform_test_util.h"
+#include "platform/section_file.h"
+#include "s2s_platform.h"
+#include "support/test_util.h"
+
+namespace {
+
+using s2s_test::LogCapture;
+using s2s_test::ReadFile;
+using s2s_test::Table;
+using s2s_test::TempDir;
+using s2s_test::WriteFile;
+
+std::vector<std::string> Sections(const std::string& file) {
+    VLIBSzList* list = VLIBCSzListAlloc(8);
+    std::vector<std::string> names;
+    if (VLIBCFileEnumSection(file.c_str(), &list) >= 0) {
+        for (int i = 0; i < VLIBCSzListCount(list); ++i) {
+            names.push_back(VLIBCSzListGet(list, i));
+        }
+    }
+    VLIBCSzListFree(list);
+    return names;
+}
+
+// Names of leftover temporary files next to `file`.
+int Leftovers(const TempDir& dir) {
+    int count = 0;
+    DIR* d = opendir(dir.path().c_str());
+    while (dirent* e = readdir(d)) {
+        count += std::string(e->d_name).find(".s2stmp-") != std::string::npos ? 1 : 0;
+    }
+    closedir(d);
+    return count;
+}
+
+TEST(SectionFile, WritesTheFixedPairFormatAndReadsItBack) {
+    TempDir dir;
+    std::string file = dir / "store.info";
+    Table pairs({{"clientID", "ABC123"}, {"serverName", "nas-1"}});
+    ASSERT_EQ(VLIBCFileAddSection(file.c_str(), "PairedClientInfo", pairs.get(), "\t%s=\"%s\"\n"),
+              1);
+    EXPECT_EQ(ReadFile(file),
+              "[PairedClientInfo]\n\tclientID=\"ABC123\"\n\tserverName=\"nas-1\"\n");
+
+    Table out;
+    EXPECT_EQ(VLIBCFileGetSection(file.c_str(), "PairedClientInfo", out.ptr()), 1);
+    EXPECT_EQ(out["clientID"], "ABC123");
+    EXPECT_EQ(out["serverName"], "nas-1");
+    EXPECT_EQ(VLIBCSzHashCount(out.get()), 2);
+
+    char buf[36];
+    EXPECT_EQ(
+        VLIBCFileGetSectionValue(file.c_str(), "PairedClientInfo", "clientID", buf, sizeof(buf)),
+        6);
+    EXPECT_STREQ(buf, "ABC123");
+}
+
+TEST(SectionFile, AbsentSectionsAndKeysReportError0x2200) {
+    TempDir dir;
+    std::string file = dir / "store.info";
+    WriteFile(file, "[SHARE_a]\n\tRunningID=\"x\"\n");
+    Table out;
+    EXPECT_EQ(VLIBCFileGetSection(file.c_str(), "SHARE_b", out.ptr()), 0);
+    EXPECT_EQ(VLIBCErrGet(), 0x2200);
+    char buf[36] = "junk";
+    EXPECT_LT(VLIBCFileGetSectionValue(file.c_str(), "SHARE_a", "CompleteID", buf, sizeof(buf)), 0);
+    EXPECT_EQ(VLIBCErrGet(), 0x2200);
+    EXPECT_STREQ(buf, "");
+    EXPECT_LT(VLIBCFileGetSectionValue(file.c_str(), "SHARE_b", "RunningID", buf, sizeof(buf)), 0);
+    EXPECT_EQ(VLIBCErrGet(), 0x2200);
+    // An empty existing section is found, not absent.
+    WriteFile(file, "[empty]\n");
+    EXPECT_EQ(VLIBCFileGetSection(file.c_str(), "empty", out.ptr()), 1);
+}
+
+TEST(SectionFile, ValueLongerThanTheBufferIsAnErrorNotATruncation) {
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file, "[s]\n\tk=\"0123456789\"\n");
+    char buf[10];
+    EXPECT_LT(VLIBCFileGetSectionValue(file.c_str(), "s", "k", buf, sizeof(buf)), 0);
+    EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_BUFFER_TOO_SMALL);
+    char fits[11];
+    EXPECT_EQ(VLIBCFileGetSectionValue(file.c_str(), "s", "k", fits, sizeof(fits)), 10);
+}
+
+TEST(SectionFile, SetReplacesNamedKeysKeepsOthersAndAppendsNewOnes) {
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file,
+              "# kept comment\n[PairedClientInfo]\n\ts2sEnabled=\"yes\"\n\tclientID=\"old\"\n\n"
+              "[TASK_1]\n\tstatus=\"idle\"\n");
+    Table values({{"clientID", "new"}, {"serverName", "srv"}});
+    ASSERT_EQ(VLIBCFileSetSection(file.c_str(), "PairedClientInfo", nullptr, values.get(),
+                                  "\t%s=\"%s\"\n"),
+              1);
+    EXPECT_EQ(ReadFile(file),
+              "# kept comment\n[PairedClientInfo]\n\ts2sEnabled=\"yes\"\n\tclientID=\"new\"\n"
+              "\tserverName=\"srv\"\n\n[TASK_1]\n\tstatus=\"idle\"\n");
+    EXPECT_EQ(VLIBCErrGet(), 0);
+}
+
+TEST(SectionFile, SetWithOldNameRenamesAndRefusesToCreateDuplicates) {
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file, "[a]\n\tk=\"1\"\n[b]\n\tk=\"2\"\n");
+    Table values({{"x", "y"}});
+    ASSERT_EQ(VLIBCFileSetSection(file.c_str(), "c", "a", values.get(), nullptr), 1);
+    EXPECT_EQ(Sections(file), (std::vector<std::string>{"c", "b"}));
+    std::string before = ReadFile(file);
+    EXPECT_LT(VLIBCFileSetSection(file.c_str(), "b", "c", values.get(), nullptr), 0);
+    EXPECT_EQ(ReadFile(file), before);
+    // An absent section is appended.
+    ASSERT_EQ(VLIBCFileSetSection(file.c_str(), "d", nullptr, values.get(), nullptr), 1);
+    EXPECT_EQ(Sections(file), (std::vector<std::string>{"c", "b", "d"}));
+}
+
+TEST(SectionFile, AddOnAnExistingSectionDoesNotDuplicateIt) {
+    TempDir dir;
+    std::string file = dir / "f";
+    Table first({{"ServerName", "one"}});
+    Table second({{"ServerName", "two"}});
+    ASSERT_EQ(VLIBCFileAddSection(file.c_str(), "CLIENTID_x", first.get(), nullptr), 1);
+    ASSERT_EQ(VLIBCFileAddSection(file.c_str(), "CLIENTID_x", second.get(), nullptr), 1);
+    EXPECT_EQ(ReadFile(file), "[CLIENTID_x]\n\tServerName=\"two\"\n");
+}
+
+TEST(SectionFile, ModifyUpdatesInPlaceAndReportsAbsentSectionWithZero) {
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file, "[PairedClientInfo]\n\tclientID=\"a\"\n\ts2sEnabled=\"yes\"\n");
+    Table values({{"clientID", "S2SMULTI-SRC-SUPPORT"}, {"serverName", "S2SMULTI-SRC-SUPPORT"}});
+    EXPECT_EQ(VLIBCIFileModifySection(file.c_str(), "PairedClientInfo", nullptr, values.get(), 1,
+                                      nullptr),
+              1);
+    EXPECT_EQ(ReadFile(file),
+              "[PairedClientInfo]\n\tclientID=\"S2SMULTI-SRC-SUPPORT\"\n\ts2sEnabled=\"yes\"\n"
+              "\tserverName=\"S2SMULTI-SRC-SUPPORT\"\n");
+
+    std::string before = ReadFile(file);
+    EXPECT_EQ(VLIBCIFileModifySection(file.c_str(), "Other", nullptr, values.get(), 1, nullptr), 0);
+    EXPECT_EQ(VLIBCErrGet(), 0x2200);
+    EXPECT_EQ(ReadFile(file), before);
+
+    // Without addKeys, keys the section lacks are left out.
+    Table extra({{"clientID", "b"}, {"newKey", "v"}});
+    EXPECT_EQ(VLIBCIFileModifySection(file.c_str(), "PairedClientInfo", "Renamed", extra.get(), 0,
+                                      nullptr),
+              1);
+    Table out;
+    EXPECT_EQ(VLIBCFileGetSection(file.c_str(), "Renamed", out.ptr()), 1);
+    EXPECT_EQ(out["clientID"], "b");
+    EXPECT_EQ(out["newKey"], "<absent>");
+}
+
+TEST(SectionFile, ReplaceRemoveAndEnumerate) {
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file, "[a]\n\tk1=\"1\"\n\tk2=\"2\"\n[b]\n\tk=\"x\"\n");
+    Table values({{"k3", "3"}});
+    ASSERT_EQ(VLIBCFileReplaceSection(file.c_str(), "a", values.get(), nullptr), 1);
+    EXPECT_EQ(ReadFile(file), "[a]\n\tk3=\"3\"\n[b]\n\tk=\"x\"\n");
+    EXPECT_EQ(VLIBCFileRemoveSection(file.c_str(), "a"), 1);
+    EXPECT_EQ(ReadFile(file), "[b]\n\tk=\"x\"\n");
+    EXPECT_EQ(VLIBCFileRemoveSection(file.c_str(), "a"), 0);
+    EXPECT_EQ(VLIBCErrGet(), 0x2200);
+
+    VLIBSzList* list = VLIBCSzListAlloc(4);
+    VLIBCSzListPush(&list, "already");
+    EXPECT_EQ(VLIBCFileEnumSection(file.c_str(), &list), 1);
+    EXPECT_EQ(VLIBCSzListCount(list), 2);  // appended, not cleared
+    EXPECT_STREQ(VLIBCSzListGet(list, 1), "b");
+    VLIBCSzListFree(list);
+}
+
+TEST(SectionFile, ReadsHandWrittenVariants) {
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file,
+              "; comment\r\n  [ spaced ]  \r\nplain = unquoted value \r\n\tq=\"\"\r\n"
+              "dup=\"first\"\ndup=\"second\"\n");
+    Table out;
+    ASSERT_EQ(VLIBCFileGetSection(file.c_str(), "spaced", out.ptr()), 1);
+    EXPECT_EQ(out["plain"], "unquoted value");
+    EXPECT_EQ(out["q"], "");
+    EXPECT_EQ(out["dup"], "first");
+}
+
+TEST(SectionFile, ValuesWithQuotesAndOddBytesReadBackUnchanged) {
+    TempDir dir;
+    std::string file = dir / "f";
+    const char* tricky = "say \"hi\" = \\ ; # [x] \"";
+    const char* spaced = "  padded\t";
+    const char* latin1_name = "caf\xe9";  // not UTF-8: stored as bytes
+    Table values({{"q", tricky}, {"s", spaced}, {"e", ""}});
+    ASSERT_EQ(VLIBCFileAddSection(file.c_str(), latin1_name, values.get(), nullptr), 1);
+    Table out;
+    ASSERT_EQ(VLIBCFileGetSection(file.c_str(), latin1_name, out.ptr()), 1);
+    EXPECT_EQ(out["q"], tricky);
+    EXPECT_EQ(out["s"], spaced);
+    EXPECT_EQ(out["e"], "");
+}
+
+TEST(SectionFile, RefusesWhatTheFormatCannotCarryWithoutTouchingTheFile) {
+    LogCapture log;
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file, "[s]\n\tk=\"v\"\n");
+    std::string before = ReadFile(file);
+    std::string too_long(VLIB_SECTION_VALUE_MAX + 1, 'x');
+    std::string longest(VLIB_SECTION_VALUE_MAX, 'x');
+    struct Case {
+        const char* section;
+        const char* key;
+        const char* value;
+    } cases[] = {{"s", "k", "two\nlines"}, {"s", "k", "cr\r"}, {"s", "a=b", "v"},
+                 {"s", " k", "v"},         {"s", "#k", "v"},   {"s\n", "k", "v"},
+                 {" s", "k", "v"},         {"", "k", "v"},     {"s", "k", too_long.c_str()}};
+    for (const Case& c : cases) {
+        Table values({{c.key, c.value}});
+        EXPECT_LT(VLIBCFileSetSection(file.c_str(), c.section, nullptr, values.get(), nullptr), 0)
+            << c.section << "/" << c.key;
+        EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_BAD_PARAMETER);
+        EXPECT_LT(VLIBCFileAddSection(file.c_str(), c.section, values.get(), nullptr), 0);
+        EXPECT_LT(VLIBCFileReplaceSection(file.c_str(), c.section, values.get(), nullptr), 0);
+    }
+    EXPECT_EQ(ReadFile(file), before);
+    EXPECT_TRUE(log.Contains("[ERROR] section_file.cpp("));
+
+    Table ok({{"k", longest.c_str()}});
+    EXPECT_EQ(VLIBCFileSetSection(file.c_str(), "s", nullptr, ok.get(), nullptr), 1);
+    // Only the one fixed line format is accepted.
+    EXPECT_LT(VLIBCFileAddSection(file.c_str(), "t", ok.get(), "%s=%s\n"), 0);
+    EXPECT_LT(VLIBCFileAddSection(file.c_str(), "t", nullptr, nullptr), 0);
+}
+
+TEST(SectionFile, MalformedFilesFailClearlyAndAreNeverRewritten) {
+    LogCapture log;
+    TempDir dir;
+    std::string file = dir / "f";
+    const std::string garbage[] = {
+        "[s]\n\tk=\"v\"\nthis is not a pair\n",
+        "orphan=\"before any section\"\n[s]\n",
+        "[s]\n\tk=\"unterminated\n",
+        "[]\n",
+        std::string("[s]\n\tk=\"v\0x\"\n", 12),
+        "[s]\n\tk=\"" + std::string(70000, 'y') + "\"\n",
+    };
+    for (const std::string& content : garbage) {
+        WriteFile(file, content);
+        Table out;
+        EXPECT_LT(VLIBCFileGetSection(file.c_str(), "s", out.ptr()), 0);
+        EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_BAD_FORMAT);
+        Table values({{"k", "new"}});
+        EXPECT_LT(VLIBCFileSetSection(file.c_str(), "s", nullptr, values.get(), nullptr), 0);
+        EXPECT_LT(VLIBCFileAddSection(file.c_str(), "t", values.get(), nullptr), 0);
+        EXPECT_LT(VLIBCFileRemoveSection(file.c_str(), "s"), 0);
+        EXPECT_EQ(ReadFile(file), content);
+    }
+    EXPECT_TRUE(log.Contains("Malformed line 3 in section file '" + file + "'"));
+}
+
+TEST(SectionFile, MissingAndUnreadableFiles) {
+    LogCapture log;
+    TempDir dir;
+    std::string missing = dir / "missing";
+    Table out;
+    EXPECT_LT(VLIBCFileGetSection(missing.c_str(), "s", out.ptr()), 0);
+    EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_FILE_NOT_FOUND);
+    VLIBSzList* list = VLIBCSzListAlloc(1);
+    EXPECT_LT(VLIBCFileEnumSection(missing.c_str(), &list), 0);
+    VLIBCSzListFree(list);
+    EXPECT_LT(VLIBCIFileModifySection(missing.c_str(), "s", nullptr, out.get(), 1, nullptr), 0);
+    EXPECT_EQ(VLIBCFileExist(missing.c_str()), 0);
+
+    // A directory where the file should be cannot be read (even by root).
+    std::string dir_instead = dir / "isdir";
+    ASSERT_EQ(mkdir(dir_instead.c_str(), 0755), 0);
+    EXPECT_LT(VLIBCFileGetSection(dir_instead.c_str(), "s", out.ptr()), 0);
+    EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_IO);
+    EXPECT_TRUE(log.Contains("Fail to read section file '" + dir_instead + "'"));
+    EXPECT_EQ(VLIBCFileExist(dir_instead.c_str()), 0);
+
+    // Writers create a missing file, with mode 0644 (before umask).
+    Table values({{"k", "v"}});
+    mode_t old_mask = umask(022);
+    EXPECT_EQ(VLIBCFileAddSection(missing.c_str(), "s", values.get(), nullptr), 1);
+    umask(old_mask);
+    struct stat st;
+    ASSERT_EQ(stat(missing.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0644u);
+    EXPECT_EQ(VLIBCFileExist(missing.c_str()), 1);
+}
+
+TEST(SectionFile, RewriteKeepsModeAndFollowsSymlinks) {
+    TempDir dir;
+    std::string real = dir / "real.conf";
+    std::string link = dir / "link.conf";
+    WriteFile(real, "[s]\n");
+    ASSERT_EQ(chmod(real.c_str(), 0640), 0);
+    ASSERT_EQ(symlink(real.c_str(), link.c_str()), 0);
+    Table values({{"k", "v"}});
+    ASSERT_EQ(VLIBCFileSetSection(link.c_str(), "s", nullptr, values.get(), nullptr), 1);
+    struct stat st;
+    ASSERT_EQ(lstat(link.c_str(), &st), 0);
+    EXPECT_TRUE(S_ISLNK(st.st_mode));
+    ASSERT_EQ(stat(real.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0640u);
+    EXPECT_EQ(ReadFile(real), "[s]\n\tk=\"v\"\n");
+}
+
+// Each step of a replacement fails once on purpose: the old file must survive byte for byte, and
+// no temporary file may stay behind.
+TEST(SectionFile, AFailedWriteKeepsTheOldContent) {
+    LogCapture log;
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file, "[s]\n\tk=\"old\"\n");
+    const std::string before = ReadFile(file);
+    for (const char* failing : {"write", "fsync", "rename"}) {
+        std::string wanted(failing);
+        s2s_platform::SetSectionWriteFault(
+            [&](const char* step) { return wanted == step ? ENOSPC : 0; });
+        Table values({{"k", "new"}});
+        EXPECT_LT(VLIBCFileSetSection(file.c_str(), "s", nullptr, values.get(), nullptr), 0)
+            << failing;
+        EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_IO);
+        EXPECT_EQ(ReadFile(file), before) << failing;
+        EXPECT_EQ(Leftovers(dir), 0) << failing;
+        EXPECT_TRUE(log.Contains("Fail to " + wanted + " the new content of"));
+    }
+    s2s_platform::SetSectionWriteFault(nullptr);
+    Table values({{"k", "new"}});
+    EXPECT_EQ(VLIBCFileSetSection(file.c_str(), "s", nullptr, values.get(), nullptr), 1);
+    EXPECT_EQ(ReadFile(file), "[s]\n\tk=\"new\"\n");
+}
+
+// Writers in separate processes each add their own keys to one section many times; the flock
+// around each read-modify-write must keep every key.
+TEST(SectionFile, ConcurrentWritersInSeparateProcessesLoseNoUpdate) {
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file, "[counter]\n");
+    constexpr int kWriters = 4;
+    constexpr int kWrites = 40;
+    std::vector<pid_t> children;
+    for (int w = 0; w < kWriters; ++w) {
+        pid_t pid = fork();
+        ASSERT_GE(pid, 0);
+        if (pid == 0) {
+            int failures = 0;
+            for (int i = 0; i < kWrites; ++i) {
+                VLIBSzHash* values = VLIBCSzHashAlloc(1);
+                std::string key = "w" + std::to_string(w) + "_" + std::to_string(i);
+                VLIBCSzHashSetValue(&values, key.c_str(), "1");
+                failures +=
+                    VLIBCFileSetSection(file.c_str(), "counter", nullptr, values, nullptr) == 1 ? 0
+                                                                                                : 1;
+                VLIBCSzHashFree(values);
+            }
+            _exit(failures == 0 ? 0 : 1);
+        }
+        children.push_back(pid);
+    }
+    for (pid_t pid : children) {
+        int status = 0;
+        ASSERT_EQ(waitpid(pid, &status, 0), pid);
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+    }
+    Table out;
+    ASSERT_EQ(VLIBCFileGetSection(file.c_str(), "counter", out.ptr()), 1);
+    EXPECT_EQ(VLIBCSzHashCount(out.get()), kWriters * kWrites);
+    EXPECT_EQ(Leftovers(dir), 0);
+}
+
+// A writer process is killed at random moments in the middle of rewriting a large file. After
+// every kill the file must parse, and each section must be one whole generation: every key of a
+// section carries the same generation number, which a torn or half-merged write would break.
+TEST(SectionFile, WriterKilledMidUpdateNeverLeavesATornFile) {
+    TempDir dir;
+    std::string file = dir / "crash.info";
+    std::mt19937 rng(12345);
+    constexpr int kSections = 6;
+    constexpr int kKeys = 40;
+    constexpr int kRounds = 60;
+    const std::string padding(300, 'p');
+    int last_seen_generation = -1;
+    int killed_mid_replacement = 0;
+    for (int round = 0; round < kRounds; ++round) {
+        int progress[2];
+        ASSERT_EQ(pipe(progress), 0);
+        pid_t pid = fork();
+        ASSERT_GE(pid, 0);
+        if (pid == 0) {
+            close(progress[0]);
+            for (int generation = round * 100000;; ++generation) {
+                VLIBSzHash* values = VLIBCSzHashAlloc(kKeys);
+                for (int k = 0; k < kKeys; ++k) {
+                    std::string key = "key" + std::to_string(k);
+                    std::string value = std::to_string(generation) + ":" + padding;
+                    VLIBCSzHashSetValue(&values, key.c_str(), value.c_str());
+                }
+                std::string section = "SECTION_" + std::to_string(generation % kSections);
+                if (VLIBCFileSetSection(file.c_str(), section.c_str(), nullptr, values, nullptr) !=
+                    1) {
+                    _exit(2);
+                }
+                VLIBCSzHashFree(values);
+                char tick = 1;
+                if (write(progress[1], &tick, 1) != 1) {
+                    _exit(3);
+                }
+            }
+        }
+        close(progress[1]);
+        // Let it complete a few writes, then kill it at a random point inside a later one.
+        int wanted = 1 + static_cast<int>(rng() % 4);
+        for (int got = 0; got < wanted;) {
+            char tick;
+            ssize_t n = read(progress[0], &tick, 1);
+            ASSERT_EQ(n, 1) << "writer died on its own in round " << round;
+            ++got;
+        }
+        usleep(rng() % 1500);
+        kill(pid, SIGKILL);
+        int status = 0;
+        ASSERT_EQ(waitpid(pid, &status, 0), pid);
+        close(progress[0]);
+        ASSERT_TRUE(WIFSIGNALED(status)) << "writer failed in round " << round;
+        killed_mid_replacement += Leftovers(dir) > 0 ? 1 : 0;
+
+        std::vector<std::string> names = Sections(file);
+        ASSERT_FALSE(names.empty()) << "round " << round;
+        for (const std::string& name : names) {
+            Table out;
+            ASSERT_EQ(VLIBCFileGetSection(file.c_str(), name.c_str(), out.ptr()), 1);
+            ASSERT_EQ(VLIBCSzHashCount(out.get()), kKeys) << name << " round " << round;
+            std::string first = out["key0"];
+            std::string generation = first.substr(0, first.find(':'));
+            for (int k = 0; k < kKeys; ++k) {
+                std::string key = "key" + std::to_string(k);
+                ASSERT_EQ(out[key.c_str()], generation + ":" + padding)
+                    << name << " round " << round;
+            }
+            last_seen_generation = std::max(last_seen_generation, std::stoi(generation));
+        }
+    }
+    EXPECT_GE(last_seen_generation, (kRounds - 1) * 100000);
+    // The kills must really have landed inside replacements (a temporary file was in flight).
+    EXPECT_GT(killed_mid_replacement, kRounds / 6) << killed_mid_replacement;
+    // The next writer clears what killed writers left behind.
+    Table values({{"k", "v"}});
+    ASSERT_EQ(VLIBCFileSetSection(file.c_str(), "final", nullptr, values.get(), nullptr), 1);
+    EXPECT_EQ(Leftovers(dir), 0);
+}
+
+}  // namespace
