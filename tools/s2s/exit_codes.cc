@@ -1,0 +1,133 @@
+#include "tools/s2s/exit_codes.h"
+
+#include <cstdio>
+
+namespace s2s_cli {
+
+namespace {
+
+struct ExitInfo {
+    ExitCode code;
+    const char* name;
+    const char* meaning;
+};
+
+const ExitInfo kExitTable[] = {
+    {kExitOK, "ok", "everything asked for was done"},
+    {kExitInternal, "internal", "a local failure (share facts, client identity, temporary files)"},
+    {kExitUsage, "usage", "the command line is wrong"},
+    {kExitInvalidTask, "invalid-task", "the task file or the task's settings are invalid"},
+    {kExitPassword, "password", "the password could not be read safely"},
+    {kExitUnreachable, "unreachable", "no address of the server answered"},
+    {kExitAuth, "auth", "the server refused the user name or password"},
+    {kExitConflict, "conflict", "a share is already paired with another client"},
+    {kExitRefused, "refused", "the server refused a command"},
+    {kExitTransfer, "transfer", "copying a share failed; it is not marked complete"},
+    {kExitKeySync, "key-sync", "an encrypted share's key could not be sent"},
+    {kExitRegistry, "registry", "the share registry could not be read or changed"},
+    {kExitCancelled, "cancelled", "stopped by a signal; nothing was marked complete"},
+};
+
+struct ResultInfo {
+    int code;
+    const char* name;
+    const char* meaning;
+};
+
+// rsync's own exit codes, then the answers of the sync server, then the client's local codes.
+// The server's numbers are fixed by the protocol document (docs/protocol.md).
+const ResultInfo kResultTable[] = {
+    {0, "ok", "accepted"},
+    {1, "rsync-usage", "rsync rejected its command line"},
+    {2, "protocol-incompatible", "the rsync protocol versions do not match"},
+    {3, "file-selection", "rsync could not select the files to send"},
+    {4, "not-supported", "the requested action is not supported by the server's rsync"},
+    {5, "session-refused", "the server refused the rsync session"},
+    {6, "daemon-log", "the server's rsync daemon could not write its log"},
+    {10, "socket-io", "the connection to the server failed"},
+    {11, "file-io", "reading or writing a file failed"},
+    {12, "stream-error", "the rsync data stream broke"},
+    {13, "diagnostics", "rsync could not write its diagnostics"},
+    {14, "ipc", "rsync's internal pipes failed"},
+    {20, "interrupted", "rsync was stopped by a signal"},
+    {21, "waitpid", "rsync could not wait for its helper"},
+    {22, "out-of-memory", "rsync ran out of memory"},
+    {23, "partial", "some files could not be transferred"},
+    {24, "vanished", "some source files vanished during the transfer"},
+    {25, "max-delete", "the deletion limit stopped deletions"},
+    {30, "timeout", "the transfer stalled past its time limit"},
+    {35, "connect-timeout", "the server's rsync daemon did not answer in time"},
+    {42, "no-address", "no address of the server could be looked up"},
+    {43, "unknown-command", "the server does not know the command (an old server)"},
+    {51, "unknown-command", "the server does not know the command (an old server)"},
+    {202, "attributes-refused", "the server does not accept share attributes"},
+    {207, "dry-run-ok", "the dry-run pairing answered"},
+    {213, "not-tested", "no server address was tested"},
+    {214, "conflict", "some shares are paired with another client"},
+    {300, "local-key-failure", "the share's key could not be found locally"},
+};
+
+}  // namespace
+
+const char* ExitCodeName(ExitCode code) {
+    for (const ExitInfo& info : kExitTable) {
+        if (info.code == code) {
+            return info.name;
+        }
+    }
+    return "unknown";
+}
+
+const char* ExitCodeMeaning(ExitCode code) {
+    for (const ExitInfo& info : kExitTable) {
+        if (info.code == code) {
+            return info.meaning;
+        }
+    }
+    return "";
+}
+
+std::string ResultName(int code) {
+    for (const ResultInfo& info : kResultTable) {
+        if (info.code == code) {
+            char text[96];
+            std::snprintf(text, sizeof(text), "%s (%d)", info.name, code);
+            return text;
+        }
+    }
+    char text[32];
+    std::snprintf(text, sizeof(text), "code %d", code);
+    return text;
+}
+
+const char* ResultMeaning(int code) {
+    for (const ResultInfo& info : kResultTable) {
+        if (info.code == code) {
+            return info.meaning;
+        }
+    }
+    return "";
+}
+
+bool IsAuthFailure(int code) {
+    return code == 5;
+}
+
+ExitCode ClassifyConnectResult(int code) {
+    if (IsAuthFailure(code)) {
+        return kExitAuth;
+    }
+    return kExitUnreachable;
+}
+
+ExitCode ClassifyTransferResult(int code) {
+    if (code == 20) {
+        return kExitCancelled;
+    }
+    if (IsAuthFailure(code)) {
+        return kExitAuth;
+    }
+    return kExitTransfer;
+}
+
+}  // namespace s2s_cli

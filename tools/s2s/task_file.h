@@ -1,0 +1,31 @@
+// Task files: a sync task written as the task map of the sync model in JSON, one object whose
+// keys are the map's keys ("name", "share_list", "server_ip", "schedule_mode", ...). The file is
+// checked strictly before anything else sees it: unknown or repeated keys, wrong kinds and
+// out-of-range numbers are errors that name the key, so a typo never silently becomes a default.
+#ifndef S2S_TOOLS_S2S_TASK_FILE_H
+#define S2S_TOOLS_S2S_TASK_FILE_H
+
+#include <string>
+
+#include "s2s_pobject.h"
+#include "s2s_sync_obj.h"
+
+namespace s2s_cli {
+
+// Parses the JSON text of a task into a task map. On failure `error` says what is wrong and where.
+bool ParseTaskJson(const std::string& text, S2S::PObject& map, std::string& error);
+
+// Reads a task file (a regular file of at most 1 MiB) and parses it. `has_password` tells whether
+// it carries "pswd"; such a file must not be readable by other users.
+bool LoadTaskFile(const std::string& path, S2S::PObject& map, bool& has_password,
+                  std::string& error);
+
+// LoadTaskFile, then the map turned into a task by the sync model's own conversion.
+bool LoadTask(const std::string& path, S2S::SyncTask& task, bool& has_password, std::string& error);
+
+// The task map as indented JSON, without the password.
+std::string TaskMapToJson(const S2S::PObject& map);
+
+}  // namespace s2s_cli
+
+#endif  // S2S_TOOLS_S2S_TASK_FILE_H
