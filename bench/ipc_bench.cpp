@@ -1,0 +1,186 @@
+// One IPC request/reply round trip per iteration: IPCSender::send(request, true, reply) against a
+// serving thread (IPCListener, accept, IPCSender::assign, recv, send), over a domain socket and
+// over TCP loopback. The anchor is a raw ping-pong of the same encoded bytes over the same kind
+// of socket: write the request, read it whole, write the reply, read it whole.
+#include <arpa/inet.h>
+#include <benchmark/benchmark.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+#include <thread>
+
+#include "bench/transport_bench_util.h"
+#include "s2s_channel.h"
+#include "s2s_ipc.h"
+#include "s2s_stream.h"
+
+namespace {
+
+using S2S::IPCListener;
+using S2S::IPCSender;
+using S2S::PObject;
+
+PObject Reply() {
+    PObject reply;
+    reply["result"] = 0ULL;
+    reply["task_id"] = 17ULL;
+    reply["status"] = "queued";
+    return reply;
+}
+
+// The PStream bytes of `message`.
+std::string Encoded(const PObject& message) {
+    int fds[2];
+    if (socketpair(AF_UNIX, SOCK_STREAM, 0, fds) != 0) {
+        s2s_bench::Die("socketpair");
+    }
+    {
+        S2S::Channel channel(IPCSender::kCapacity);
+        S2S::PStream stream;
+        if (channel.Open(fds[0], true) != 0 || stream.Send(channel, message) != 0) {
+            s2s_bench::Die("encode");
+        }
+    }
+    std::string bytes;
+    char buf[65536];
+    for (ssize_t n; (n = read(fds[1], buf, sizeof(buf))) > 0;) {
+        bytes.append(buf, static_cast<size_t>(n));
+    }
+    close(fds[1]);
+    return bytes;
+}
+
+// A listener on a fresh domain socket path or a kernel-chosen loopback port; removes its path.
+struct Endpoint {
+    explicit Endpoint(bool domain) {
+        if (domain) {
+            char dir[] = "/tmp/s2s-ipc-bench.XXXXXX";
+            if (mkdtemp(dir) == nullptr) {
+                s2s_bench::Die("mkdtemp");
+            }
+            directory = dir;
+            path = directory + "/daemon.sock";
+            if (listener.prepare(path) != 0) {
+                s2s_bench::Die("prepare");
+            }
+        } else {
+            port = listener.prepare(0);
+            if (port <= 0) {
+                s2s_bench::Die("prepare");
+            }
+        }
+    }
+    ~Endpoint() {
+        listener.close();
+        if (!directory.empty()) {
+            rmdir(directory.c_str());
+        }
+    }
+    int Connect(IPCSender& sender) const {
+        return path.empty() ? sender.connect(port) : sender.connect(path);
+    }
+    IPCListener listener;
+    std::string directory;
+    std::string path;
+    int port = 0;
+};
+
+void BM_IPC(benchmark::State& state, bool domain) {
+    s2s_bench::IgnoreSigpipe();
+    const PObject request = s2s_bench::TaskMap();
+    const PObject answer = Reply();
+    Endpoint endpoint(domain);
+    std::thread server([&] {
+        int fd = endpoint.listener.accept();
+        IPCSender end;
+        if (fd < 0 || end.assign(fd) != 0) {
+            s2s_bench::Die("accept");
+        }
+        for (;;) {
+            PObject message;
+            if (end.recv(message) != 0 || end.send(answer) != 0) {
+                return;  // the client closed: the run is over
+            }
+        }
+    });
+    {
+        IPCSender client;
+        if (endpoint.Connect(client) != 0) {
+            s2s_bench::Die("connect");
+        }
+        for (auto _ : state) {
+            PObject reply;
+            if (client.send(request, true, reply) != 0) {
+                s2s_bench::Die("round trip");
+            }
+            benchmark::DoNotOptimize(reply);
+        }
+    }
+    server.join();
+    state.counters["request_bytes"] = static_cast<double>(Encoded(request).size());
+}
+
+void BM_RawPingPong(benchmark::State& state, bool domain) {
+    s2s_bench::IgnoreSigpipe();
+    const std::string request = Encoded(s2s_bench::TaskMap());
+    const std::string answer = Encoded(Reply());
+    Endpoint endpoint(domain);
+    std::thread server([&] {
+        int fd = endpoint.listener.accept();
+        if (fd < 0) {
+            s2s_bench::Die("accept");
+        }
+        std::string buf(request.size(), '\0');
+        while (s2s_bench::ReadAll(fd, &buf[0], buf.size())) {
+            s2s_bench::WriteAll(fd, answer.data(), answer.size());
+        }
+        close(fd);
+    });
+    {
+        // A plain blocking socket of the same kind.
+        int fd = -1;
+        if (domain) {
+            fd = socket(AF_UNIX, SOCK_STREAM, 0);
+            sockaddr_un addr{};
+            addr.sun_family = AF_UNIX;
+            std::snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", endpoint.path.c_str());
+            if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+                s2s_bench::Die("connect");
+            }
+        } else {
+            fd = socket(AF_INET, SOCK_STREAM, 0);
+            sockaddr_in addr{};
+            addr.sin_family = AF_INET;
+            addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+            addr.sin_port = htons(static_cast<uint16_t>(endpoint.port));
+            if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+                s2s_bench::Die("connect");
+            }
+        }
+        std::string buf(answer.size(), '\0');
+        for (auto _ : state) {
+            s2s_bench::WriteAll(fd, request.data(), request.size());
+            if (!s2s_bench::ReadAll(fd, &buf[0], buf.size())) {
+                s2s_bench::Die("reply");
+            }
+            benchmark::DoNotOptimize(buf.data());
+        }
+        close(fd);
+    }
+    server.join();
+    state.counters["request_bytes"] = static_cast<double>(request.size());
+}
+
+BENCHMARK_CAPTURE(BM_IPC, domain_socket, true)->UseRealTime();
+BENCHMARK_CAPTURE(BM_RawPingPong, domain_socket, true)->UseRealTime();
+BENCHMARK_CAPTURE(BM_IPC, tcp_loopback, false)->UseRealTime();
+BENCHMARK_CAPTURE(BM_RawPingPong, tcp_loopback, false)->UseRealTime();
+
+}  // namespace
+
+BENCHMARK_MAIN();
