@@ -1,0 +1,496 @@
+// RsyncWrapper against a real rsync daemon set up by s2s-receiver on a free loopback port: data
+// runs (ownership, permissions, times, links, sparse and large files, non-ASCII names, deletes,
+// excludes, relative paths), the key module, cancellation, a wrong password, a server that is
+// down, and the command transport (exact result codes, 1 MiB output, concurrency, clean spool).
+#include <dirent.h>
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/time.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <fstream>
+#include <map>
+#include <random>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "gtest/gtest.h"
+#include "rsync/wrapper_fixture.h"
+#include "s2s_rsync_wrapper.h"
+
+namespace {
+
+using VURN::Backup::RsyncWrapper;
+using wrapper_test::CountEntries;
+using wrapper_test::MakeDirs;
+using wrapper_test::Server;
+
+const char kClientID[] = "SN-TEST-CLIENT";
+
+// Incompressible content: one random MiB, varied per MiB so that no two blocks are equal.
+void WriteRandom(const std::string& path, size_t size, unsigned seed) {
+    std::mt19937 gen(seed);
+    std::string block(1 << 20, '\0');
+    for (char& c : block) {
+        c = static_cast<char>(gen());
+    }
+    std::string data;
+    data.reserve(size);
+    for (size_t n = 0; data.size() < size; ++n) {
+        block[n % block.size()] ^= static_cast<char>(n + 1);
+        data.append(block, 0, std::min(block.size(), size - data.size()));
+    }
+    s2s_test::WriteFile(path, data);
+}
+
+void SetMtime(const std::string& path, time_t when) {
+    struct timeval tv[2] = {{when, 0}, {when, 0}};
+    lutimes(path.c_str(), tv);
+}
+
+// Type, mode, owner, mtime, size, content and link target of every entry below `root`, and
+// which regular files share an inode.
+std::map<std::string, std::string> Snapshot(const std::string& root) {
+    std::map<std::string, std::string> out;
+    std::map<ino_t, std::string> inodes;
+    std::vector<std::string> pending = {""};
+    while (!pending.empty()) {
+        std::string rel = pending.back();
+        pending.pop_back();
+        DIR* d = opendir((root + rel).c_str());
+        if (d == nullptr) {
+            continue;
+        }
+        std::vector<std::string> names;
+        while (struct dirent* e = readdir(d)) {
+            std::string n = e->d_name;
+            if (n != "." && n != "..") {
+                names.push_back(n);
+            }
+        }
+        closedir(d);
+        for (const auto& n : names) {
+            std::string child = rel + "/" + n;
+            struct stat st;
+            lstat((root + child).c_str(), &st);
+            std::string desc = std::to_string(st.st_mode) + " " + std::to_string(st.st_uid) + ":" +
+                               std::to_string(st.st_gid);
+            if (S_ISDIR(st.st_mode)) {
+                pending.push_back(child);
+            } else {
+                desc += " t" + std::to_string(st.st_mtime) + " s" + std::to_string(st.st_size);
+            }
+            if (S_ISLNK(st.st_mode)) {
+                char target[4096];
+                ssize_t len = readlink((root + child).c_str(), target, sizeof target);
+                desc += " ->" + std::string(target, len > 0 ? static_cast<size_t>(len) : 0);
+            } else if (S_ISREG(st.st_mode)) {
+                std::string content = s2s_test::ReadFile(root + child);
+                desc += " h" + std::to_string(std::hash<std::string>()(content));
+                if (st.st_nlink > 1) {
+                    auto it = inodes.emplace(st.st_ino, child).first;
+                    desc += " link:" + it->second;
+                }
+            }
+            out[child] = desc;
+        }
+    }
+    return out;
+}
+
+// Processes whose command line mentions `needle` (the test's unique paths).
+int ProcessesMentioning(const std::string& needle) {
+    int n = 0;
+    DIR* d = opendir("/proc");
+    while (struct dirent* e = readdir(d)) {
+        if (e->d_name[0] < '0' || e->d_name[0] > '9' || atoi(e->d_name) == getpid()) {
+            continue;
+        }
+        std::string cmd = s2s_test::ReadFile(std::string("/proc/") + e->d_name + "/cmdline");
+        std::string stat = s2s_test::ReadFile(std::string("/proc/") + e->d_name + "/stat");
+        size_t paren = stat.rfind(')');
+        bool zombie =
+            paren != std::string::npos && paren + 2 < stat.size() && stat[paren + 2] == 'Z';
+        if (!zombie && cmd.find(needle) != std::string::npos) {
+            ++n;
+        }
+    }
+    closedir(d);
+    return n;
+}
+
+class WrapperTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        if (geteuid() != 0) {
+            GTEST_SKIP() << "the receiver's daemon needs root (chroot, ownership)";
+        }
+        server_.reset(new Server());
+        server_->AddShare("photos");
+        server_->AddShare("docs");
+        server_->AddShare("vault", true);
+        std::string error = server_->Start();
+        ASSERT_EQ(error, "");
+    }
+
+    // The daemon removes a reply after its client has gone, so the spool empties shortly after.
+    void ExpectCleanSpool() const {
+        EXPECT_TRUE(s2s_test::WaitFor([&] {
+            return CountEntries(server_->Spool() + "/replies") == 0 &&
+                   CountEntries(server_->Spool() + "/conns") == 0;
+        })) << "replies left in the spool";
+    }
+
+    std::unique_ptr<Server> server_;
+    s2s_test::TempDir local_{"s2s-wrapper-src"};
+};
+
+TEST_F(WrapperTest, DataRunsKeepMetadataAndFollowChanges) {
+    const std::string src = local_.path() + "/share";
+    MakeDirs(src + "/sub/deeper");
+    s2s_test::WriteFile(src + "/plain.txt", "hello\n");
+    s2s_test::WriteFile(src + "/sub/Ünïcødé ファイル.txt", "non-ascii\n");
+    chmod((src + "/plain.txt").c_str(), 0640);
+    chown((src + "/plain.txt").c_str(), 1234, 5678);
+    s2s_test::WriteFile(src + "/sub/deeper/exec.sh", "#!/bin/sh\n");
+    chmod((src + "/sub/deeper/exec.sh").c_str(), 0751);
+    symlink("../plain.txt", (src + "/sub/link").c_str());
+    symlink("/nowhere/absolute", (src + "/dangling").c_str());
+    link((src + "/plain.txt").c_str(), (src + "/hard.txt").c_str());
+    WriteRandom(src + "/large.bin", 24 << 20, 1);
+    {
+        int fd = open((src + "/sparse.img").c_str(), O_WRONLY | O_CREAT, 0600);
+        ASSERT_EQ(pwrite(fd, "end", 3, (64 << 20) - 3), 3);
+        close(fd);
+    }
+    s2s_test::WriteFile(src + "/skip.tmp", "excluded\n");
+    MakeDirs(src + "/cache");
+    s2s_test::WriteFile(src + "/cache/x", "excluded\n");
+    for (const char* p : {"/plain.txt", "/sub/deeper/exec.sh", "/large.bin", "/sparse.img"}) {
+        SetMtime(src + p, 1500000000);
+    }
+
+    auto run = [&]() {
+        RsyncWrapper w;
+        w.setDelete(true);
+        w.setNumericIds(true);
+        w.setVurnPseudoRoot(true);
+        w.setTimeout(600);
+        w.setExcludeRule({"*.tmp", "/cache/"});
+        w.setSrcPath(src + "/");
+        server_->Aim(w, "photos");
+        int rc = w.execute(boost::function<bool()>());
+        EXPECT_EQ(rc, 0) << w.lastError();
+    };
+    run();
+    auto expected = Snapshot(src);
+    expected.erase("/skip.tmp");
+    expected.erase("/cache");
+    expected.erase("/cache/x");
+    EXPECT_EQ(Snapshot(server_->SharePath("photos")), expected);
+    struct stat st;
+    ASSERT_EQ(stat((server_->SharePath("photos") + "/sparse.img").c_str(), &st), 0);
+    EXPECT_LT(st.st_blocks * 512, 1 << 20) << "the sparse file arrived filled";
+
+    // Change, delete and add; the next run mirrors it, excluded files stay untouched.
+    s2s_test::WriteFile(src + "/plain.txt", "changed content\n");
+    unlink((src + "/sub/link").c_str());
+    unlink((src + "/hard.txt").c_str());
+    s2s_test::RemoveTree(src + "/sub/deeper");
+    s2s_test::WriteFile(src + "/new.txt", "new\n");
+    s2s_test::WriteFile(server_->SharePath("photos") + "/keep.tmp", "server-side excluded\n");
+    run();
+    expected = Snapshot(src);
+    expected.erase("/skip.tmp");
+    expected.erase("/cache");
+    expected.erase("/cache/x");
+    auto got = Snapshot(server_->SharePath("photos"));
+    EXPECT_EQ(got.count("/keep.tmp"), 1u);
+    got.erase("/keep.tmp");
+    EXPECT_EQ(got, expected);
+}
+
+TEST_F(WrapperTest, RelativeRunRecreatesThePathInsideTheModule) {
+    const std::string src = local_.path() + "/share";
+    MakeDirs(src + "/a/b");
+    s2s_test::WriteFile(src + "/a/b/f", "x");
+    s2s_test::WriteFile(src + "/a/other", "not sent");
+    RsyncWrapper w;
+    w.setRelativePath(true);
+    w.setSrcPath(src + "/./a/b");
+    server_->Aim(w, "docs");
+    ASSERT_EQ(w.execute(boost::function<bool()>()), 0) << w.lastError();
+    EXPECT_EQ(s2s_test::ReadFile(server_->SharePath("docs") + "/a/b/f"), "x");
+    EXPECT_NE(access((server_->SharePath("docs") + "/a/other").c_str(), F_OK), 0);
+}
+
+TEST_F(WrapperTest, EncryptedModuleAndKeyDirectory) {
+    const std::string cipher = local_.path() + "/@vault@";
+    MakeDirs(cipher);
+    s2s_test::WriteFile(cipher + "/ENCRYPTED-NAME", "ciphertext");
+    RsyncWrapper data;
+    data.setSrcPath(cipher + "/");
+    server_->Aim(data, "@vault@");
+    ASSERT_EQ(data.execute(boost::function<bool()>()), 0) << data.lastError();
+    EXPECT_EQ(s2s_test::ReadFile(server_->EncryptedPath("vault") + "/ENCRYPTED-NAME"),
+              "ciphertext");
+
+    // An absolute server directory with a module: the key lands in a directory named after the
+    // share inside the key directory, and the key module cannot be read back.
+    s2s_test::WriteFile(local_.path() + "/vault.key", "KEY");
+    RsyncWrapper key;
+    key.setSrcPath(local_.path() + "/vault.key");
+    server_->Aim(key, "/usr/vurn/etc/.encrypt", "vault");
+    ASSERT_EQ(key.execute(boost::function<bool()>()), 0) << key.lastError();
+    EXPECT_EQ(s2s_test::ReadFile(server_->KeyDir() + "/vault/vault.key"), "KEY");
+
+    RsyncWrapper unmapped;
+    unmapped.setSrcPath(local_.path() + "/vault.key");
+    server_->Aim(unmapped, "/etc", "vault");
+    EXPECT_EQ(unmapped.execute(boost::function<bool()>()), RsyncWrapper::kResultUsage);
+}
+
+TEST_F(WrapperTest, CancelStopsTheWholeRunQuickly) {
+    const std::string src = local_.path() + "/big";
+    MakeDirs(src);
+    for (int i = 0; i < 4; ++i) {
+        WriteRandom(src + "/f" + std::to_string(i), 48 << 20, 10 + i);
+    }
+    RsyncWrapper w;
+    w.setCompress(true);  // slows the transfer down enough to be caught in the middle
+    w.setSrcPath(src + "/");
+    server_->Aim(w, "photos");
+    std::atomic<int> progressCalls{0};
+    w.setProgressCallback([&](int) { ++progressCalls; });
+    std::atomic<bool> passwordSeen{false};
+    auto started = std::chrono::steady_clock::now();
+    std::chrono::steady_clock::time_point asked;
+    int polls = 0;
+    int rc = w.execute([&]() {
+        ++polls;
+        auto now = std::chrono::steady_clock::now();
+        if (polls == 3) {
+            passwordSeen = ProcessesMentioning(server_->Password()) > 0;
+        }
+        if (now - started > std::chrono::milliseconds(700)) {
+            asked = now;
+            return true;
+        }
+        return false;
+    });
+    auto stopped = std::chrono::steady_clock::now();
+    EXPECT_EQ(rc, RsyncWrapper::kResultCancelled);
+    EXPECT_LT(stopped - asked, std::chrono::seconds(4));
+    EXPECT_GE(polls, 3);
+    EXPECT_FALSE(passwordSeen) << "the password showed on a command line";
+    EXPECT_EQ(ProcessesMentioning(src), 0) << "a process of the cancelled run survived";
+    EXPECT_GT(progressCalls.load(), 0);
+}
+
+TEST_F(WrapperTest, FailuresKeepRsyncsCodes) {
+    s2s_test::WriteFile(local_.path() + "/f", "x");
+    RsyncWrapper wrong;
+    wrong.setSrcPath(local_.path() + "/f");
+    server_->Aim(wrong, "photos");
+    wrong.setDestPath("127.0.0.1", server_->User(), "not-the-password", "photos", "");
+    EXPECT_EQ(wrong.execute(boost::function<bool()>()), 5);
+    EXPECT_NE(wrong.lastError().find("auth failed"), std::string::npos) << wrong.lastError();
+    EXPECT_EQ(wrong.lastError().find("not-the-password"), std::string::npos);
+
+    RsyncWrapper unknown;
+    unknown.setSrcPath(local_.path() + "/f");
+    server_->Aim(unknown, "no-such-share");
+    EXPECT_EQ(unknown.execute(boost::function<bool()>()), 5);
+
+    RsyncWrapper noPassword;
+    noPassword.setSrcPath(local_.path() + "/f");
+    server_->Aim(noPassword, "photos");
+    noPassword.setDestPath("127.0.0.1", server_->User(), "", "photos", "");
+    EXPECT_EQ(noPassword.execute(boost::function<bool()>()), RsyncWrapper::kResultUsage);
+
+    RsyncWrapper badServer;
+    badServer.setSrcPath(local_.path() + "/f");
+    server_->Aim(badServer, "photos");
+    badServer.setDestPath("-oProxyCommand=x", server_->User(), server_->Password(), "photos", "");
+    EXPECT_EQ(badServer.execute(boost::function<bool()>()), RsyncWrapper::kResultUsage);
+
+    RsyncWrapper noRsync;
+    noRsync.setRsyncPath(local_.path() + "/no-rsync-here");
+    noRsync.setSrcPath(local_.path() + "/f");
+    server_->Aim(noRsync, "photos");
+    EXPECT_EQ(noRsync.execute(boost::function<bool()>()), RsyncWrapper::kResultSpawn);
+
+    server_->Stop();
+    RsyncWrapper down;
+    down.setSrcPath(local_.path() + "/f");
+    server_->Aim(down, "photos");
+    EXPECT_EQ(down.execute(boost::function<bool()>()), 10);
+    RsyncWrapper downCmd;
+    server_->Aim(downCmd, "");
+    downCmd.setVurnCustCmdRule({"command=\"S2S_GetProtocolVer\"", "clientID=\"x\"",
+                                "outfile=\"" + local_.path() + "/out\""});
+    EXPECT_EQ(downCmd.execute(boost::function<bool()>()), 10);
+}
+
+TEST_F(WrapperTest, CommandsReturnTheServersCodeAndOutput) {
+    const std::string out = local_.path() + "/version";
+    s2s_test::WriteFile(out, "stale");
+    RsyncWrapper w;
+    w.setListOnly(true);  // the version query runs as a list-only task; the reply still arrives
+    server_->Aim(w, "");
+    w.setVurnCustCmdRule({"command=\"S2S_GetProtocolVer\"",
+                          std::string("clientID=\"") + kClientID + "\"",
+                          "outfile=\"" + out + "\""});
+    EXPECT_EQ(w.execute(boost::function<bool()>()), 0) << w.lastError();
+    EXPECT_EQ(s2s_test::ReadFile(out), "1\n");
+
+    RsyncWrapper unknown;
+    server_->Aim(unknown, "");
+    unknown.setVurnCustCmdRule({"command=\"S2S_NoSuchThing\"", "clientID=\"abc\""});
+    EXPECT_EQ(unknown.execute(boost::function<bool()>()), 43);
+
+    RsyncWrapper bad;
+    server_->Aim(bad, "");
+    bad.setVurnCustCmdRule({"command=\"S2S_SyncStart\"", "clientID=\"abc\"",
+                            "volumeName=\"volume1\"", "shareName=\"../etc\""});
+    EXPECT_EQ(bad.execute(boost::function<bool()>()), 204);
+
+    RsyncWrapper noModule;
+    server_->Aim(noModule, "");
+    noModule.setCommandModule("@not-a-command-module");
+    noModule.setVurnCustCmdRule({"command=\"S2S_GetProtocolVer\"", "clientID=\"abc\""});
+    EXPECT_EQ(noModule.execute(boost::function<bool()>()), RsyncWrapper::kResultNoCommands);
+
+    RsyncWrapper huge;
+    server_->Aim(huge, "");
+    huge.setVurnCustCmdRule({"command=\"S2S_UpdateTaskStatus\"", "clientID=\"abc\"",
+                             "taskName=\"" + std::string(5000, 't') + "\""});
+    EXPECT_EQ(huge.execute(boost::function<bool()>()), RsyncWrapper::kResultUsage);
+
+    ExpectCleanSpool();
+}
+
+TEST_F(WrapperTest, ConcurrentCommandsStayApart) {
+    constexpr int kClients = 8;
+    std::vector<std::thread> threads;
+    std::vector<int> codes(kClients, -1);
+    std::vector<std::string> outputs(kClients);
+    for (int i = 0; i < kClients; ++i) {
+        threads.emplace_back([&, i]() {
+            const std::string out = local_.path() + "/out" + std::to_string(i);
+            RsyncWrapper w;
+            server_->Aim(w, "");
+            // Odd clients ask a question the server refuses, even ones the version.
+            if (i % 2 == 0) {
+                w.setVurnCustCmdRule({"command=\"S2S_GetProtocolVer\"",
+                                      "clientID=\"C" + std::to_string(i) + "\"",
+                                      "outfile=\"" + out + "\""});
+            } else {
+                w.setVurnCustCmdRule({"command=\"S2S_SyncFinish\"",
+                                      "clientID=\"C" + std::to_string(i) + "\"",
+                                      "finishType=\"bogus\"", "name=\"photos\""});
+            }
+            codes[i] = w.execute(boost::function<bool()>());
+            outputs[i] = s2s_test::ReadFile(out);
+        });
+    }
+    for (auto& t : threads) {
+        t.join();
+    }
+    for (int i = 0; i < kClients; ++i) {
+        EXPECT_EQ(codes[i], i % 2 == 0 ? 0 : 211) << i;
+        EXPECT_EQ(outputs[i], i % 2 == 0 ? "1\n" : "") << i;
+    }
+    ExpectCleanSpool();
+}
+
+// The transport on its own: a daemon whose command module runs a stand-in handler that answers
+// with a code and output taken from the command file, to prove exact codes and 1 MiB outputs.
+TEST(WrapperTransport, ExactCodesAndLargeOutputs) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "needs root";
+    }
+    s2s_test::TempDir dir("s2s-transport");
+    const std::string d = dir.path();
+    MakeDirs(d + "/replies");
+    s2s_test::WriteFile(d + "/secrets", "u:pw-transport\n");
+    chmod((d + "/secrets").c_str(), 0600);
+    s2s_test::WriteFile(d + "/handler.sh",
+                        "#!/bin/sh\n"
+                        "in=$(cat)\n"
+                        "tok=$(printf '%s\\n' \"$in\" | sed -n '1s/^token=\"\\(.*\\)\"$/\\1/p')\n"
+                        "code=$(printf '%s\\n' \"$in\" | sed -n 's/^code=\"\\(.*\\)\"$/\\1/p')\n"
+                        "size=$(printf '%s\\n' \"$in\" | sed -n 's/^size=\"\\(.*\\)\"$/\\1/p')\n"
+                        "mkdir \"" +
+                            d +
+                            "/replies/$tok\" || exit 1\n"
+                            "head -c \"$size\" /dev/zero | tr '\\0' 'x' > \"" +
+                            d +
+                            "/replies/$tok/output\"\n"
+                            "echo \"$code\" > \"" +
+                            d + "/replies/$tok/result\"\n");
+    chmod((d + "/handler.sh").c_str(), 0755);
+    int port = s2s_test::FreeTcpPort();
+    s2s_test::WriteFile(d + "/rsyncd.conf",
+                        "pid file = " + d + "/pid\nport = " + std::to_string(port) +
+                            "\naddress = 127.0.0.1\nuse chroot = yes\n"
+                            "[@s2s-cmd]\npath = " +
+                            d +
+                            "/replies\n"
+                            "auth users = u\nsecrets file = " +
+                            d + "/secrets\nearly exec = " + d + "/handler.sh\n");
+    wrapper_test::Run started =
+        wrapper_test::RunProgram({"/usr/bin/rsync", "--daemon", "--config=" + d + "/rsyncd.conf"});
+    ASSERT_EQ(started.status, 0) << started.output;
+    struct Stop {
+        std::string pidFile;
+        ~Stop() {
+            pid_t pid = atoi(s2s_test::ReadFile(pidFile).c_str());
+            if (pid > 1) {
+                kill(pid, SIGTERM);
+            }
+        }
+    } stop{d + "/pid"};
+    ASSERT_TRUE(s2s_test::WaitFor([&] { return !s2s_test::ReadFile(d + "/pid").empty(); }));
+
+    struct Case {
+        int code;
+        size_t size;
+    };
+    for (Case c : {Case{0, 0}, Case{214, 17}, Case{207, 1}, Case{4242, 1 << 20}, Case{3, 100}}) {
+        const std::string out = d + "/out";
+        s2s_test::WriteFile(out, "");
+        RsyncWrapper w;
+        w.setPort(port);
+        w.setVurnAuth(true, true);
+        w.setDestPath("127.0.0.1", "u", "pw-transport", "", "");
+        w.setVurnCustCmdRule({"command=\"X\"", "code=\"" + std::to_string(c.code) + "\"",
+                              "size=\"" + std::to_string(c.size) + "\"",
+                              "outfile=\"" + out + "\""});
+        // The daemon detaches before it listens: a refused connection (10) is tried again.
+        int rc = -1;
+        ASSERT_TRUE(s2s_test::WaitFor([&] {
+            rc = w.execute(boost::function<bool()>());
+            return rc != 10;
+        }));
+        EXPECT_EQ(rc, c.code) << w.lastError();
+        EXPECT_EQ(s2s_test::ReadFile(out), std::string(c.size, 'x')) << c.code;
+    }
+    // Larger than 1 MiB is not accepted as an output: the caller's file stays as it was.
+    s2s_test::WriteFile(d + "/out", "before");
+    RsyncWrapper w;
+    w.setPort(port);
+    w.setVurnAuth(true, true);
+    w.setDestPath("127.0.0.1", "u", "pw-transport", "", "");
+    w.setVurnCustCmdRule(
+        {"command=\"X\"", "code=\"0\"", "size=\"1048577\"", "outfile=\"" + d + "/out\""});
+    EXPECT_EQ(w.execute(boost::function<bool()>()), 0);
+    EXPECT_EQ(s2s_test::ReadFile(d + "/out"), "before") << "an oversized output was delivered";
+}
+
+}  // namespace
