@@ -136,8 +136,13 @@ struct ShareReport {
     std::string name;
     bool encrypted = false;
     TreeSize size;
+    uint64_t read_bytes = 0;  // what rsync read to send it (unchanged files are not read)
     double seconds = 0.0;
-    std::string state = "pending";  // synced, failed, cancelled, refused, not-run
+    double start_seconds = 0.0;
+    double copy_seconds = 0.0;
+    double key_seconds = 0.0;
+    double finish_seconds = 0.0;
+    std::string state = "not-run";  // synced, failed, cancelled, refused, not-run
     int result = 0;
     std::string step;  // the step that failed: start, copy, key, finish
     std::string message;
@@ -167,6 +172,9 @@ class SyncRun {
     std::string message_;
     int beacon_result_ = -1;
     bool quiet_ = false;
+    double connect_seconds_ = 0.0;
+    double pair_seconds_ = 0.0;
+    double beacon_seconds_ = 0.0;
 };
 
 void SyncRun::Say(const char* format, ...) {
@@ -283,7 +291,10 @@ void SyncRun::SyncShare(ShareReport& share) {
     share.size = MeasureTree(info.GetModulePath());
 
     int result = 0;
-    if (rsyncer_.StartSyncShare(share.name, result) != 0 || result != 0) {
+    Clock::time_point step = Clock::now();
+    const int started = rsyncer_.StartSyncShare(share.name, result);
+    share.start_seconds = SecondsSince(step);
+    if (started != 0 || result != 0) {
         share.step = "start";
         share.result = result;
         share.state = g_stop_signal != 0 ? "cancelled" : "refused";
@@ -295,7 +306,7 @@ void SyncRun::SyncShare(ShareReport& share) {
         return;
     }
 
-    Say("share %s%s: copying %s files, %s\n", share.name.c_str(),
+    Say("share %s%s: copying (%s files, %s)\n", share.name.c_str(),
         share.encrypted ? " (encrypted)" : "", std::to_string(share.size.files).c_str(),
         FormatBytes(share.size.bytes).c_str());
     const bool terminal = isatty(fileno(out_)) != 0;
@@ -306,7 +317,11 @@ void SyncRun::SyncShare(ShareReport& share) {
     g_watch = &watch;
     const std::vector<std::string> excludes_vec = opts_.GetAll("exclude");
     const std::list<std::string> excludes(excludes_vec.begin(), excludes_vec.end());
+    step = Clock::now();
     const int rc = rsyncer_.RunSync(task_.GetID(), share.name, "/", excludes, result);
+    share.copy_seconds = SecondsSince(step);
+    watch.meter.Poll();
+    share.read_bytes = watch.meter.Bytes();
     g_watch = nullptr;
     bar.Finish();
     share.seconds = SecondsSince(start);
@@ -332,7 +347,9 @@ void SyncRun::SyncShare(ShareReport& share) {
     }
 
     if (share.encrypted) {
+        step = Clock::now();
         const int key = rsyncer_.SyncEncryptKey(share.name);
+        share.key_seconds = SecondsSince(step);
         if (g_stop_signal != 0) {
             share.state = "cancelled";
             share.step = "key";
@@ -350,7 +367,10 @@ void SyncRun::SyncShare(ShareReport& share) {
         Say("share %s: key sent\n", share.name.c_str());
     }
 
-    if (rsyncer_.FinishSync(kFinishComplete, share.name, result) != 0 || result != 0) {
+    step = Clock::now();
+    const int finished = rsyncer_.FinishSync(kFinishComplete, share.name, result);
+    share.finish_seconds = SecondsSince(step);
+    if (finished != 0 || result != 0) {
         share.state = g_stop_signal != 0 ? "cancelled" : "failed";
         share.step = "finish";
         share.result = result;
@@ -363,9 +383,9 @@ void SyncRun::SyncShare(ShareReport& share) {
     }
     share.seconds = SecondsSince(start);
     share.state = "synced";
-    Say("share %s: synced %s files, %s in %.2fs\n", share.name.c_str(),
+    Say("share %s: complete, %s files, %s (rsync read %s) in %.2fs\n", share.name.c_str(),
         std::to_string(share.size.files).c_str(), FormatBytes(share.size.bytes).c_str(),
-        share.seconds);
+        FormatBytes(share.read_bytes).c_str(), share.seconds);
 }
 
 int SyncRun::Run(S2S::SyncTask& task) {
@@ -381,7 +401,16 @@ int SyncRun::Run(S2S::SyncTask& task) {
 
     StopSignals signals;
     rsyncer_.SetCancelChecker(&CancelRequested);
-    if (Connect() != kExitOK || Pair() != kExitOK) {
+    Clock::time_point step = Clock::now();
+    const int connected = Connect();
+    connect_seconds_ = SecondsSince(step);
+    if (connected != kExitOK) {
+        return exit_code_;
+    }
+    step = Clock::now();
+    const int paired = Pair();
+    pair_seconds_ = SecondsSince(step);
+    if (paired != kExitOK) {
         return exit_code_;
     }
     for (ShareReport& share : shares_) {
@@ -400,7 +429,10 @@ int SyncRun::Run(S2S::SyncTask& task) {
                                           "; no unfinished share was marked complete");
     }
     int result = 0;
-    if (rsyncer_.SendBeacon(task_.GetInfo().GetName(), result) == 0) {
+    step = Clock::now();
+    const int beacon = rsyncer_.SendBeacon(task_.GetInfo().GetName(), result);
+    beacon_seconds_ = SecondsSince(step);
+    if (beacon == 0) {
         beacon_result_ = result;
         if (result != 0 && g_stop_signal == 0) {
             Finish(ClassifyCommandResult(result),
@@ -419,6 +451,8 @@ nlohmann::json SyncRun::Summary() const {
     nlohmann::json shares = nlohmann::json::array();
     uint64_t files = 0;
     uint64_t bytes = 0;
+    uint64_t read_bytes = 0;
+    double copy_seconds = 0.0;
     for (const ShareReport& share : shares_) {
         nlohmann::json entry = {{"name", share.name},        {"encrypted", share.encrypted},
                                 {"state", share.state},      {"files", share.size.files},
@@ -435,6 +469,8 @@ nlohmann::json SyncRun::Summary() const {
             files += share.size.files;
             bytes += share.size.bytes;
         }
+        read_bytes += share.read_bytes;
+        copy_seconds += share.copy_seconds;
         shares.push_back(entry);
     }
     const S2S::SyncInfo info = rsyncer_.GetSyncInfo();
@@ -450,7 +486,11 @@ nlohmann::json SyncRun::Summary() const {
         {"shares", shares},
         {"files", files},
         {"bytes", bytes},
+        {"read_bytes", read_bytes},
         {"seconds", SecondsSince(started_)},
+        {"copy_seconds", copy_seconds},
+        {"steps",
+         {{"connect", connect_seconds_}, {"pair", pair_seconds_}, {"beacon", beacon_seconds_}}},
     };
     if (!message_.empty()) {
         doc["message"] = message_;
@@ -591,9 +631,11 @@ int RunSyncCommand(const Args& args) {
     if (json) {
         std::printf("%s\n", summary.dump(2).c_str());
     } else if (!opts.Has("quiet") || code != kExitOK) {
-        std::printf("%s: %s files, %s in %.2fs (%s)\n", code == kExitOK ? "done" : "failed",
+        std::printf("%s: %s files, %s in the synced shares (rsync read %s) in %.2fs (%s)\n",
+                    code == kExitOK ? "done" : "failed",
                     std::to_string(summary["files"].get<uint64_t>()).c_str(),
                     FormatBytes(summary["bytes"].get<uint64_t>()).c_str(),
+                    FormatBytes(summary["read_bytes"].get<uint64_t>()).c_str(),
                     summary["seconds"].get<double>(), ExitCodeName(static_cast<ExitCode>(code)));
     }
     return code;
