@@ -30,7 +30,8 @@ class S2S_EXPORT IPCListener {
     int getFD() const { return fd_; }
 
     // TCP listener on 127.0.0.1 at `port` or the first free port above it; replaces a listener
-    // already held. Returns the port listened on, or -1. Port 0 lets the system choose.
+    // already held (closed as close() does). Returns the port listened on, or -1. Port 0 lets the
+    // system choose.
     int prepare(int port);
     // Domain-socket listener at `path` (a stale socket file there is removed first). Refuses with
     // -1 while a listener is held. 0 or -1.
@@ -74,8 +75,9 @@ class S2S_EXPORT IPCSender {
 
     int connect(int port);                 // TCP to 127.0.0.1:port
     int connect(const std::string& path);  // domain socket
-    int assign(int fd);                    // an accepted descriptor; owned by the sender after 0
-    void close();                          // flushes what is buffered, then closes
+    // An accepted descriptor: owned by the sender after 0, still the caller's after -1.
+    int assign(int fd);
+    void close();  // flushes what is buffered, then closes
 
   protected:
     Channel channel_;

@@ -54,10 +54,8 @@ void IPCListener::setTimeout(timeval timeout) {
 }
 
 int IPCListener::prepare(int port) {
-    if (fd_ != -1) {
-        CloseSocket(fd_);
-        fd_ = -1;
-    }
+    // A listener already held is replaced; a domain one takes its socket file along.
+    close();
     // Close-on-exec: the service runs rsync children, which must not inherit its listeners.
     int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
     if (fd < 0) {
@@ -252,7 +250,7 @@ int IPCListener::CloseDomainSocket(int fd) {
     // An unnamed socket reports no path (or an abstract one, starting with NUL): nothing to remove.
     size_t path_len =
         len > offsetof(sockaddr_un, sun_path) ? len - offsetof(sockaddr_un, sun_path) : 0;
-    if (path_len > 0 && addr.sun_path[0] != '\0') {
+    if (addr.sun_family == AF_UNIX && path_len > 0 && addr.sun_path[0] != '\0') {
         std::string path(addr.sun_path, strnlen(addr.sun_path, path_len));
         ::unlink(path.c_str());
     }

@@ -176,6 +176,13 @@ TEST(IPCTest, DomainListenerIsNotReplacedAndRemovesOnlySockets) {
     EXPECT_EQ(-1, third.prepare(std::string(200, 'x')));  // longer than an address holds
     EXPECT_EQ(-1, third.prepare(std::string()));
     EXPECT_EQ(-1, third.getFD());
+
+    // A TCP listener replacing a domain one takes the socket file along.
+    IPCListener switching;
+    ASSERT_EQ(0, switching.prepare(dir / "switch"));
+    EXPECT_GT(switching.prepare(0), 0);
+    EXPECT_FALSE(Exists(dir / "switch"));
+    switching.close();
 }
 
 TEST(IPCTest, TcpListenerProbesUpwardAndCloseTouchesNoFile) {
