@@ -315,9 +315,11 @@ S2S_EXPORT int VLIBGetModelClass(char* buf, int size);
 #define VURN_HOSTNAME_MAX 64
 S2S_EXPORT int VURNLnxGetHostname(char* buf);
 
-/* Network interfaces (getifaddrs, in interface index order, loopback skipped). */
-#define VLIB_NETIF_WITH_MAC 0x1 /* flag: only interfaces with a non-zero 6-byte hardware address \
-                                 */
+/* Network interfaces (getifaddrs; loopback skipped; physical devices first, then virtual ones,
+ * each in interface index order). */
+#define VLIB_NETIF_WITH_MAC                                              \
+    0x1 /* flag: only interfaces with a non-zero 6-byte hardware address \
+         */
 typedef struct VLIBNetIfInfo {
     char name[16];        /* interface name */
     unsigned char mac[6]; /* hardware address (SIOCGIFHWADDR), zeros when none */

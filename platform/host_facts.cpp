@@ -19,6 +19,7 @@
 #include <map>
 #include <new>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "platform/platform_internal.h"
@@ -293,8 +294,10 @@ int VLIBNetGetInterfaceInfo(VLIBNetIfInfo* list, int max, int flags) {
     int sock = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
     int count = 0;
     try {
-        // One entry per interface, in kernel index order: the "first" interface is stable.
-        std::map<unsigned, VLIBNetIfInfo> found;
+        // One entry per interface. Physical devices come first, then virtual ones, each in
+        // kernel index order: the first interface is then a real network card, whose address
+        // survives a reboot (bridges, tunnels and the like often get random ones).
+        std::map<std::pair<int, unsigned>, VLIBNetIfInfo> found;
         for (struct ifaddrs* a = addrs; a != nullptr; a = a->ifa_next) {
             if (a->ifa_name == nullptr || (a->ifa_flags & IFF_LOOPBACK) != 0 ||
                 std::strlen(a->ifa_name) >= sizeof(VLIBNetIfInfo::name)) {
@@ -304,7 +307,10 @@ int VLIBNetGetInterfaceInfo(VLIBNetIfInfo* list, int max, int flags) {
             if (index == 0) {
                 continue;
             }
-            auto it = found.find(index);
+            struct stat st;
+            std::string device = std::string("/sys/class/net/") + a->ifa_name + "/device";
+            std::pair<int, unsigned> order(stat(device.c_str(), &st) == 0 ? 0 : 1, index);
+            auto it = found.find(order);
             if (it == found.end()) {
                 VLIBNetIfInfo info;
                 std::memset(&info, 0, sizeof(info));
@@ -320,7 +326,7 @@ int VLIBNetGetInterfaceInfo(VLIBNetIfInfo* list, int max, int flags) {
                         std::memcpy(info.mac, req.ifr_hwaddr.sa_data, 6);
                     }
                 }
-                it = found.emplace(index, info).first;
+                it = found.emplace(order, info).first;
             }
             if (a->ifa_addr != nullptr && a->ifa_addr->sa_family == AF_INET &&
                 it->second.ipv4[0] == '\0') {
