@@ -190,6 +190,16 @@ int UpdateShare(const std::string& share,
     return S2SServerUpdateShare(share.c_str(), h.get()) == 0 ? kReceiverOK : kReceiverStoreWrite;
 }
 
+// The share's "CompleteID" as stored, "" when absent. Binding writes it back with "RunningID":
+// the store reads a share without that key as free, whatever "RunningID" says.
+std::string CompleteID(const std::string& share) {
+    char buf[kMaxClientID + 1];
+    if (S2SServerGetShare(share.c_str(), "CompleteID", buf, sizeof buf) < 0) {
+        return std::string();
+    }
+    return buf;
+}
+
 // Records `clientID` in the multi-client scheme, moving an older single client first.
 int RecordMultiClient(const std::string& clientID, const std::string& serverName) {
     int old = S2SServerIfOldClientPaired();
@@ -391,7 +401,7 @@ int SyncStart(const Command& c) {
     if (withAttributes && encrypted != (c.Get("isEncrypt") == "1")) {
         return kReceiverAttrMismatch;
     }
-    return UpdateShare(share, {{"RunningID", c.Client()}});
+    return UpdateShare(share, {{"RunningID", c.Client()}, {"CompleteID", CompleteID(share)}});
 }
 
 int SyncFinish(const Command& c) {
@@ -415,7 +425,7 @@ int SyncFinish(const Command& c) {
     if (type == "unpair") {
         return UpdateShare(share, {{"RunningID", ""}, {"CompleteID", ""}});
     }
-    return UpdateShare(share, {{"RunningID", c.Client()}});
+    return UpdateShare(share, {{"RunningID", c.Client()}, {"CompleteID", CompleteID(share)}});
 }
 
 int UpdateTaskStatus(const Command& c) {

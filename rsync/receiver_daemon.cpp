@@ -1,6 +1,7 @@
 // The receiver's rsync daemon: its configuration written from the share registry, its start and
 // stop, and the status a status page shows.
 #include <arpa/inet.h>
+#include <dirent.h>
 #include <fcntl.h>
 #include <netinet/in.h>
 #include <signal.h>
@@ -12,6 +13,7 @@
 #include <cctype>
 #include <cerrno>
 #include <chrono>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
@@ -176,6 +178,54 @@ bool Accepting(const std::string& address, int port) {
     }
     close(fd);
     return rc == 0;
+}
+
+// The inodes of the TCP sockets listening on `port` (IPv4 and IPv6).
+std::vector<std::string> ListeningInodes(int port) {
+    std::vector<std::string> inodes;
+    char hexPort[8];
+    std::snprintf(hexPort, sizeof hexPort, "%04X", port);
+    for (const char* table : {"/proc/net/tcp", "/proc/net/tcp6"}) {
+        std::ifstream in(table);
+        std::string line;
+        std::getline(in, line);  // the header
+        while (std::getline(in, line)) {
+            std::istringstream fields(line);
+            std::string slot, local, remote, state, queues, timer, retr, uid, timeout, inode;
+            fields >> slot >> local >> remote >> state >> queues >> timer >> retr >> uid >>
+                timeout >> inode;
+            size_t colon = local.rfind(':');
+            if (state == "0A" && colon != std::string::npos && local.substr(colon + 1) == hexPort) {
+                inodes.push_back(inode);
+            }
+        }
+    }
+    return inodes;
+}
+
+// True when process `pid` itself holds a socket listening on `port`: a daemon that could not
+// bind must not be taken for one that did because someone else listens there.
+bool ListensOn(pid_t pid, int port) {
+    std::vector<std::string> inodes = ListeningInodes(port);
+    std::string dir = "/proc/" + std::to_string(pid) + "/fd";
+    DIR* d = opendir(dir.c_str());
+    if (d == nullptr) {
+        return false;
+    }
+    bool found = false;
+    while (struct dirent* e = readdir(d)) {
+        char target[64];
+        ssize_t n = readlink((dir + "/" + e->d_name).c_str(), target, sizeof target - 1);
+        if (n <= 0) {
+            continue;
+        }
+        target[n] = '\0';
+        for (const auto& inode : inodes) {
+            found = found || std::string(target) == "socket:[" + inode + "]";
+        }
+    }
+    closedir(d);
+    return found;
 }
 
 // "port = N" and "address = A" back from the written configuration.
@@ -388,8 +438,16 @@ int ReceiverStart(std::string* error) {
     std::string configArg = "--config=" + conf;
     std::vector<char*> argv = {const_cast<char*>(rsync.c_str()), const_cast<char*>("--daemon"),
                                const_cast<char*>("--no-detach"), &configArg[0], nullptr};
+    // The intermediate child reports the daemon's pid, so that a daemon that dies before it
+    // writes its pid file (a port in use) is noticed at once.
+    int report[2];
+    if (pipe2(report, O_CLOEXEC) != 0) {
+        return Fail(error, std::string("pipe: ") + strerror(errno));
+    }
     pid_t first = fork();
     if (first < 0) {
+        close(report[0]);
+        close(report[1]);
         return Fail(error, std::string("fork: ") + strerror(errno));
     }
     if (first == 0) {
@@ -398,6 +456,8 @@ int ReceiverStart(std::string* error) {
         }
         pid_t daemon = fork();
         if (daemon != 0) {
+            ssize_t ignored = write(report[1], &daemon, sizeof daemon);
+            (void)ignored;
             _exit(daemon < 0 ? 1 : 0);
         }
         int devnull = open("/dev/null", O_RDWR);
@@ -412,22 +472,32 @@ int ReceiverStart(std::string* error) {
         execv(rsync.c_str(), argv.data());
         _exit(127);
     }
+    close(report[1]);
+    pid_t started = -1;
+    if (read(report[0], &started, sizeof started) != static_cast<ssize_t>(sizeof started)) {
+        started = -1;
+    }
+    close(report[0]);
     int status = 0;
     while (waitpid(first, &status, 0) < 0 && errno == EINTR) {
     }
-    if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
+    if (!WIFEXITED(status) || WEXITSTATUS(status) != 0 || started <= 0) {
         return Fail(error, "cannot start the daemon");
     }
     auto deadline = std::chrono::steady_clock::now() + kStartWait;
     for (;;) {
-        if (ReceiverRunning() && Accepting(address, port)) {
+        pid_t daemon = PidFromFile();
+        if (daemon == started && ProcessAlive(daemon) && ListensOn(daemon, port) &&
+            Accepting(address, port)) {
             break;
         }
-        if (std::chrono::steady_clock::now() >= deadline) {
+        bool died = !ProcessAlive(started);
+        if (died || std::chrono::steady_clock::now() >= deadline) {
             std::string tail = LogTail();
             ReceiverStop(nullptr);
-            return Fail(error, "the daemon did not start listening on port " +
-                                   std::to_string(port) + (tail.empty() ? "" : ": " + tail));
+            return Fail(error, std::string(died ? "the daemon ended" : "the daemon did not start") +
+                                   " instead of listening on port " + std::to_string(port) +
+                                   (tail.empty() ? "" : ": " + tail));
         }
         std::this_thread::sleep_for(std::chrono::milliseconds(20));
     }

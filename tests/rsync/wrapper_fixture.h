@@ -96,6 +96,7 @@ class Server {
           password_(password),
           port_(s2s_test::FreeTcpPort()) {
         MakeDirs(root_ + "/etc/s2s");
+        MakeDirs(root_ + "/usr/vurn/etc");
         MakeDirs(Volume());
     }
     ~Server() { Stop(); }

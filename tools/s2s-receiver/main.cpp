@@ -89,8 +89,11 @@ int Status() {
         std::fputs("s2s-receiver: cannot read the pairing store\n", stderr);
         return 1;
     }
-    if (!st.pairedClientID.empty()) {
-        std::printf("paired: %s (%s)\n", st.pairedClientID.c_str(), st.pairedServerName.c_str());
+    if (st.pairedClientID == "S2SMULTI-SRC-SUPPORT") {
+        std::printf("pairing: multi-client\n");
+    } else if (!st.pairedClientID.empty()) {
+        std::printf("pairing: single-client %s %s\n", st.pairedClientID.c_str(),
+                    st.pairedServerName.c_str());
     }
     for (const auto& c : st.clients) {
         std::printf("client: %s %s\n", c.clientID.c_str(), c.serverName.c_str());

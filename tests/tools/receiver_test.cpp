@@ -1,0 +1,399 @@
+// s2s-receiver: the command handlers on a real pairing store (strict reading of hostile command
+// files, pairing with conflicts, old-server answers, share binding, heartbeats), the command
+// module's hooks, and the program's configure / start / status / stop against a real daemon.
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <netinet/in.h>
+
+#include <list>
+#include <string>
+#include <vector>
+
+#include "gtest/gtest.h"
+#include "rsync/receiver_internal.h"
+#include "rsync/wrapper_fixture.h"
+#include "s2s_receiver.h"
+#include "s2s_rsync_wrapper.h"
+
+namespace {
+
+using S2S::ReceiverAnswer;
+using S2S::ReceiverRunCommand;
+using wrapper_test::CountEntries;
+using wrapper_test::Server;
+
+const std::string kToken = "0123456789abcdef0123456789abcdef";
+
+std::string File(const std::vector<std::string>& lines) {
+    std::string text = "token=\"" + kToken + "\"\n";
+    for (const auto& l : lines) {
+        text += l + "\n";
+    }
+    return text;
+}
+
+// One command from `client`: the command name, then key="value" pairs.
+ReceiverAnswer Cmd(const std::string& client, const std::string& name,
+                   const std::vector<std::pair<std::string, std::string>>& keys,
+                   bool oldServer = false) {
+    std::vector<std::string> lines = {"command=\"" + name + "\"", "clientID=\"" + client + "\""};
+    for (const auto& k : keys) {
+        lines.push_back(k.first + "=\"" + k.second + "\"");
+    }
+    return ReceiverRunCommand(File(lines), oldServer);
+}
+
+int Code(const std::string& client, const std::string& name,
+         const std::vector<std::pair<std::string, std::string>>& keys, bool oldServer = false) {
+    return Cmd(client, name, keys, oldServer).result;
+}
+
+int MultiPair(const std::string& client, const std::string& shares, std::string* output,
+              bool dryRun = false) {
+    ReceiverAnswer a = Cmd(client, "S2S_PairingMultiSrc",
+                           {{"serverName", "host-" + client},
+                            {"syncShares", shares},
+                            {"dryRun", dryRun ? "yes" : "no"},
+                            {"outfile", "/tmp/S2S/temp.x"}});
+    *output = a.hasOutput ? a.output : "<none>";
+    return a.result;
+}
+
+int Start(const std::string& client, const std::string& share) {
+    return Code(client, "S2S_SyncStart", {{"volumeName", "volume1"}, {"shareName", share}});
+}
+
+int Finish(const std::string& client, const std::string& type, const std::string& share) {
+    return Code(client, "S2S_SyncFinish", {{"finishType", type}, {"name", share}});
+}
+
+std::string ShareState(const std::string& name) {
+    S2S::ReceiverStatus st;
+    S2S::ReceiverGetStatus(&st);
+    for (const auto& s : st.shares) {
+        if (s.name == name) {
+            return s.state + (s.owner.empty() ? "" : " " + s.owner);
+        }
+    }
+    return "free";
+}
+
+class Handlers : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        server_.AddShare("photos");
+        server_.AddShare("docs");
+        server_.AddShare("vault", true);
+        server_.AddShare("Ünïcødé");
+    }
+    Server server_;
+};
+
+TEST_F(Handlers, HostileCommandFilesAreRefusedWithTheirCode) {
+    struct Case {
+        std::string input;
+        int code;
+    };
+    const std::string head = "token=\"" + kToken + "\"\n";
+    const std::vector<Case> cases = {
+        {head, 203},
+        {head + "clientID=\"A\"\ncommand=\"S2S_GetProtocolVer\"\n", 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"\noutfile=\"/y\"\n",
+         203},
+        {head + "command=\"S2S_GetProtocolVer\"\r\nclientID=\"A\"\n", 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\n\noutfile=\"/x\"\n", 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=/x\n", 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\n1key=\"v\"\n", 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"a\tb\"\n", 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"../../etc\"\noutfile=\"/x\"\n", 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"" + std::string(36, 'c') +
+             "\"\noutfile=\"/x\"\n",
+         203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\n" + std::string(5000, 'x'), 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\n", 201},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"\"\n", 201},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"\nextra=\"1\"\n",
+         202},
+        {head + "command=\"rm -rf /\"\nclientID=\"A\"\n", 43},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"", 0},
+    };
+    for (const auto& c : cases) {
+        ReceiverAnswer a = ReceiverRunCommand(c.input, false);
+        EXPECT_EQ(a.result, c.code) << c.input.substr(0, 200);
+        EXPECT_EQ(a.token, kToken) << "every answer goes back to its token";
+    }
+    // Without a valid token line no reply can be placed anywhere.
+    for (const std::string& bad :
+         {std::string("token=\"../../../etc\"\n"), "token=\"" + std::string(32, 'A') + "\"\n",
+          std::string("command=\"S2S_GetProtocolVer\"\n"), std::string()}) {
+        EXPECT_EQ(
+            ReceiverRunCommand(bad + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\n", false)
+                .token,
+            "");
+    }
+}
+
+TEST_F(Handlers, ShareNamesThatCouldEscapeAreRefused) {
+    ASSERT_EQ(Code("A", "S2S_Pairing", {{"dryRun", "no"}, {"serverName", "host-a"}}), 0);
+    for (std::string name :
+         {"../photos", "photos/x", "..", "a\"b", "a'b", "@photos@", "a\x01z", "[global]", "a\\b"}) {
+        EXPECT_EQ(Start("A", name), 204) << name;
+        std::string out;
+        EXPECT_EQ(MultiPair("A", "photos:" + name, &out), 204) << name;
+    }
+    EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "a\nb"}}), 203)
+        << "a line break splits the command file";
+    EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "t\x7f"}}), 204);
+    EXPECT_EQ(Start("A", "Ünïcødé"), 0) << "non-ASCII names are fine";
+}
+
+TEST_F(Handlers, MultiSourcePairingReportsConflictsAndBindsShares) {
+    std::string out;
+    EXPECT_EQ(Code("A", "S2S_GetProtocolVer", {{"outfile", "/tmp/x"}}), 0);
+    EXPECT_EQ(Cmd("A", "S2S_GetProtocolVer", {{"outfile", "/tmp/x"}}).output, "1\n");
+
+    EXPECT_EQ(Start("A", "photos"), 208) << "no sync before pairing";
+    EXPECT_EQ(MultiPair("A", "photos:docs", &out), 0);
+    EXPECT_EQ(out, "\n");
+    EXPECT_EQ(Start("A", "photos"), 0);
+    EXPECT_EQ(ShareState("photos"), "running A");
+
+    EXPECT_EQ(MultiPair("B", "docs:photos", &out, true), 214);
+    EXPECT_EQ(out, "photos\n");
+    EXPECT_EQ(MultiPair("B", "docs:photos", &out), 214);
+    EXPECT_EQ(Start("B", "photos"), 214);
+    EXPECT_EQ(Finish("B", "unpair", "photos"), 214) << "only the bound client may release it";
+    EXPECT_EQ(Start("B", "docs"), 0);
+    EXPECT_EQ(MultiPair("A", "photos:docs", &out), 214);
+    EXPECT_EQ(out, "docs\n");
+
+    EXPECT_EQ(Finish("A", "complete", "photos"), 0);
+    EXPECT_EQ(ShareState("photos"), "completed A");
+    EXPECT_EQ(Finish("A", "abort", "photos"), 0);
+    EXPECT_EQ(ShareState("photos"), "completed A");
+    EXPECT_EQ(Finish("A", "later", "photos"), 211);
+    EXPECT_EQ(Finish("A", "unpair", "photos"), 0);
+    EXPECT_EQ(ShareState("photos"), "free");
+    EXPECT_EQ(Start("B", "photos"), 0);
+
+    S2S::ReceiverStatus st;
+    ASSERT_EQ(S2S::ReceiverGetStatus(&st), 0);
+    EXPECT_EQ(st.pairedClientID, "S2SMULTI-SRC-SUPPORT");
+    ASSERT_EQ(st.clients.size(), 2u);
+    EXPECT_EQ(st.clients[0].clientID + st.clients[0].serverName, "Ahost-A");
+    EXPECT_FALSE(st.busy);
+    EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "nightly"}}), 0);
+    EXPECT_EQ(Code("C", "S2S_UpdateTaskStatus", {{"taskName", "nightly"}}), 208);
+    ASSERT_EQ(S2S::ReceiverGetStatus(&st), 0);
+    EXPECT_TRUE(st.busy);
+}
+
+TEST_F(Handlers, SyncStartChecksShareAndAttributes) {
+    ASSERT_EQ(Code("A", "S2S_Pairing", {{"dryRun", "no"}, {"serverName", "host-a"}}), 0);
+    auto attrs = [](const std::string& share, const std::string& enc) {
+        return std::vector<std::pair<std::string, std::string>>{
+            {"volumeName", "volume1"}, {"shareName", share}, {"isEncrypt", enc},
+            {"isAutomount", "0"},      {"isEnableACL", "1"}, {"isWinShare", "0"},
+            {"lenEncKey", "32"}};
+    };
+    EXPECT_EQ(Code("A", "S2S_SyncStart", attrs("photos", "0")), 0);
+    EXPECT_EQ(Code("A", "S2S_SyncStart", attrs("vault", "1")), 0);
+    EXPECT_EQ(Code("A", "S2S_SyncStart", attrs("vault", "0")), 210);
+    EXPECT_EQ(Code("A", "S2S_SyncStart", attrs("nosuch", "0")), 209);
+    EXPECT_EQ(Code("A", "S2S_SyncStart", attrs("photos", "yes")), 203);
+    auto partial = attrs("photos", "0");
+    partial.pop_back();
+    EXPECT_EQ(Code("A", "S2S_SyncStart", partial), 201);
+    EXPECT_EQ(Code("A", "S2S_SyncStart", {{"shareName", "photos"}}), 201);
+}
+
+TEST_F(Handlers, OldServerAnswersLikeOne) {
+    std::string out;
+    EXPECT_EQ(Code("A", "S2S_GetProtocolVer", {{"outfile", "/tmp/x"}}, true), 43);
+    EXPECT_EQ(
+        Cmd("A", "S2S_PairingMultiSrc",
+            {{"serverName", "h"}, {"syncShares", "photos"}, {"dryRun", "no"}, {"outfile", "/x"}},
+            true)
+            .result,
+        43);
+    EXPECT_EQ(Code("A", "S2S_Pairing", {{"dryRun", "yes"}, {"serverName", "host-a"}}, true), 0);
+    EXPECT_EQ(Code("A", "S2S_Pairing", {{"dryRun", "no"}, {"serverName", "host-a"}}, true), 0);
+    EXPECT_EQ(Code("B", "S2S_Pairing", {{"dryRun", "yes"}, {"serverName", "host-b"}}, true), 207);
+    EXPECT_EQ(Code("B", "S2S_Pairing", {{"dryRun", "no"}, {"serverName", "host-b"}}, true), 207);
+    EXPECT_EQ(Code("A", "S2S_Pairing", {{"dryRun", "no"}, {"serverName", "host-a"}}, true), 0);
+    EXPECT_EQ(Code("A", "S2S_Pairing", {{"dryRun", "maybe"}, {"serverName", "h"}}, true), 203);
+
+    EXPECT_EQ(Code("A", "S2S_SyncStart",
+                   {{"volumeName", "volume1"},
+                    {"shareName", "photos"},
+                    {"isEncrypt", "0"},
+                    {"isAutomount", "0"},
+                    {"isEnableACL", "0"},
+                    {"isWinShare", "0"},
+                    {"lenEncKey", "0"}},
+                   true),
+              202);
+    EXPECT_EQ(Start("A", "photos"), 0);
+    S2S::ReceiverStatus st;
+    ASSERT_EQ(S2S::ReceiverGetStatus(&st), 0);
+    EXPECT_EQ(st.pairedClientID, "A");
+    EXPECT_EQ(st.pairedServerName, "host-a");
+
+    // A current server takes the old single client over into the multi-client scheme.
+    EXPECT_EQ(MultiPair("B", "docs", &out), 0);
+    ASSERT_EQ(S2S::ReceiverGetStatus(&st), 0);
+    EXPECT_EQ(st.pairedClientID, "S2SMULTI-SRC-SUPPORT");
+    EXPECT_EQ(st.clients.size(), 2u);
+    EXPECT_EQ(MultiPair("B", "photos", &out), 214);
+}
+
+// The early hook writes only below the spool, only under a valid token, and never twice into one
+// reply.
+TEST_F(Handlers, EarlyHookAnswersIntoTheSpoolOnly) {
+    ASSERT_EQ(server_.Configure().status, 0);
+    auto hook = [](const std::string& input, const char* conn) {
+        s2s_test::ScopedEnv pid("RSYNC_PID", conn);
+        int fds[2];
+        EXPECT_EQ(pipe(fds), 0);
+        EXPECT_EQ(write(fds[1], input.data(), input.size()), static_cast<ssize_t>(input.size()));
+        close(fds[1]);
+        int rc = S2S::ReceiverHookEarly(fds[0], false);
+        close(fds[0]);
+        return rc;
+    };
+    const std::string replies = server_.Spool() + "/replies";
+    std::string cmd = "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"\n";
+    EXPECT_EQ(hook("token=\"../../../../tmp/evil\"\n" + cmd, "100"), 1);
+    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, "../x"), 1);
+    EXPECT_EQ(CountEntries(replies), 0u);
+    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, "101"), 0);
+    EXPECT_EQ(s2s_test::ReadFile(replies + "/" + kToken + "/result"), "0\n");
+    EXPECT_EQ(s2s_test::ReadFile(replies + "/" + kToken + "/output"), "1\n");
+    struct stat st;
+    ASSERT_EQ(stat((replies + "/" + kToken + "/result").c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 077, 0u);
+    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, "102"), 1) << "a replayed token";
+
+    {
+        s2s_test::ScopedEnv pid("RSYNC_PID", "101");
+        s2s_test::ScopedEnv other("RSYNC_REQUEST", "@s2s-cmd/ffffffffffffffffffffffffffffffff/");
+        EXPECT_NE(S2S::ReceiverHookPre(), 0) << "another connection's reply";
+        s2s_test::ScopedEnv own("RSYNC_REQUEST", ("@s2s-cmd/" + kToken + "/").c_str());
+        EXPECT_EQ(S2S::ReceiverHookPre(), 0);
+        EXPECT_EQ(S2S::ReceiverHookPost(), 0);
+    }
+    EXPECT_EQ(CountEntries(replies), 0u);
+    EXPECT_EQ(CountEntries(server_.Spool() + "/conns"), 0u);
+}
+
+TEST(ReceiverTool, ConfigureWritesModulesAndAPrivateSecret) {
+    Server server("s2suser", "pw with spaces:and:colons");
+    server.AddShare("photos");
+    server.AddShare("vault", true);
+    server.AddShare("global");
+    ASSERT_EQ(server.Configure().status, 0);
+    const std::string conf = s2s_test::ReadFile(server.Root() + "/usr/vurn/etc/s2s_rsyncd.conf");
+    for (const std::string& needle : std::vector<std::string>{
+             "[@s2s-cmd]", "[@s2s-key]", "[photos]\n\tpath = " + server.SharePath("photos"),
+             "[@vault@]\n\tpath = " + server.EncryptedPath("vault"), "use chroot = yes",
+             "pid file = " + server.Root() + "/var/run/rsyncd.pid",
+             "port = " + std::to_string(server.Port())}) {
+        EXPECT_NE(conf.find(needle), std::string::npos) << needle << "\n" << conf;
+    }
+    EXPECT_EQ(conf.find("[global]"), std::string::npos) << "a share named global";
+    EXPECT_EQ(conf.find("pw with"), std::string::npos);
+    const std::string secrets = server.Root() + "/usr/vurn/etc/s2s_rsyncd.secrets";
+    EXPECT_EQ(s2s_test::ReadFile(secrets), "s2suser:pw with spaces:and:colons\n");
+    struct stat st;
+    ASSERT_EQ(stat(secrets.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+
+    EXPECT_NE(server.Tool({"configure", "--user", "bad:user"}, "pw\n").status, 0);
+    EXPECT_NE(server.Tool({"configure", "--user", "u"}, "").status, 0) << "no password";
+    EXPECT_NE(server.Tool({"configure", "--user", "u", "--port", "70000"}, "pw\n").status, 0);
+    EXPECT_NE(server.Tool({"start", "now"}).status, 0);
+}
+
+TEST(ReceiverTool, StartStatusStop) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "the daemon needs root";
+    }
+    Server server;
+    server.AddShare("photos");
+    EXPECT_NE(server.Tool({"start"}).status, 0) << "not configured yet";
+    ASSERT_EQ(server.Start(), "");
+    const std::string pidFile = server.Root() + "/var/run/rsyncd.pid";
+    EXPECT_NE(s2s_test::ReadFile(pidFile), "");
+    wrapper_test::Run again = server.Tool({"start"});
+    EXPECT_NE(again.status, 0);
+    EXPECT_NE(again.output.find("running already"), std::string::npos) << again.output;
+
+    // A paired client with a bound share shows in the status.
+    std::string dir = server.Root() + "/client";
+    wrapper_test::MakeDirs(dir);
+    auto send = [&](std::list<std::string> lines) {
+        VURN::Backup::RsyncWrapper w;
+        server.Aim(w, "");
+        w.setVurnCustCmdRule(lines);
+        return w.execute(boost::function<bool()>());
+    };
+    EXPECT_EQ(send({"command=\"S2S_PairingMultiSrc\"", "clientID=\"SN1\"", "serverName=\"sender\"",
+                    "syncShares=\"photos\"", "dryRun=\"no\"", "outfile=\"" + dir + "/conflicts\""}),
+              0);
+    EXPECT_EQ(s2s_test::ReadFile(dir + "/conflicts"), "\n");
+    EXPECT_EQ(send({"command=\"S2S_SyncStart\"", "clientID=\"SN1\"", "volumeName=\"volume1\"",
+                    "shareName=\"photos\""}),
+              0);
+    EXPECT_EQ(send({"command=\"S2S_UpdateTaskStatus\"", "clientID=\"SN1\"", "taskName=\"t1\""}), 0);
+    wrapper_test::Run status = server.Tool({"status"});
+    EXPECT_EQ(status.status, 0);
+    EXPECT_EQ(status.output,
+              "service: running\nactivity: busy\npairing: multi-client\nclient: SN1 sender\n"
+              "share: photos running SN1\n");
+
+    ASSERT_EQ(server.Tool({"stop"}).status, 0);
+    EXPECT_NE(access(pidFile.c_str(), F_OK), 0);
+    status = server.Tool({"status"});
+    EXPECT_EQ(status.output.compare(0, 17, "service: stopped\n"), 0) << status.output;
+    EXPECT_EQ(server.Tool({"stop"}).status, 0) << "stopping a stopped daemon is fine";
+}
+
+TEST(ReceiverTool, StartFailsWhenThePortIsTaken) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "the daemon needs root";
+    }
+    Server server;
+    int fd = socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in addr{};
+    addr.sin_family = AF_INET;
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    addr.sin_port = htons(static_cast<uint16_t>(server.Port()));
+    int one = 1;
+    setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
+    ASSERT_EQ(bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    ASSERT_EQ(listen(fd, 1), 0);
+    std::string error = server.Start();
+    close(fd);
+    EXPECT_NE(error, "");
+    EXPECT_FALSE(S2S::ReceiverRunning());
+}
+
+TEST(ReceiverTool, OldServerModeThroughTheDaemon) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "the daemon needs root";
+    }
+    Server server;
+    server.AddShare("photos");
+    ASSERT_EQ(server.Start(true), "");
+    VURN::Backup::RsyncWrapper w;
+    server.Aim(w, "");
+    w.setVurnCustCmdRule({"command=\"S2S_GetProtocolVer\"", "clientID=\"SN1\"",
+                          "outfile=\"" + server.Root() + "/v\""});
+    EXPECT_EQ(w.execute(boost::function<bool()>()), 43);
+    EXPECT_EQ(s2s_test::ReadFile(server.Root() + "/v"), "");
+}
+
+}  // namespace
