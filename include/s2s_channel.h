@@ -125,7 +125,8 @@ class S2S_EXPORT Channel {
     static int SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wait, int* flag);
     static int SSLWriteFd(SSL* ssl, const void* buf, unsigned int len, const timeval& wait,
                           int* flag);
-    // Ignores any abort flag on purpose: `flag` is accepted for symmetry and callers pass null.
+    // Ignores the abort flag on purpose: only `timeout` (of quiet `wait` intervals) ends a silent
+    // handshake. `flag` is accepted for symmetry with the read and write operations.
     static int SSLHandshake(SSL* ssl, timeval wait, unsigned int timeout, int* flag);
     // The close and closed-test operations of the TLS set.
     static void SSLClose(SSL* ssl);
