@@ -27,6 +27,7 @@
 #include <future>
 #include <memory>
 #include <mutex>
+#include <ostream>
 #include <random>
 #include <string>
 #include <thread>
@@ -609,6 +610,11 @@ struct TrustCase {
     const char* host;
     int expected;
 };
+
+// Names the case in test listings instead of dumping its bytes.
+void PrintTo(const TrustCase& c, std::ostream* out) {
+    *out << c.name;
+}
 
 class ClientTrustTest : public ChannelTlsTest, public ::testing::WithParamInterface<TrustCase> {};
 
