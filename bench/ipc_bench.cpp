@@ -176,10 +176,10 @@ void BM_RawPingPong(benchmark::State& state, bool domain) {
     state.counters["request_bytes"] = static_cast<double>(request.size());
 }
 
-BENCHMARK_CAPTURE(BM_IPC, domain_socket, true)->UseRealTime();
-BENCHMARK_CAPTURE(BM_RawPingPong, domain_socket, true)->UseRealTime();
-BENCHMARK_CAPTURE(BM_IPC, tcp_loopback, false)->UseRealTime();
-BENCHMARK_CAPTURE(BM_RawPingPong, tcp_loopback, false)->UseRealTime();
+BENCHMARK_CAPTURE(BM_IPC, domain_socket, true)->UseRealTime()->MeasureProcessCPUTime();
+BENCHMARK_CAPTURE(BM_RawPingPong, domain_socket, true)->UseRealTime()->MeasureProcessCPUTime();
+BENCHMARK_CAPTURE(BM_IPC, tcp_loopback, false)->UseRealTime()->MeasureProcessCPUTime();
+BENCHMARK_CAPTURE(BM_RawPingPong, tcp_loopback, false)->UseRealTime()->MeasureProcessCPUTime();
 
 }  // namespace
 

@@ -250,14 +250,23 @@ void BM_LargeList_Raw(benchmark::State& s) {
     Exchange(s, Large(), Codec::kRaw);
 }
 
-BENCHMARK(BM_TaskMap_PStream)->UseRealTime();
-BENCHMARK(BM_TaskMap_Msgpack)->UseRealTime();
-BENCHMARK(BM_TaskMap_MsgpackPObject)->UseRealTime();
-BENCHMARK(BM_TaskMap_Raw)->UseRealTime();
-BENCHMARK(BM_LargeList_PStream)->UseRealTime()->Unit(benchmark::kMillisecond);
-BENCHMARK(BM_LargeList_Msgpack)->UseRealTime()->Unit(benchmark::kMillisecond);
-BENCHMARK(BM_LargeList_MsgpackPObject)->UseRealTime()->Unit(benchmark::kMillisecond);
-BENCHMARK(BM_LargeList_Raw)->UseRealTime()->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_TaskMap_PStream)->UseRealTime()->MeasureProcessCPUTime();
+BENCHMARK(BM_TaskMap_Msgpack)->UseRealTime()->MeasureProcessCPUTime();
+BENCHMARK(BM_TaskMap_MsgpackPObject)->UseRealTime()->MeasureProcessCPUTime();
+BENCHMARK(BM_TaskMap_Raw)->UseRealTime()->MeasureProcessCPUTime();
+BENCHMARK(BM_LargeList_PStream)
+    ->UseRealTime()
+    ->MeasureProcessCPUTime()
+    ->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_LargeList_Msgpack)
+    ->UseRealTime()
+    ->MeasureProcessCPUTime()
+    ->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_LargeList_MsgpackPObject)
+    ->UseRealTime()
+    ->MeasureProcessCPUTime()
+    ->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_LargeList_Raw)->UseRealTime()->MeasureProcessCPUTime()->Unit(benchmark::kMillisecond);
 
 }  // namespace
 

@@ -14,6 +14,7 @@
 #include <ctime>
 #include <new>
 
+#include "net/log_debug.h"
 #include "s2s_logger.h"
 #include "s2s_status.h"
 
@@ -24,6 +25,15 @@ namespace {
 // The address length every domain-socket peer of the service uses: the whole sockaddr_un.
 constexpr socklen_t kDomainAddrLen = 110;
 constexpr size_t kDomainPathMax = 107;
+
+// Most copies on the data path are one tag or length byte: those skip the library call.
+inline void CopyBytes(char* dst, const char* src, unsigned int len) {
+    if (len == 1) {
+        *dst = *src;
+    } else {
+        std::memcpy(dst, src, len);
+    }
+}
 
 bool AbortRequested(const int* flag) {
     return flag != nullptr && *flag != 0;
@@ -124,8 +134,7 @@ int Channel::Open(int fd, bool configure) {
     handle_ = handle;
     ClearRead();
     ClearWrite();
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_channel.cpp(%d): Channel: opening socket %d\n",
-                   __LINE__, fd);
+    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): Channel: opening socket %d\n", __LINE__, fd);
     return kStatusSuccessful;
 }
 
@@ -266,10 +275,20 @@ int Channel::Read(char* dst, unsigned int len, unsigned int& count) {
         return kStatusIOError;
     }
     // What is buffered first; a head equal to capacity_ reads as 0 (first piece empty).
+    if (len <= r_size_ && len <= capacity_ - r_head_) {
+        // The common case on a message stream: a tag, length or value already in one piece.
+        CopyBytes(dst, r_buf_.get() + r_head_, len);
+        r_size_ -= len;
+        r_head_ = r_size_ == 0 ? 0 : r_head_ + len;
+        count = len;
+        S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): Read: read %d bytes, head = %d, size = %d\n",
+                      __LINE__, count, r_head_, r_size_);
+        return kStatusSuccessful;
+    }
     unsigned int n = std::min(len, r_size_);
     if (n > 0) {
         unsigned int first = std::min(n, capacity_ - r_head_);
-        std::memcpy(dst, r_buf_.get() + r_head_, first);
+        CopyBytes(dst, r_buf_.get() + r_head_, first);
         if (n > first) {
             std::memcpy(dst + first, r_buf_.get(), n - first);
         }
@@ -287,10 +306,10 @@ int Channel::Read(char* dst, unsigned int len, unsigned int& count) {
     // Here the ring is empty with head 0 (or len is met), so each refill lands at index 0.
     while (count < len) {
         unsigned int chunk = std::min(len - count, capacity_);
-        Logger::LogMsg(Logger::Debug,
-                       "[DEBUG] s2s_channel.cpp(%d): want = %d, len = %d, total = %d, capacity = "
-                       "%d\n",
-                       __LINE__, chunk, len, count, capacity_);
+        S2S_LOG_DEBUG(
+            "[DEBUG] s2s_channel.cpp(%d): want = %d, len = %d, total = %d, capacity = "
+            "%d\n",
+            __LINE__, chunk, len, count, capacity_);
         int ret = ReadMore(static_cast<int>(chunk));
         if (ret != kStatusSuccessful) {
             // The partial bytes go to the caller and, on purpose, also stay buffered.
@@ -303,9 +322,8 @@ int Channel::Read(char* dst, unsigned int len, unsigned int& count) {
         r_size_ -= chunk;
         r_head_ = r_size_ == 0 ? 0 : chunk;  // ReadMore may have read beyond the chunk
     }
-    Logger::LogMsg(Logger::Debug,
-                   "[DEBUG] s2s_channel.cpp(%d): Read: read %d bytes, head = %d, size = %d\n",
-                   __LINE__, count, r_head_, r_size_);
+    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): Read: read %d bytes, head = %d, size = %d\n",
+                  __LINE__, count, r_head_, r_size_);
     return kStatusSuccessful;
 }
 
@@ -332,17 +350,16 @@ int Channel::Write(const char* src, unsigned int len) {
         unsigned int tail = w_head_ + w_size_;
         if (tail <= capacity_) {
             unsigned int first = std::min(len, capacity_ - tail);
-            std::memcpy(w_buf_.get() + tail, src, first);
+            CopyBytes(w_buf_.get() + tail, src, first);
             if (len > first) {
                 std::memcpy(w_buf_.get(), src + first, len - first);
             }
         } else {
-            std::memcpy(w_buf_.get() + (tail - capacity_), src, len);
+            CopyBytes(w_buf_.get() + (tail - capacity_), src, len);
         }
         w_size_ += len;
     }
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_channel.cpp(%d): Write: write %d bytes\n", __LINE__,
-                   len);
+    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): Write: write %d bytes\n", __LINE__, len);
     return kStatusSuccessful;
 }
 
@@ -367,8 +384,8 @@ int Channel::FlushWrite(int want) {
                 return kStatusInterrupted;
             }
             unsigned int len = std::min(w_size_, capacity_ - w_head_);
-            Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_channel.cpp(%d): WriteFd: from %d, len %d\n",
-                           __LINE__, w_head_, len);
+            S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): WriteFd: from %d, len %d\n", __LINE__,
+                          w_head_, len);
             int n = write_op_(handle_, w_buf_.get() + w_head_, len, wait_, flag_);
             if (n == kStatusConnectionTimeout) {
                 // One quiet interval; the timeout counts from the last byte that moved.
@@ -394,9 +411,8 @@ int Channel::FlushWrite(int want) {
             }
         }
     }
-    Logger::LogMsg(Logger::Debug,
-                   "[DEBUG] s2s_channel.cpp(%d): FlushWrite: flush at least %d bytes\n", __LINE__,
-                   want);
+    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): FlushWrite: flush at least %d bytes\n", __LINE__,
+                  want);
     return kStatusSuccessful;
 }
 
@@ -456,18 +472,18 @@ int Channel::ReadMore(int want) {
             at = r_buf_.get() + (end - capacity_);
             len = capacity_ - r_size_;
         }
-        Logger::LogMsg(Logger::Debug,
-                       "[DEBUG] s2s_channel.cpp(%d): ReadMore: want = %d, total = %d, len = %d, "
-                       "r_head = %d, r_size = %d\n",
-                       __LINE__, want, static_cast<int>(got), len, r_head_, r_size_);
+        S2S_LOG_DEBUG(
+            "[DEBUG] s2s_channel.cpp(%d): ReadMore: want = %d, total = %d, len = %d, "
+            "r_head = %d, r_size = %d\n",
+            __LINE__, want, static_cast<int>(got), len, r_head_, r_size_);
         int n = read_op_(handle_, at, len, wait_, flag_);
         if (n == kStatusConnectionTimeout) {
             time_t now = std::time(nullptr);
             if (timeout_ != 0 && now - last >= static_cast<time_t>(timeout_)) {
-                Logger::LogMsg(Logger::Debug,
-                               "[DEBUG] s2s_channel.cpp(%d): ReadMore: Channel timeout for %u "
-                               "seconed\n",
-                               __LINE__, timeout_);
+                S2S_LOG_DEBUG(
+                    "[DEBUG] s2s_channel.cpp(%d): ReadMore: Channel timeout for %u "
+                    "seconed\n",
+                    __LINE__, timeout_);
                 return kStatusConnectionTimeout;
             }
             continue;
@@ -479,9 +495,8 @@ int Channel::ReadMore(int want) {
         got += n;
         last = std::time(nullptr);
         if (got >= want) {
-            Logger::LogMsg(Logger::Debug,
-                           "[DEBUG] s2s_channel.cpp(%d): ReadMore: read at least %d bytes\n",
-                           __LINE__, want);
+            S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): ReadMore: read at least %d bytes\n",
+                          __LINE__, want);
             return kStatusSuccessful;
         }
     }
@@ -646,8 +661,7 @@ int Channel::WaitFd(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_
             return kStatusSuccessful;
         }
         if (ret == 0) {
-            Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_channel.cpp(%d): select: timeout\n",
-                           __LINE__);
+            S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): select: timeout\n", __LINE__);
             return kStatusConnectionTimeout;
         }
         if (errno != EINTR) {
@@ -696,8 +710,8 @@ int Channel::ReadFd(int* handle, void* buf, unsigned int len, const timeval& wai
         }
         return kStatusIOError;
     }
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_channel.cpp(%d): ReadFd: read %d bytes\n", __LINE__,
-                   static_cast<int>(n));
+    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): ReadFd: read %d bytes\n", __LINE__,
+                  static_cast<int>(n));
     return static_cast<int>(n);
 }
 
@@ -734,8 +748,8 @@ int Channel::WriteFd(int* handle, const void* buf, unsigned int len, const timev
         }
         return kStatusIOError;
     }
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_channel.cpp(%d): WriteFd: write %d bytes\n",
-                   __LINE__, static_cast<int>(n));
+    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): WriteFd: write %d bytes\n", __LINE__,
+                  static_cast<int>(n));
     return static_cast<int>(n);
 }
 
@@ -751,8 +765,7 @@ void Channel::PlainClose(int* handle) {
     delete handle;  // the heap-held descriptor allocated by Open
     if (fd != -1) {
         ::close(fd);
-        Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_channel.cpp(%d): Channel: socket %d closed\n",
-                       __LINE__, fd);
+        S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): Channel: socket %d closed\n", __LINE__, fd);
     }
 }
 

@@ -4,6 +4,7 @@
 #include <cstring>
 #include <memory>
 
+#include "net/log_debug.h"
 #include "s2s_logger.h"
 #include "s2s_status.h"
 
@@ -132,8 +133,7 @@ int PStream::Send(Channel& channel, unsigned long long value) {
     if (ret < 0) {
         return ChannelFailure(ret);
     }
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%llu\n", __LINE__, Indent(),
-                   value);
+    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%llu\n", __LINE__, Indent(), value);
     return kStatusSuccessful;
 }
 
@@ -163,8 +163,7 @@ int PStream::Recv(Channel& channel, unsigned long long& value) {
         result = (result << 8) + bytes[i];
     }
     value = result;
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%llu\n", __LINE__, Indent(),
-                   value);
+    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%llu\n", __LINE__, Indent(), value);
     return kStatusSuccessful;
 }
 
@@ -185,8 +184,7 @@ int PStream::Send(Channel& channel, const std::string& value) {
     if (ret < 0) {
         return ChannelFailure(ret);
     }
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(),
-                   value.c_str());
+    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(), value.c_str());
     return kStatusSuccessful;
 }
 
@@ -213,8 +211,7 @@ int PStream::Recv(Channel& channel, std::string& value) {
     }
     // Only the bytes up to the first NUL are kept, as the format always did.
     value.assign(buf, strnlen(buf, length));
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(),
-                   value.c_str());
+    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(), value.c_str());
     return kStatusSuccessful;
 }
 
@@ -355,7 +352,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         if (ret < 0) {
             return ChannelFailure(ret);
         }
-        Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s[\n", __LINE__, Indent());
+        S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s[\n", __LINE__, Indent());
         ++depth_;
         stack.push_back(Walk{&a, 0, nullptr, {}, false});
         return 0;
@@ -365,7 +362,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         if (ret < 0) {
             return ChannelFailure(ret);
         }
-        Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s{\n", __LINE__, Indent());
+        S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s{\n", __LINE__, Indent());
         ++depth_;
         stack.push_back(Walk{nullptr, 0, &m, m.begin(), false});
         return 0;
@@ -418,8 +415,8 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
                 return ChannelFailure(ret);
             }
             --depth_;
-            Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
-                           is_array ? "]" : "}");
+            S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
+                          is_array ? "]" : "}");
             stack.pop_back();
             continue;
         }
@@ -456,8 +453,8 @@ int PStream::SendKey(Channel& channel, const char* key, size_t length) {
     if (ret < 0) {
         return ChannelFailure(ret);
     }
-    Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s\"%.*s\"\n", __LINE__, Indent(),
-                   static_cast<int>(length), key);
+    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%.*s\"\n", __LINE__, Indent(),
+                  static_cast<int>(length), key);
     return kStatusSuccessful;
 }
 
@@ -465,8 +462,8 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                     std::vector<PObject>* array, std::map<std::string, PObject>* map) {
     std::vector<Frame> stack;
     auto open = [&](std::vector<PObject>* a, std::map<std::string, PObject>* m) {
-        Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
-                       a != nullptr ? "[" : "{");
+        S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
+                      a != nullptr ? "[" : "{");
         ++depth_;
         stack.push_back(Frame{a, m, false});
     };
@@ -490,23 +487,20 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             have_tag = false;
             switch (tag) {
                 case kTagString:
-                    // A string object is read into in place; anything else becomes one first.
-                    if (!target.isString() || target.isNull()) {
-                        target = std::string();
-                    }
                     ret = Recv(channel, text);
                     if (ret >= 0) {
                         target = text;
+                    } else if (!target.isString() || target.isNull()) {
+                        target = std::string();  // what reading into a fresh string leaves
                     }
                     break;
                 case kTagInteger: {
-                    if (!target.isInteger() || target.isNull()) {
-                        target = 0ULL;
-                    }
                     unsigned long long value = 0;
                     ret = Recv(channel, value);
                     if (ret >= 0) {
                         target = value;
+                    } else if (!target.isInteger() || target.isNull()) {
+                        target = 0ULL;
                     }
                     break;
                 }
@@ -549,8 +543,8 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             if (tag == kTagEnd) {
                 bool is_array = top.array != nullptr;
                 --depth_;
-                Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__,
-                               Indent(), is_array ? "]" : "}");
+                S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
+                              is_array ? "]" : "}");
                 stack.pop_back();
                 completed = true;
             } else if (top.array != nullptr) {
@@ -572,7 +566,8 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 }
                 PushKey(text.data(), text.size());
                 top.pending = true;
-                slot = &(*top.map)[text];
+                // Keys arrive in order from a conforming writer: the end is the likely place.
+                slot = &top.map->try_emplace(top.map->end(), text)->second;
             }
         }
         if (completed) {
