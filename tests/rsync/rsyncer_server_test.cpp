@@ -8,6 +8,7 @@
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdint>
@@ -16,6 +17,7 @@
 #include <list>
 #include <memory>
 #include <random>
+#include <set>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -415,6 +417,169 @@ TEST_F(RsyncerServer, CancellationStopsALargeTransfer) {
     EXPECT_EQ(result, 0);
     ASSERT_EQ(stat((g_partialDir + "/big.bin").c_str(), &st), 0);
     EXPECT_EQ(static_cast<size_t>(st.st_size), kBig);
+}
+
+// The command lines of the rsync processes each run started, read from /proc by the cancel
+// checker (which the wrapper calls right after starting rsync and then while it runs).
+std::vector<std::vector<std::string>> g_argvs;
+std::set<pid_t> g_seen;
+
+std::vector<std::string> CmdLine(pid_t pid) {
+    std::vector<std::string> args;
+    std::string raw = s2s_test::ReadFile("/proc/" + std::to_string(pid) + "/cmdline");
+    for (size_t start = 0; start < raw.size();) {
+        const size_t end = raw.find('\0', start);
+        args.push_back(raw.substr(start, end - start));
+        start = end == std::string::npos ? raw.size() : end + 1;
+    }
+    return args;
+}
+
+std::vector<pid_t> Children() {
+    std::vector<pid_t> out;
+    DIR* proc = opendir("/proc");
+    const std::string self = std::to_string(getpid());
+    while (struct dirent* e = readdir(proc)) {
+        std::ifstream stat(std::string("/proc/") + e->d_name + "/stat");
+        std::string line;
+        if (!std::getline(stat, line) || line.rfind(')') == std::string::npos) {
+            continue;
+        }
+        std::istringstream rest(line.substr(line.rfind(')') + 2));
+        std::string state;
+        std::string ppid;
+        rest >> state >> ppid;
+        if (ppid == self && state != "Z") {
+            out.push_back(std::atoi(e->d_name));
+        }
+    }
+    closedir(proc);
+    return out;
+}
+
+bool RecordRsyncArgv() {
+    for (pid_t pid : Children()) {
+        if (g_seen.count(pid) != 0) {
+            continue;
+        }
+        // The child may not have exec'd rsync yet: wait for it (bounded), it runs for far longer.
+        const bool found = s2s_test::WaitFor(
+            [pid] {
+                const std::vector<std::string> args = CmdLine(pid);
+                return args.empty() || (args[0].size() >= 5 &&
+                                        args[0].compare(args[0].size() - 5, 5, "rsync") == 0);
+            },
+            std::chrono::seconds(2));
+        const std::vector<std::string> args = CmdLine(pid);
+        if (found && !args.empty()) {
+            g_seen.insert(pid);
+            g_argvs.push_back(args);
+        }
+    }
+    return false;
+}
+
+bool Contains(const std::vector<std::string>& args, const std::string& arg) {
+    return std::find(args.begin(), args.end(), arg) != args.end();
+}
+
+bool HasPrefix(const std::vector<std::string>& args, const std::string& prefix) {
+    for (const auto& a : args) {
+        if (a.rfind(prefix, 0) == 0) {
+            return true;
+        }
+    }
+    return false;
+}
+
+// What each kind of run hands to rsync: the command time-out and the transfer time-out, the
+// options every run has, the debug log of real tasks only, the daemon port kept without SSH,
+// the source paths of RunSync and the share's module as destination.
+TEST_F(RsyncerServer, RunsCarryTheirOptions) {
+    StartServer();
+    g_argvs.clear();
+    g_seen.clear();
+    const std::string src = client_->Volume() + "/photos";
+    rsyncer_test::MakeDirs(src + "/a");
+    s2s_test::WriteFile(src + "/a/b", "b");
+
+    S2S::SyncInfo info = Info();
+    info.SetSSHPort(2222);  // not used: the task does not use SSH
+    info.SetCompression(true);
+    S2S::Rsyncer rsyncer;
+    rsyncer.SetCancelChecker(&RecordRsyncArgv);
+    ASSERT_EQ(rsyncer.Initialize(info), 0);
+    ASSERT_EQ(g_argvs.size(), 2u);  // the dry-run pairing and the version query
+    for (const auto& args : g_argvs) {
+        EXPECT_TRUE(Contains(args, "--timeout=60"));
+        EXPECT_FALSE(HasPrefix(args, "--rsh"));
+        EXPECT_FALSE(HasPrefix(args, "--log-file"));
+        EXPECT_TRUE(HasPrefix(args, "rsync://s2suser@127.0.0.1/@s2s-cmd/")) << args.back();
+        EXPECT_FALSE(HasPrefix(args, "rsync://s2suser@127.0.0.1:"));
+    }
+
+    int result = -1;
+    Lines conflicts;
+    ASSERT_EQ(rsyncer.DoPairing(false, {"photos"}, conflicts, result), 0);
+    g_argvs.clear();
+    ASSERT_EQ(rsyncer.RunSync(1, "photos", "/", {"*.tmp", "cache/"}, result), 0);
+    ASSERT_EQ(result, 0);
+    ASSERT_EQ(g_argvs.size(), 1u);
+    std::vector<std::string> args = g_argvs[0];
+    for (const char* expected : {"--timeout=600", "--delete", "--numeric-ids", "--compress",
+                                 "--whole-file", "--acls", "--exclude=*.tmp", "--exclude=cache/"}) {
+        EXPECT_TRUE(Contains(args, expected)) << expected;
+    }
+    EXPECT_TRUE(Contains(args, "--log-file=" + client_->Root() + "/var/log/s2s_rsync.log"));
+    EXPECT_FALSE(Contains(args, "--relative"));
+    ASSERT_GE(args.size(), 2u);
+    EXPECT_EQ(args[args.size() - 2], src + "/");
+    EXPECT_EQ(args.back(), "rsync://s2suser@127.0.0.1/photos");
+
+    // A path inside the share: relative mode from the "/." anchor; block-level sync is delta.
+    info.SetCompression(false);
+    info.SetBlockLevelSync(true);
+    S2S::Rsyncer delta;
+    ASSERT_EQ(delta.Initialize(info), 0);
+    delta.SetCancelChecker(&RecordRsyncArgv);
+    g_argvs.clear();
+    ASSERT_EQ(delta.RunSync(2, "photos", "/a/b", {}, result), 0);
+    ASSERT_EQ(result, 0);
+    ASSERT_EQ(g_argvs.size(), 1u);
+    args = g_argvs[0];
+    EXPECT_TRUE(Contains(args, "--relative"));
+    EXPECT_TRUE(Contains(args, "--no-whole-file"));
+    EXPECT_FALSE(Contains(args, "--compress"));
+    EXPECT_EQ(args[args.size() - 2], src + "/./a/b");
+    EXPECT_EQ(args.back(), "rsync://s2suser@127.0.0.1/photos");
+
+    // A test task runs without the debug log; with SSH the task's SSH port goes to ssh.
+    S2S::Rsyncer::RsyncTask quiet;
+    ASSERT_EQ(delta.InitRsyncTask(quiet, true), 0);
+    g_argvs.clear();
+    EXPECT_EQ(quiet.Execute(src + "/", "photos", &RecordRsyncArgv, "", {}), 0);
+    ASSERT_EQ(g_argvs.size(), 1u);
+    EXPECT_FALSE(HasPrefix(g_argvs[0], "--log-file"));
+    EXPECT_TRUE(Contains(g_argvs[0], "--timeout=600"));
+
+    info.SetSSH(true);
+    S2S::Rsyncer overSsh;
+    overSsh.Initialize(info);  // no sshd here: only the command line matters
+    S2S::Rsyncer::RsyncTask sshTask;
+    ASSERT_EQ(overSsh.InitRsyncTask(sshTask, false), 0);
+    g_argvs.clear();
+    EXPECT_NE(
+        sshTask.ExecuteCmd({"command=\"S2S_UpdateTaskStatus\"", "clientID=\"x\"", "taskName=\"t\""},
+                           &RecordRsyncArgv),
+        0);
+    ASSERT_EQ(g_argvs.size(), 1u);
+    EXPECT_TRUE(HasPrefix(g_argvs[0], "--rsh=sshpass -e ssh -p 2222 "));
+    EXPECT_FALSE(HasPrefix(g_argvs[0], "--log-file"));
+    EXPECT_TRUE(Contains(g_argvs[0], "--timeout=60"));
+    for (const auto& a : g_argvs[0]) {
+        EXPECT_EQ(a.find(kPassword), std::string::npos) << a;
+    }
+    EXPECT_EQ(LiveChildren(), 0u);
 }
 
 TEST_F(RsyncerServer, WrongPasswordFailsTheServerTest) {
