@@ -22,6 +22,7 @@
 
 #include <chrono>
 #include <condition_variable>
+#include <cstdlib>
 #include <cstring>
 #include <functional>
 #include <future>
@@ -588,10 +589,17 @@ TEST(TlsHostNameTest, CertificateNamesCommonNameThenAltNamesAndRejectsEmbeddedNu
 // Paths
 
 TEST(TlsPathTest, DefaultsAreTheFixedFilesAndSettersReplaceThem) {
-    // Only the strings are looked at: nothing here opens the fixed files.
-    EXPECT_EQ(Channel::GetCertPath(), "/tmp/.cloud_certs");
-    EXPECT_EQ(Channel::GetKeyPath(), "/tmp/.cloud_server.key");
-    EXPECT_EQ(Channel::GetCAPath(), "/certs.pem");
+    // The defaults are seen only before any setter ran, so they are checked in a fresh run of
+    // this program. Only the strings are looked at: nothing here opens the fixed files.
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_EXIT(
+        {
+            bool defaults = Channel::GetCertPath() == "/tmp/.cloud_certs" &&
+                            Channel::GetKeyPath() == "/tmp/.cloud_server.key" &&
+                            Channel::GetCAPath() == "/certs.pem";
+            std::exit(defaults ? 0 : 1);
+        },
+        ::testing::ExitedWithCode(0), "");
     Channel::SetCERTPath("/a/cert.pem");
     Channel::SetPriKeyPath("/a/key.pem");
     Channel::SetVerifyCAPath("/a/ca.pem");
