@@ -102,6 +102,24 @@ bool AltNameMatches(X509* cert, const std::string& host) {
     return matched;
 }
 
+// The context's suites below TLS 1.3 as a cipher string, in their order (TLS 1.3 suites are
+// configured apart and no cipher string touches them).
+std::string LegacyCipherList(SSL_CTX* ctx) {
+    std::string list;
+    STACK_OF(SSL_CIPHER)* ciphers = SSL_CTX_get_ciphers(ctx);
+    for (int i = 0; i < sk_SSL_CIPHER_num(ciphers); ++i) {
+        const SSL_CIPHER* cipher = sk_SSL_CIPHER_value(ciphers, i);
+        if (std::strcmp(SSL_CIPHER_get_version(cipher), "TLSv1.3") == 0) {
+            continue;
+        }
+        if (!list.empty()) {
+            list += ':';
+        }
+        list += SSL_CIPHER_get_name(cipher);
+    }
+    return list;
+}
+
 // OpenSSL reports a want-read as a hard failure while an older error sits in this thread's
 // queue, so the queue must be empty before every handshake, read and write call. What is
 // dropped here was either logged where it arose or belongs to an operation that already ended.
@@ -246,15 +264,17 @@ int Channel::InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted
     }
     // Current OpenSSL builds carry no RC4: the list is refused and the defaults stay, which is
     // what we want. A refused list still replaces the context's list with one that holds no
-    // TLS 1.2 suite at all, so the defaults are put back explicitly. The refusal is reported by
-    // the warning; its queued error must not linger.
+    // suite below TLS 1.3, so the list the context had (OpenSSL's defaults as the system
+    // configuration shaped them) is put back. The refusal is reported by the warning; its
+    // queued error must not linger.
+    const std::string defaults = LegacyCipherList(ctx);
     if (SSL_CTX_set_cipher_list(ctx, "RC4-MD5") != 1) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] s2s_channel.cpp(%d): can't set cipher suit to "
                        "SSL3_TXT_RSA_RC4_128_MD5\n",
                        __LINE__);
         ERR_clear_error();
-        if (SSL_CTX_set_cipher_list(ctx, "DEFAULT") != 1) {
+        if (!defaults.empty() && SSL_CTX_set_cipher_list(ctx, defaults.c_str()) != 1) {
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] s2s_channel.cpp(%d): m_ssl_ctx created failed\n", __LINE__);
             log_ssl();

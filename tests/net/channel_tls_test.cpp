@@ -705,6 +705,32 @@ TEST_F(ChannelTlsTest, ClientNegotiatesTls12WithAServerLimitedToIt) {
     EXPECT_EQ(std::string(reply, 3), "ba\n");
 }
 
+// The names of a context's cipher suites, in order.
+std::vector<std::string> CipherNames(SSL_CTX* ctx) {
+    std::vector<std::string> names;
+    STACK_OF(SSL_CIPHER)* ciphers = SSL_CTX_get_ciphers(ctx);
+    for (int i = 0; i < sk_SSL_CIPHER_num(ciphers); ++i) {
+        names.push_back(SSL_CIPHER_get_name(sk_SSL_CIPHER_value(ciphers, i)));
+    }
+    return names;
+}
+
+TEST_F(ChannelTlsTest, RefusedClientCipherListLeavesTheDefaultsExactly) {
+    SSL_CTX* fresh = SSL_CTX_new(TLS_client_method());
+    ASSERT_NE(fresh, nullptr);
+    const std::vector<std::string> defaults = CipherNames(fresh);
+    SSL_CTX_free(fresh);
+    SSL* ssl = nullptr;
+    SSL_CTX* ctx = nullptr;
+    ASSERT_EQ(Channel::InitSSL(ssl, ctx, false, true), 0);
+    EXPECT_TRUE(Logged("can't set cipher suit to SSL3_TXT_RSA_RC4_128_MD5\n"));
+    EXPECT_EQ(CipherNames(ctx), defaults);
+    EXPECT_EQ(ERR_peek_error(), 0u) << "the refusal must not linger in the error queue";
+    Channel::DeinitSSL(ssl, ctx, true);
+    EXPECT_EQ(ssl, nullptr);
+    EXPECT_EQ(ctx, nullptr);
+}
+
 TEST_F(ChannelTlsTest, ClientWithoutCaFileFailsSetupAndKeepsThePlainChannel) {
     OpensslServer server(certs_->cert_file("plain"), certs_->key_file("plain"));
     Channel::SetVerifyCAPath(certs_->path("missing-ca.pem"));
