@@ -4,7 +4,9 @@
 // without conflicts, the 202 retry, data runs, an encrypted share, cancellation, a wrong
 // password, a server that is down and the address loop.
 #include <dirent.h>
+#include <signal.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -133,6 +135,48 @@ TEST_F(RsyncerServer, CurrentServerReportsItsVersion) {
     EXPECT_TRUE(log.Has("): Get server version [1]\n"));
     EXPECT_FALSE(log.Has("[ERROR] s2s_rsyncer.cpp("));
     ExpectNoLeftovers();
+
+    // A failed query later leaves the known version as it was.
+    ASSERT_EQ(server_->Stop().status, 0);
+    rsyncer.GetServerVersion();
+    EXPECT_TRUE(log.Has("): Fail to get server version [10]\n"));
+    EXPECT_EQ(rsyncer.GetServerVersionValue(), 1);
+}
+
+// A stock rsync daemon without the command module: the wrapper answers 51, which the version
+// query takes for an old server, while the connection test fails with it.
+TEST_F(RsyncerServer, StockDaemonWithoutCommandsIsAnOldServer) {
+    s2s_test::TempDir dir("s2s-rsyncer-stock");
+    const std::string conf = dir / "rsyncd.conf";
+    s2s_test::WriteFile(conf,
+                        "port = 873\naddress = 127.0.0.1\nuse chroot = no\n"
+                        "pid file = " +
+                            dir / "pid" + "\n[data]\n\tpath = " + dir.path() + "\n");
+    const pid_t daemon = fork();
+    ASSERT_GE(daemon, 0);
+    if (daemon == 0) {
+        execl("/usr/bin/rsync", "rsync", "--daemon", "--no-detach", ("--config=" + conf).c_str(),
+              static_cast<char*>(nullptr));
+        _exit(127);
+    }
+    struct Reap {
+        pid_t pid;
+        ~Reap() {
+            kill(pid, SIGTERM);
+            waitpid(pid, nullptr, 0);
+        }
+    } reap{daemon};
+    ASSERT_TRUE(s2s_test::WaitFor([] { return rsyncer_test::PortAccepting(873); }));
+
+    LogCapture log;
+    S2S::Rsyncer rsyncer;
+    EXPECT_EQ(rsyncer.Initialize(Info()), S2S::kRsyncResultUnknownCmdAlt);
+    EXPECT_TRUE(log.Has("): Fail to test connection [51]\n"));
+    EXPECT_EQ(rsyncer.GetServerVersionValue(), -1);
+    rsyncer.GetServerVersion();
+    EXPECT_EQ(rsyncer.GetServerVersionValue(), 0);
+    EXPECT_FALSE(log.Has("Fail to get server version"));
+    EXPECT_EQ(CountEntries(client_->TempDir()), 0u);
 }
 
 TEST_F(RsyncerServer, OldServerIsVersionZeroAndPairsAsAWhole) {

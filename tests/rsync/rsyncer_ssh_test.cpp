@@ -17,8 +17,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <arpa/inet.h>
-
 #include <cstdio>
 #include <memory>
 #include <sstream>
@@ -42,17 +40,6 @@ const char kPassword[] = "pw-Key-Sync-41c2";
 
 bool Executable(const std::string& path) {
     return access(path.c_str(), X_OK) == 0;
-}
-
-bool Accepting(int port) {
-    const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_in addr{};
-    addr.sin_family = AF_INET;
-    addr.sin_port = htons(static_cast<uint16_t>(port));
-    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    const bool ok = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
-    close(fd);
-    return ok;
 }
 
 // A real sshd on 127.0.0.1:<free port> that accepts root with kPassword.
@@ -138,9 +125,10 @@ class TestSshd {
         }
         if (!s2s_test::WaitFor([&] {
                 int status = 0;
-                return Accepting(port_) || waitpid(pid_, &status, WNOHANG) == pid_;
+                return rsyncer_test::PortAccepting(port_) ||
+                       waitpid(pid_, &status, WNOHANG) == pid_;
             }) ||
-            !Accepting(port_)) {
+            !rsyncer_test::PortAccepting(port_)) {
             return "sshd did not start: " + s2s_test::ReadFile(log_);
         }
         return std::string();
