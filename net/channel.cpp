@@ -271,7 +271,8 @@ int Channel::Read(char* dst, unsigned int len) {
 }
 
 int Channel::Read(char* dst, unsigned int len, unsigned int& count) {
-    if (IsClosed()) {
+    // The operation set answers directly: this runs once per tag and value on a message stream.
+    if (is_closed_op_(handle_)) {
         return kStatusIOError;
     }
     // What is buffered first; a head equal to capacity_ reads as 0 (first piece empty).
@@ -328,7 +329,7 @@ int Channel::Read(char* dst, unsigned int len, unsigned int& count) {
 }
 
 int Channel::Write(const char* src, unsigned int len) {
-    if (IsClosed()) {
+    if (is_closed_op_(handle_)) {  // see Read
         return kStatusIOError;
     }
     if (len > capacity_) {
@@ -674,6 +675,51 @@ int Channel::WaitFd(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_
     return kStatusInterrupted;
 }
 
+namespace {
+
+// Outcome of one recv/send that returned `n`: the count, or -2 with the warnings of a failed or
+// closed connection.
+int ReadResult(ssize_t n) {
+    if (n <= 0) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): read: %s\n", __LINE__,
+                       std::strerror(errno));
+        if (n == 0) {
+            Logger::LogMsg(Logger::Warning,
+                           "[WARNING] s2s_channel.cpp(%d): Diagnose: select says the socket is "
+                           "readable but actually we can't read ... connection closed?\n",
+                           __LINE__);
+        }
+        return kStatusIOError;
+    }
+    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): ReadFd: read %d bytes\n", __LINE__,
+                  static_cast<int>(n));
+    return static_cast<int>(n);
+}
+
+int WriteResult(ssize_t n) {
+    if (n <= 0) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): write: %s\n", __LINE__,
+                       std::strerror(errno));
+        if (n == 0) {
+            Logger::LogMsg(Logger::Warning,
+                           "[WARNING] s2s_channel.cpp(%d): Diagnose: select says the socket is "
+                           "writeable but actually we can't write ... connection closed?\n",
+                           __LINE__);
+        }
+        return kStatusIOError;
+    }
+    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): WriteFd: write %d bytes\n", __LINE__,
+                  static_cast<int>(n));
+    return static_cast<int>(n);
+}
+
+// True when a non-blocking attempt found the socket not ready: only then is a wait needed.
+bool WouldBlock(ssize_t n) {
+    return n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR);
+}
+
+}  // namespace
+
 int Channel::ReadFd(int* handle, void* buf, unsigned int len, const timeval& wait, int* flag) {
     if (len == 0) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): ReadFd: request 0\n",
@@ -698,26 +744,21 @@ int Channel::ReadFd(int* handle, void* buf, unsigned int len, const timeval& wai
                        __LINE__, fd);
         return kStatusSystemError;
     }
-    ssize_t n = ::recv(fd, buf, len, 0);
-    if (n <= 0) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): read: %s\n", __LINE__,
-                       std::strerror(errno));
-        if (n == 0) {
-            Logger::LogMsg(Logger::Warning,
-                           "[WARNING] s2s_channel.cpp(%d): Diagnose: select says the socket is "
-                           "readable but actually we can't read ... connection closed?\n",
-                           __LINE__);
-        }
-        return kStatusIOError;
-    }
-    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): ReadFd: read %d bytes\n", __LINE__,
-                  static_cast<int>(n));
-    return static_cast<int>(n);
+    return ReadResult(::recv(fd, buf, len, 0));
 }
 
 int Channel::WriteFd(int* handle, const void* buf, unsigned int len, const timeval& wait,
                      int* flag) {
     int fd = PlainGetFd(handle);
+    // A socket almost always has room: one non-blocking try first saves a select per flush, and
+    // only a full socket waits, bounded as always (FlushWrite checks the abort flag before every
+    // call). SIGPIPE stays the program's business: the library never changes its disposition.
+    if (fd >= 0) {
+        ssize_t n = ::send(fd, buf, len, MSG_DONTWAIT);
+        if (!WouldBlock(n)) {
+            return WriteResult(n);
+        }
+    }
     fd_set write_set;
     fd_set except_set;
     int ret = WaitFd(fd, nullptr, &write_set, &except_set, wait, flag);
@@ -735,22 +776,7 @@ int Channel::WriteFd(int* handle, const void* buf, unsigned int len, const timev
                        __LINE__, fd);
         return kStatusSystemError;
     }
-    // Flags 0: SIGPIPE is the program's business (the library never changes its disposition).
-    ssize_t n = ::send(fd, buf, len, 0);
-    if (n <= 0) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): write: %s\n", __LINE__,
-                       std::strerror(errno));
-        if (n == 0) {
-            Logger::LogMsg(Logger::Warning,
-                           "[WARNING] s2s_channel.cpp(%d): Diagnose: select says the socket is "
-                           "writeable but actually we can't write ... connection closed?\n",
-                           __LINE__);
-        }
-        return kStatusIOError;
-    }
-    S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): WriteFd: write %d bytes\n", __LINE__,
-                  static_cast<int>(n));
-    return static_cast<int>(n);
+    return WriteResult(::send(fd, buf, len, 0));
 }
 
 int Channel::PlainGetFd(const int* handle) {

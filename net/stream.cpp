@@ -53,6 +53,31 @@ const char* WireKey(const std::string& key, size_t& length) {
     return key.data();
 }
 
+// Writes `len` bytes in pieces the channel accepts (one Write carries at most its capacity).
+int WriteBytes(Channel& channel, const char* data, size_t len) {
+    const size_t step = std::max(1u, channel.GetCapacity());
+    for (size_t done = 0; done < len; done += step) {
+        int ret = channel.Write(data + done, static_cast<unsigned int>(std::min(step, len - done)));
+        if (ret < 0) {
+            return ret;
+        }
+    }
+    return 0;
+}
+
+// A string value: tag 0x10, the low 16 bits of the length, then every byte (the format's own
+// limit, which senders respect). Short strings reach the channel in one piece with their header.
+int WriteString(Channel& channel, const char* data, size_t len) {
+    char head[64] = {static_cast<char>(PStream::kTagString), static_cast<char>((len >> 8) & 0xFF),
+                     static_cast<char>(len & 0xFF)};
+    if (len <= sizeof(head) - 3) {
+        std::memcpy(head + 3, data, len);
+        return WriteBytes(channel, head, 3 + len);
+    }
+    int ret = WriteBytes(channel, head, 3);
+    return ret < 0 ? ret : WriteBytes(channel, data, len);
+}
+
 }  // namespace
 
 // One open container of the decoder. The decoder keeps these on the heap so that nesting depth
@@ -118,18 +143,13 @@ int PStream::RecvDispatch(Channel& channel, unsigned char tag, PObject& object) 
 
 int PStream::Send(Channel& channel, unsigned long long value) {
     ResetStatus();
+    // Tag, length byte and value bytes go to the channel together.
     unsigned char length = IntegerLength(value);
-    unsigned char bytes[8];
+    unsigned char bytes[2 + 8] = {kTagInteger, length};
     for (int i = length - 1; i >= 0; --i) {
-        bytes[i] = static_cast<unsigned char>(value >> (8 * (length - 1 - i)));
+        bytes[2 + i] = static_cast<unsigned char>(value >> (8 * (length - 1 - i)));
     }
-    int ret = channel.WriteByte(kTagInteger);
-    if (ret >= 0) {
-        ret = channel.WriteByte(length);
-    }
-    if (ret >= 0) {
-        ret = channel.Write(reinterpret_cast<const char*>(bytes), length);
-    }
+    int ret = WriteBytes(channel, reinterpret_cast<const char*>(bytes), 2u + length);
     if (ret < 0) {
         return ChannelFailure(ret);
     }
@@ -169,18 +189,7 @@ int PStream::Recv(Channel& channel, unsigned long long& value) {
 
 int PStream::Send(Channel& channel, const std::string& value) {
     ResetStatus();
-    int ret = channel.WriteByte(kTagString);
-    if (ret >= 0) {
-        // Only the low 16 bits of the length fit, but every byte is written: the format's own
-        // limit, which callers respect.
-        ret = channel.WriteInt16(static_cast<unsigned short>(value.size() & 0xFFFF));
-    }
-    // One channel write carries at most its capacity.
-    const size_t step = std::max(1u, channel.GetCapacity());
-    for (size_t done = 0; ret >= 0 && done < value.size(); done += step) {
-        size_t len = std::min(step, value.size() - done);
-        ret = channel.Write(value.data() + done, static_cast<unsigned int>(len));
-    }
+    int ret = WriteString(channel, value.data(), value.size());
     if (ret < 0) {
         return ChannelFailure(ret);
     }
@@ -217,10 +226,8 @@ int PStream::Recv(Channel& channel, std::string& value) {
 
 int PStream::SendNull(Channel& channel) {
     ResetStatus();
-    int ret = channel.WriteByte(kTagNull);
-    if (ret >= 0) {
-        ret = channel.WriteByte(0);
-    }
+    static const char kNull[2] = {kTagNull, 0};
+    int ret = WriteBytes(channel, kNull, sizeof(kNull));
     return ret < 0 ? ChannelFailure(ret) : kStatusSuccessful;
 }
 
@@ -442,14 +449,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
 int PStream::SendKey(Channel& channel, const char* key, size_t length) {
     // Keys are strings on the wire; written here without building a copy of the key.
     ResetStatus();
-    int ret = channel.WriteByte(kTagString);
-    if (ret >= 0) {
-        ret = channel.WriteInt16(static_cast<unsigned short>(length & 0xFFFF));
-    }
-    const size_t step = std::max(1u, channel.GetCapacity());
-    for (size_t done = 0; ret >= 0 && done < length; done += step) {
-        ret = channel.Write(key + done, static_cast<unsigned int>(std::min(step, length - done)));
-    }
+    int ret = WriteString(channel, key, length);
     if (ret < 0) {
         return ChannelFailure(ret);
     }
