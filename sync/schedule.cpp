@@ -49,46 +49,79 @@ bool SameWallClock(const struct tm& a, const struct tm& b) {
     return SameDate(a, b) && a.tm_hour == b.tm_hour && a.tm_min == b.tm_min && a.tm_sec == b.tm_sec;
 }
 
-// mktime, for broken-down times built by date arithmetic. Their daylight-saving flag is a hint
-// carried over from another day or another time of day; trusted blindly, a stale flag makes
-// mktime move the result by the size of the clock change (09:00 on the day the clocks go back
-// becomes 08:00; 23:30 on the day before they go forward becomes 00:30 of the next day, so a
-// monthly run lands on the wrong date). So the hint only decides what it can decide correctly:
-// which of the two 02:30s of the repeated hour is meant, and where a time inside the skipped hour
-// goes. Any wall-clock time that exists is kept as asked for.
-time_t NormaliseLocal(struct tm& tm) {
-    struct tm hinted = tm;
-    time_t hinted_secs = mktime(&hinted);
-    if (hinted_secs == -1 || tm.tm_isdst < 0) {
-        tm = hinted;
-        return hinted_secs;
+// Whether the UTC offset changes within a few hours of `when` (clock changes move the clocks by
+// at most two hours).
+bool NearOffsetChange(time_t when) {
+    const time_t kWindow = 4 * 3600;
+    time_t before = when - kWindow;
+    time_t after = when + kWindow;
+    struct tm at_before;
+    struct tm at_after;
+    if (localtime_r(&before, &at_before) == nullptr || localtime_r(&after, &at_after) == nullptr) {
+        return true;
     }
+    return at_before.tm_gmtoff != at_after.tm_gmtoff || at_before.tm_isdst != at_after.tm_isdst;
+}
+
+// mktime for broken-down times built by date arithmetic. Their daylight-saving flag is left over
+// from another day or another time of day, and mktime trusts it: a stale flag moves the result by
+// the size of the clock change (09:00 on the day the clocks go back becomes 08:00; 23:30 on the
+// day before they go forward becomes 00:30 of the next day, so a monthly run lands on the wrong
+// date). So the flag is ignored and the wall-clock time decides:
+// - a time that occurs once is that moment;
+// - a time inside the repeated hour is its first occurrence, so a run happens once, not twice;
+// - a time inside the skipped hour is read with the offset in force before the change, which puts
+//   it just after the jump (02:30 becomes 03:30), so the day still gets its run.
+// With keep_date (date arithmetic, where only the day matters) a reading on the asked-for day is
+// preferred, which matters only where the clocks jump across midnight.
+// The result, like mktime's, is -1 when the time cannot be represented; `tm` is then left as
+// mktime leaves it.
+time_t ResolveLocal(struct tm& tm, bool keep_date) {
     // The wall-clock time asked for, with the calendar overflow resolved (31 April is 1 May).
     struct tm wanted = tm;
     wanted.tm_isdst = 0;
-    if (timegm(&wanted) == -1) {
-        tm = hinted;
-        return hinted_secs;
+    const bool calendar_ok = timegm(&wanted) != -1;
+
+    // Away from any change of UTC offset a wall-clock time occurs exactly once, and mktime finds
+    // it without a flag. That is nearly always the case, and it is cheap: mktime given a definite
+    // flag that the zone never uses searches far and wide for a moment that has it.
+    struct tm guess = tm;
+    guess.tm_isdst = -1;
+    time_t guess_secs = mktime(&guess);
+    if (guess_secs == -1 || !calendar_ok ||
+        (SameWallClock(guess, wanted) && !NearOffsetChange(guess_secs))) {
+        tm = guess;
+        return guess_secs;
     }
-    if (SameWallClock(hinted, wanted)) {
-        tm = hinted;
-        return hinted_secs;
+
+    // Near a change: read the wall clock both ways and choose.
+    struct tm readings[2] = {tm, tm};
+    readings[0].tm_isdst = 0;
+    readings[1].tm_isdst = 1;
+    time_t secs[2];
+    for (int i = 0; i < 2; ++i) {
+        secs[i] = mktime(&readings[i]);
     }
-    struct tm other = tm;
-    other.tm_isdst = tm.tm_isdst > 0 ? 0 : 1;
-    time_t other_secs = mktime(&other);
-    if (other_secs != -1 && SameWallClock(other, wanted)) {
-        tm = other;
-        return other_secs;
+    if (secs[0] == -1 || secs[1] == -1) {
+        tm = guess;
+        return guess_secs;
     }
-    // The time lies in a skipped hour. Keep the hinted reading unless it left the day, which can
-    // only happen where the clocks jump at midnight.
-    if (!SameDate(hinted, wanted) && other_secs != -1 && SameDate(other, wanted)) {
-        tm = other;
-        return other_secs;
+    const bool exact[2] = {SameWallClock(readings[0], wanted), SameWallClock(readings[1], wanted)};
+    int pick;
+    if (exact[0] && exact[1]) {
+        pick = secs[0] <= secs[1] ? 0 : 1;  // the first occurrence
+    } else if (exact[0] || exact[1]) {
+        pick = exact[0] ? 0 : 1;
+    } else {
+        // Skipped: the later of the two readings is the one with the earlier (smaller) offset.
+        pick = secs[0] >= secs[1] ? 0 : 1;
+        if (keep_date && !SameDate(readings[pick], wanted) &&
+            SameDate(readings[1 - pick], wanted)) {
+            pick = 1 - pick;
+        }
     }
-    tm = hinted;
-    return hinted_secs;
+    tm = readings[pick];
+    return secs[pick];
 }
 
 void LogTimeFields(int line, const char* what, const struct tm& tm) {
@@ -268,8 +301,12 @@ long Schedule::GetNextScheduledSeconds(long now) const {
     struct tm now_tm;
     std::memset(&now_tm, 0, sizeof(now_tm));
     time_t now_time = static_cast<time_t>(now);
-    // A time too large for a calendar year leaves the zeroed fields, which fail further down.
-    localtime_r(&now_time, &now_tm);
+    // A time too large for a calendar year leaves zeroed fields, which fail further down. They
+    // must be zeroed again: localtime_r fills in part of the overflowing date before it gives up,
+    // and a walk starting from there never finds a run later than `now`.
+    if (localtime_r(&now_time, &now_tm) == nullptr) {
+        std::memset(&now_tm, 0, sizeof(now_tm));
+    }
 
     if (mode_ == SCHD_MANUAL) {
         return 0;
@@ -284,7 +321,7 @@ long Schedule::GetNextScheduledSeconds(long now) const {
         const struct tm begin = GetScheduleBegin();
         // The current day at the current time of day, with its weekday.
         struct tm ref = now_tm;
-        NormaliseLocal(ref);
+        ResolveLocal(ref, true);
 
         switch (mode_) {
             case SCHD_WEEKLY: {
@@ -325,14 +362,15 @@ long Schedule::GetNextScheduledSeconds(long now) const {
         }
 
         struct tm now_copy = now_tm;
-        long now_secs = static_cast<long>(NormaliseLocal(now_copy));
+        long now_secs = static_cast<long>(ResolveLocal(now_copy, true));
         if (now_secs < 0) {
             LogTimeFields(kLineReferenceSeconds, "reference", now_copy);
             return -1;
         }
         // Normalising rolls an overflowing day into the next month: a monthly task on the 31st
         // runs on the 1st after a 30-day month.
-        long ref_secs = static_cast<long>(NormaliseLocal(ref));
+        const struct tm aligned = ref;
+        long ref_secs = static_cast<long>(ResolveLocal(ref, true));
 
         // Both carry the same time of day, so this says the aligned day lies before today.
         if (now_secs > ref_secs) {
@@ -340,11 +378,16 @@ long Schedule::GetNextScheduledSeconds(long now) const {
                 LogTimeFields(kLinePastScheduled, "scheduled", ref);
                 return -1;
             }
+            // The next month or year is counted from the aligned date as asked for, not as
+            // normalised: 29 February of a common year reads as 1 March, and one year on from
+            // there would miss the leap year's 29 February.
             switch (mode_) {
                 case SCHD_MONTHLY:
+                    ref = aligned;
                     ref.tm_mon += 1;  // the next mktime normalises
                     break;
                 case SCHD_YEARLY:
+                    ref = aligned;
                     ref.tm_year += 1;
                     break;
                 case SCHD_ONCE:
@@ -364,13 +407,13 @@ long Schedule::GetNextScheduledSeconds(long now) const {
             }
         }
 
-        // The day's first run. Its daylight-saving flag is the one ref just got, which picks the
-        // reading of a start time inside the repeated or the skipped hour.
+        // The day's first run, at its wall-clock start time (see ResolveLocal for the repeated and
+        // the skipped hour).
         struct tm day = ref;
         day.tm_hour = start_hour_;
         day.tm_min = start_minute_;
         day.tm_sec = 0;
-        long first = static_cast<long>(NormaliseLocal(day));
+        long first = static_cast<long>(ResolveLocal(day, false));
         if (first < 0) {
             // This day cannot be expressed; try the next one.
             LogTimeFields(kLineDaySeconds, "scheduled", day);
