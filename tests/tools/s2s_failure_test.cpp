@@ -1,0 +1,125 @@
+// End-to-end scenarios of `s2s sync` that must fail, or cope, with a clear exit code and message:
+// a second sender pairing a share that is taken, an old server, Ctrl-C in the middle of a copy, a
+// receiver that is down, and a wrong password.
+#include <gtest/gtest.h>
+
+#include "tools/s2s_scenario.h"
+
+namespace {
+
+using namespace s2s_scenario;
+using s2s_test::WaitFor;
+
+const char kUser[] = "backup";
+const char kPassword[] = "correct horse battery";
+
+class FailureScenario : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        if (!EnterPrivateNetwork()) {
+            GTEST_SKIP() << "needs root and network namespaces";
+        }
+        receiver_.reset(new Receiver(kUser, kPassword));
+        sender_.reset(new Sender("sender", "SN-SENDER-A", kPassword));
+        for (const char* share : {"docs", "media"}) {
+            sender_->AddShare(share);
+            receiver_->AddShare(share);
+        }
+    }
+
+    void StartReceiver(bool oldServer = false) {
+        ASSERT_EQ(receiver_->Configure(oldServer).status, 0);
+        const Result started = receiver_->Start();
+        ASSERT_EQ(started.status, 0) << started.All();
+    }
+
+    std::unique_ptr<Receiver> receiver_;
+    std::unique_ptr<Sender> sender_;
+};
+
+TEST_F(FailureScenario, SecondSenderPairingATakenShareIsRefusedWithTheShareNamed) {
+    StartReceiver();
+    GenerateFiles(sender_->SharePath("docs"), 5, 100, 1);
+    ASSERT_EQ(sender_->Sync(kUser, {"docs"}).status, 0);
+    const auto before = Manifest(receiver_->SharePath("docs"));
+
+    Sender second("second", "SN-SENDER-B", kPassword);
+    second.AddShare("docs");
+    second.AddShare("media");
+    GenerateFiles(second.SharePath("docs"), 8, 300, 2);
+    const Result r = second.Sync(kUser, {"media", "docs"}, {"--json"});
+    EXPECT_EQ(r.status, 7) << r.All();
+    EXPECT_NE(r.err.find("share 'docs' is already paired with another client"), std::string::npos)
+        << r.err;
+    EXPECT_NE(r.out.find("\"result\": \"conflict\""), std::string::npos) << r.out;
+    // Nothing of the second sender arrived in the taken share.
+    EXPECT_EQ(Manifest(receiver_->SharePath("docs")), before);
+    EXPECT_NE(receiver_->Status().out.find("share: docs completed SN-SENDER-A"), std::string::npos);
+}
+
+TEST_F(FailureScenario, OldServerIsSyncedWithoutMultiSourcePairing) {
+    StartReceiver(/*oldServer=*/true);
+    GenerateFiles(sender_->SharePath("docs") + "/d", 12, 500, 3);
+    const Result r = sender_->Sync(kUser, {"docs"});
+    ASSERT_EQ(r.status, 0) << r.All();
+    EXPECT_NE(r.out.find("an old server"), std::string::npos) << r.out;
+    EXPECT_EQ(Manifest(sender_->SharePath("docs")), Manifest(receiver_->SharePath("docs")));
+}
+
+TEST_F(FailureScenario, CtrlCStopsTheCopyLeavesNoRsyncAndNothingComplete) {
+    StartReceiver();
+    const std::string big = sender_->SharePath("docs") + "/big.bin";
+    WriteRandomFile(big, 48u << 20);
+    auto sync = sender_->StartSync(kUser, {"docs", "media"}, {"--compress", "--json"});
+    ASSERT_TRUE(WaitFor([&] { return HasPartialFile(receiver_->SharePath("docs")); },
+                        std::chrono::seconds(60)))
+        << sync->Err();
+    // Frozen, the sending rsync is surely still copying when the interrupt arrives; stopping the
+    // run must not depend on its cooperation.
+    const pid_t rsync = SenderRsync(sync->Pid());
+    ASSERT_GT(rsync, 0);
+    kill(rsync, SIGSTOP);
+    sync->Signal(SIGINT);
+    EXPECT_EQ(sync->Wait(), 130) << sync->Err();
+    EXPECT_NE(sync->Err().find("stopped by Ctrl-C"), std::string::npos) << sync->Err();
+    EXPECT_NE(sync->Out().find("\"state\": \"cancelled\""), std::string::npos) << sync->Out();
+    EXPECT_NE(sync->Out().find("\"state\": \"not-run\""), std::string::npos) << sync->Out();
+    // No rsync left running, on either side, for this transfer.
+    EXPECT_TRUE(WaitFor([&] { return ProcessesMentioning(big).empty(); }));
+    EXPECT_NE(kill(rsync, 0), 0);
+    // The share was started but never finished: not complete on the server.
+    const std::string status = receiver_->Status().out;
+    EXPECT_EQ(status.find("share: docs completed"), std::string::npos) << status;
+}
+
+TEST_F(FailureScenario, ReceiverDownIsReportedAsUnreachable) {
+    StartReceiver();
+    ASSERT_EQ(receiver_->Stop().status, 0);
+    const Result r = sender_->Sync(kUser, {"docs"}, {"--json"});
+    EXPECT_EQ(r.status, 5) << r.All();
+    EXPECT_NE(r.err.find("the server did not answer: socket-io (10)"), std::string::npos) << r.err;
+    EXPECT_NE(r.out.find("\"result\": \"unreachable\""), std::string::npos) << r.out;
+}
+
+TEST_F(FailureScenario, WrongPasswordIsReportedAsAuthenticationFailure) {
+    StartReceiver();
+    Sender wrong("wrong", "SN-SENDER-A", "not the password");
+    wrong.AddShare("docs");
+    const Result r = wrong.Sync(kUser, {"docs"});
+    EXPECT_EQ(r.status, 6) << r.All();
+    EXPECT_NE(r.err.find("refused user 'backup' or its password"), std::string::npos) << r.err;
+    // The password itself never appears in what the tool prints.
+    EXPECT_EQ(r.All().find("not the password"), std::string::npos);
+}
+
+TEST_F(FailureScenario, PasswordFromTheEnvironmentIsAccepted) {
+    StartReceiver();
+    GenerateFiles(sender_->SharePath("docs"), 3, 10, 4);
+    const Result r = sender_->Run(
+        "s2s",
+        {"sync", "--server-ip", "127.0.0.1", "--user", kUser, "--share", "docs", "--no-progress"},
+        "", {{"S2S_PASSWORD", kPassword}});
+    EXPECT_EQ(r.status, 0) << r.All();
+}
+
+}  // namespace
