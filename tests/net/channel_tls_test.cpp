@@ -384,6 +384,9 @@ class Listener {
         if (fd_ < 0 || bind(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 ||
             listen(fd_, 8) != 0 ||
             getsockname(fd_, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
+            if (fd_ >= 0) {
+                close(fd_);
+            }
             throw std::runtime_error("listener");
         }
         port_ = ntohs(addr.sin_port);
