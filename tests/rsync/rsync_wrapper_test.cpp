@@ -268,7 +268,6 @@ TEST_F(WrapperTest, CancelStopsTheWholeRunQuickly) {
     std::atomic<int> progressCalls{0};
     w.setProgressCallback([&](int) { ++progressCalls; });
     std::atomic<bool> passwordSeen{false};
-    auto started = std::chrono::steady_clock::now();
     std::chrono::steady_clock::time_point asked;
     int polls = 0;
     int rc = w.execute([&]() {
@@ -277,7 +276,8 @@ TEST_F(WrapperTest, CancelStopsTheWholeRunQuickly) {
         if (polls == 3) {
             passwordSeen = ProcessesMentioning(server_->Password()) > 0;
         }
-        if (now - started > std::chrono::milliseconds(700)) {
+        // Once data flows: in the middle of the transfer.
+        if (polls >= 3 && progressCalls > 0) {
             asked = now;
             return true;
         }
