@@ -18,7 +18,7 @@ namespace {
 
 using rsyncer_test::ClientHost;
 using rsyncer_test::LogCapture;
-using rsyncer_test::ShareSpec;
+using rsyncer_test::ShareAttrs;
 using Lines = std::list<std::string>;
 
 std::string Host35() {
@@ -101,12 +101,12 @@ TEST(RsyncerCommandFile, ValuesGoInVerbatim) {
 
 TEST(RsyncerCommandFile, StartSyncShareCarriesAttributesAsOneAndZero) {
     ClientHost host("SN-START");
-    ShareSpec spec;
-    spec.encrypted = true;
-    spec.autoMount = true;
-    spec.winShare = true;  // a Windows share counts as an ACL share
-    spec.keyLen = 32;
-    host.AddShare("secret", spec);
+    ShareAttrs attrs;
+    attrs.encrypted = true;
+    attrs.autoMount = true;
+    attrs.winShare = true;  // a Windows share counts as an ACL share
+    attrs.keyLen = 32;
+    host.AddShare("secret", attrs);
     host.AddShare("plain");
     S2S::Rsyncer rsyncer;
     const std::string volume = host.Volume().substr(1);
@@ -288,7 +288,7 @@ TEST(RsyncerShareCache, FirstAnswerSticksForTheRsyncersLife) {
     EXPECT_FALSE(info.IsEncrypted());
     EXPECT_EQ(info.GetModuleName(), "photos");
 
-    ShareSpec encrypted;
+    ShareAttrs encrypted;
     encrypted.encrypted = true;
     host.AddShare("photos", encrypted);
     host.AddShare("late");
@@ -351,9 +351,9 @@ TEST(RsyncerServerLookup, NoUsableAddressGives42) {
 TEST(RsyncerKeySync, NothingToSendIsZero) {
     ClientHost host;
     host.AddShare("plain");
-    ShareSpec spec;
-    spec.encrypted = true;
-    host.AddShare("nokey", spec);
+    ShareAttrs attrs;
+    attrs.encrypted = true;
+    host.AddShare("nokey", attrs);
     LogCapture log;
     S2S::Rsyncer rsyncer;
     // A plain share has no key; an encrypted share whose key is not stored here sends nothing.

@@ -48,7 +48,7 @@ inline std::string RealPath(const std::string& path) {
 }
 
 // Attributes of one share in the sending host's registry.
-struct ShareSpec {
+struct ShareAttrs {
     bool encrypted = false;
     bool autoMount = false;
     bool acl = false;
@@ -58,27 +58,27 @@ struct ShareSpec {
 
 // Adds (or replaces) a share in the registry of the host whose root is `root`.
 inline std::string RegisterShare(const std::string& root, const std::string& volume,
-                                 const std::string& name, const ShareSpec& spec) {
+                                 const std::string& name, const ShareAttrs& attrs) {
     s2s_test::ScopedEnv env("S2S_ROOT", root.c_str());
     const std::string path = volume + "/" + name;
     MakeDirs(path);
-    VLIBSzHash* attrs = VLIBCSzHashAlloc(8);
-    VLIBCSzHashSetValue(&attrs, "path", path.c_str());
-    VLIBCSzHashSetValue(&attrs, "encrypted", spec.encrypted ? "yes" : "no");
-    if (spec.encrypted) {
+    VLIBSzHash* table = VLIBCSzHashAlloc(8);
+    VLIBCSzHashSetValue(&table, "path", path.c_str());
+    VLIBCSzHashSetValue(&table, "encrypted", attrs.encrypted ? "yes" : "no");
+    if (attrs.encrypted) {
         const std::string lower = volume + "/@" + name + "@";
         MakeDirs(lower);
-        VLIBCSzHashSetValue(&attrs, "encrypted_path", lower.c_str());
-        VLIBCSzHashSetValue(&attrs, "key_file", (root + "/keys/" + name + ".key").c_str());
-        VLIBCSzHashSetValue(&attrs, "auto_key_file",
+        VLIBCSzHashSetValue(&table, "encrypted_path", lower.c_str());
+        VLIBCSzHashSetValue(&table, "key_file", (root + "/keys/" + name + ".key").c_str());
+        VLIBCSzHashSetValue(&table, "auto_key_file",
                             (root + "/keys/" + name + ".auto.key").c_str());
     }
-    VLIBCSzHashSetValue(&attrs, "auto_mount", spec.autoMount ? "yes" : "no");
-    VLIBCSzHashSetValue(&attrs, "acl", spec.acl ? "yes" : "no");
-    VLIBCSzHashSetValue(&attrs, "win_share", spec.winShare ? "yes" : "no");
-    VLIBCSzHashSetValue(&attrs, "key_len", std::to_string(spec.keyLen).c_str());
-    const int rc = VURNShareSet(name.c_str(), attrs);
-    VLIBCSzHashFree(attrs);
+    VLIBCSzHashSetValue(&table, "auto_mount", attrs.autoMount ? "yes" : "no");
+    VLIBCSzHashSetValue(&table, "acl", attrs.acl ? "yes" : "no");
+    VLIBCSzHashSetValue(&table, "win_share", attrs.winShare ? "yes" : "no");
+    VLIBCSzHashSetValue(&table, "key_len", std::to_string(attrs.keyLen).c_str());
+    const int rc = VURNShareSet(name.c_str(), table);
+    VLIBCSzHashFree(table);
     if (rc < 0) {
         throw std::runtime_error("VURNShareSet failed for " + name);
     }
@@ -114,8 +114,8 @@ class ClientHost {
     // Registers a share whose directory is <volume>/<name> (and, when encrypted, whose ciphertext
     // directory is <volume>/@<name>@ and whose key files are under <root>/keys); the directories
     // are created. The path of the share's directory.
-    std::string AddShare(const std::string& name, const ShareSpec& spec = ShareSpec()) {
-        return RegisterShare(real_, Volume(), name, spec);
+    std::string AddShare(const std::string& name, const ShareAttrs& attrs = ShareAttrs()) {
+        return RegisterShare(real_, Volume(), name, attrs);
     }
 
     std::string EncryptedDir(const std::string& name) const { return Volume() + "/@" + name + "@"; }
@@ -328,8 +328,8 @@ class Receiver {
     std::string KeyDir() const { return real_ + "/usr/vurn/etc/.encrypt"; }
     std::string ConfigFile() const { return real_ + "/usr/vurn/etc/s2s_rsyncd.conf"; }
 
-    std::string AddShare(const std::string& name, const ShareSpec& spec = ShareSpec()) {
-        return RegisterShare(real_, Volume(), name, spec);
+    std::string AddShare(const std::string& name, const ShareAttrs& attrs = ShareAttrs()) {
+        return RegisterShare(real_, Volume(), name, attrs);
     }
 
     // Writes the daemon's configuration; `oldServer` makes it answer like a server that knows

@@ -34,7 +34,7 @@ namespace {
 using rsyncer_test::ClientHost;
 using rsyncer_test::LogCapture;
 using rsyncer_test::Receiver;
-using rsyncer_test::ShareSpec;
+using rsyncer_test::ShareAttrs;
 using rsyncer_test::Snapshot;
 using Lines = std::list<std::string>;
 
@@ -87,7 +87,7 @@ class RsyncerServer : public ::testing::Test {
             client_->AddShare(name);
             server_->AddShare(name);
         }
-        ShareSpec encrypted;
+        ShareAttrs encrypted;
         encrypted.encrypted = true;
         encrypted.keyLen = 32;
         client_->AddShare("secret", encrypted);

@@ -32,7 +32,7 @@ namespace {
 using rsyncer_test::ClientHost;
 using rsyncer_test::Receiver;
 using rsyncer_test::RunTool;
-using rsyncer_test::ShareSpec;
+using rsyncer_test::ShareAttrs;
 
 // The receiver's rsync account is root, which is also the ssh login: one password for both.
 const char kUser[] = "root";
@@ -158,9 +158,9 @@ class RsyncerKeySyncSsh : public ::testing::Test {
         }
         client_.reset(new ClientHost("SN-KEYS"));
         server_.reset(new Receiver(kUser, kPassword));
-        ShareSpec stored;
+        ShareAttrs stored;
         stored.encrypted = true;
-        ShareSpec automatic = stored;
+        ShareAttrs automatic = stored;
         automatic.autoMount = true;
         client_->AddShare("secret", stored);
         client_->AddShare("boot", automatic);
