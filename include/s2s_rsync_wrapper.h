@@ -24,7 +24,8 @@
 // random reply token; the server's handler runs the command and leaves its result code and output
 // in a reply directory named by the token, which the same run pulls back. execute() returns the
 // handler's result code; when the lines carry outfile="<local path>", the reply's output file
-// (at most 1 MiB) is written to that local path. A command file may hold at most 4000 bytes.
+// (at most 1 MiB) is written to that local path. The command file (with the token line) may
+// hold at most 4096 bytes.
 // The server's answers are described in docs/protocol.md.
 //
 // Result codes of execute(): 0; rsync's own exit code (5 authentication refused or unknown
