@@ -588,9 +588,16 @@ int main(void) {
     return ok ? 0 : 1;
 }
 )");
+#ifdef __SANITIZE_ADDRESS__
+    // The library carries the sanitizers' runtime, which must come first in the program.
+    const std::string sanitize = " -fsanitize=address,undefined -fno-sanitize-recover=all";
+#else
+    const std::string sanitize;
+#endif
     const std::string compile =
-        "cc -std=c11 -Wall -Wextra -Wpedantic -Werror -I " S2S_SOURCE_DIR "/include -o '" +
-        program + "' '" + source + "' -L " S2S_BINARY_DIR " -ls2s -Wl,-rpath," S2S_BINARY_DIR;
+        "cc" + sanitize +
+        " -std=c11 -Wall -Wextra -Wpedantic -Werror -I " S2S_SOURCE_DIR "/include -o '" + program +
+        "' '" + source + "' -L " S2S_BINARY_DIR " -ls2s -Wl,-rpath," S2S_BINARY_DIR;
     ASSERT_EQ(0, system(compile.c_str())) << compile;
     EXPECT_EQ(0, system(("'" + program + "'").c_str()));
 }
