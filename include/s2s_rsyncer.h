@@ -9,6 +9,7 @@
 #ifndef S2S_RSYNCER_H
 #define S2S_RSYNCER_H
 
+#include <boost/function.hpp>
 #include <list>
 #include <map>
 #include <string>
@@ -82,6 +83,9 @@ class S2S_EXPORT Rsyncer {
     // Keeps everything: the share cache and the server version survive re-initialisation.
     void Clear();
     void SetCancelChecker(bool (*fn)()) { cancelChecker = fn; }
+    // Receives the overall progress (0 to 100) of RunSync's transfers, on the caller's thread
+    // while the run goes on; for progress displays. Commands and key transfers report none.
+    void SetProgressCallback(const boost::function<void(int)>& fn) { progressCallback = fn; }
     // A copy, with the server address TestServer settled on.
     SyncInfo GetSyncInfo() const { return syncInfo; }
 
@@ -143,6 +147,7 @@ class S2S_EXPORT Rsyncer {
     SyncInfo syncInfo;
     std::map<std::string, ShareInfo> shareInfoCache;
     std::string reserved;  // no operation reads or writes it yet
+    boost::function<void(int)> progressCallback;
 };
 
 // Splits `text` at every character of `separators`, appending each piece (empty ones included)

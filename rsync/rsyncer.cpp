@@ -137,6 +137,9 @@ int Rsyncer::RunSync(unsigned long long /*id*/, const std::string& shareName,
     task.SetCompression(syncInfo.UseCompression());
     task.SetBlockLevelSync(syncInfo.UseBlockLevelSync());
     task.SetSyncACL(true);
+    if (progressCallback) {
+        task.setProgressCallback(progressCallback);
+    }
 
     std::string src;
     if (relPath == "/") {

@@ -309,6 +309,8 @@ TEST_F(RsyncerServer, DataRunsMirrorTheShare) {
 
     S2S::Rsyncer rsyncer;
     ASSERT_EQ(rsyncer.Initialize(Info()), 0);
+    int lastProgress = -1;
+    rsyncer.SetProgressCallback([&lastProgress](int percent) { lastProgress = percent; });
     int result = -1;
     Lines conflicts;
     ASSERT_EQ(rsyncer.DoPairing(false, {"photos"}, conflicts, result), 0);
@@ -316,6 +318,8 @@ TEST_F(RsyncerServer, DataRunsMirrorTheShare) {
     ASSERT_EQ(result, 0);
     ASSERT_EQ(rsyncer.RunSync(1, "photos", "/", {"*.tmp"}, result), 0);
     ASSERT_EQ(result, 0);
+    EXPECT_GT(lastProgress, 0);
+    EXPECT_LE(lastProgress, 100);
 
     auto expected = Snapshot(src);
     expected.erase("/scratch.tmp");
