@@ -1,0 +1,107 @@
+#!/usr/bin/env bash
+# Benchmark: `s2s sync` against a plain `rsync -a --delete` of the same generated tree to the same
+# rsync daemon (s2s-receiver's), in one run: a full copy into an empty share, then a run with
+# nothing changed. Prints the times and the ratios s2s / rsync, and how much of s2s's time went to
+# its control commands (server test, pairing, share start and finish, status beacon).
+#
+# Usage: bash bench/sync_vs_rsync.sh            (needs root: private network namespace)
+#   S2S_BENCH_FILES  number of files (default 5000)
+#   S2S_BENCH_MB     total size in MiB (default 1024)
+#   S2S_BUILD_DIR    build directory holding bin/s2s and bin/s2s-receiver (default build)
+set -euo pipefail
+cd "$(dirname "$0")/.."
+repo=$(pwd)
+build=${S2S_BUILD_DIR:-build}
+case $build in /*) bin=$build/bin ;; *) bin=$repo/$build/bin ;; esac
+
+if [ -z "${S2S_BENCH_INSIDE:-}" ]; then
+  if [ "$(id -u)" -ne 0 ]; then
+    echo "bench: run as root (the daemon gets a private network namespace)" >&2
+    exit 1
+  fi
+  cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
+  cmake --build "$build" -j "$(nproc)" --target s2s_cli s2s-receiver >/dev/null
+  exec unshare --net -- env S2S_BENCH_INSIDE=1 bash "$0" "$@"
+fi
+
+files=${S2S_BENCH_FILES:-5000}
+megabytes=${S2S_BENCH_MB:-1024}
+user=bench
+password=$(head -c 18 /dev/urandom | base64 | tr -d '/+=')
+ip link set lo up
+work=$(mktemp -d /tmp/s2s-bench.XXXXXX)
+sender=$work/sender
+receiver=$work/receiver
+cleanup() {
+  S2S_ROOT=$receiver "$bin/s2s-receiver" stop >/dev/null 2>&1 || true
+  rm -rf "$work"
+}
+trap cleanup EXIT
+
+for root in "$sender" "$receiver"; do
+  mkdir -p "$root/etc/s2s" "$root/tmp/S2S" "$root/volume1"
+  printf '[host]\n\tserial="SN-BENCH-%s"\n[volumes]\n\t%s="internal"\n' "$(basename "$root")" \
+    "$root/volume1" >"$root/etc/s2s/host.conf"
+done
+mkdir -p "$sender/volume1/data" "$receiver/volume1/data" "$receiver/volume1/plain"
+S2S_ROOT=$sender "$bin/s2s" share add data --path "$sender/volume1/data" >/dev/null
+S2S_ROOT=$receiver "$bin/s2s" share add data --path "$receiver/volume1/data" >/dev/null
+S2S_ROOT=$receiver "$bin/s2s" share add plain --path "$receiver/volume1/plain" >/dev/null
+printf '%s\n' "$password" |
+  S2S_ROOT=$receiver "$bin/s2s-receiver" configure --user "$user" --port 873 --address 127.0.0.1
+S2S_ROOT=$receiver "$bin/s2s-receiver" start
+
+echo "generating $files files, $megabytes MiB"
+per_dir=250
+size=$((megabytes * 1048576 / files))
+for ((d = 0; d * per_dir < files; d++)); do
+  n=$((files - d * per_dir < per_dir ? files - d * per_dir : per_dir))
+  mkdir -p "$sender/volume1/data/dir$d"
+  head -c $((n * size)) /dev/urandom | split -b "$size" -a 3 - "$sender/volume1/data/dir$d/f"
+done
+sync
+
+password_file=$work/password
+(umask 077 && printf '%s\n' "$password" >"$password_file")
+now() { date +%s.%N; }
+field() { sed -n "s/^  \"$2\": \([0-9.]*\),\{0,1\}$/\1/p" "$1"; }
+
+run_s2s() {  # label
+  local start end
+  start=$(now)
+  S2S_ROOT=$sender "$bin/s2s" sync --server-ip 127.0.0.1 --user "$user" --share data \
+    --password-file "$password_file" --name bench --json --quiet >"$work/$1.json"
+  end=$(now)
+  awk -v a="$start" -v b="$end" 'BEGIN { printf "%.3f", b - a }'
+}
+run_rsync() {
+  local start end
+  start=$(now)
+  RSYNC_PASSWORD=$password rsync -a --delete "$sender/volume1/data/" \
+    "rsync://$user@127.0.0.1/plain/"
+  end=$(now)
+  awk -v a="$start" -v b="$end" 'BEGIN { printf "%.3f", b - a }'
+}
+
+rsync_full=$(run_rsync)
+s2s_full=$(run_s2s full)
+rsync_same=$(run_rsync)
+s2s_same=$(run_s2s same)
+if ! diff -rq "$sender/volume1/data" "$receiver/volume1/data" >/dev/null; then
+  echo "bench: the s2s copy differs from the source" >&2
+  exit 1
+fi
+
+report() {  # label s2s rsync json
+  local copy overhead
+  copy=$(field "$4" copy_seconds)
+  overhead=$(awk -v t="$2" -v c="$copy" 'BEGIN { printf "%.3f", t - c }')
+  awk -v l="$1" -v s="$2" -v r="$3" -v c="$copy" -v o="$overhead" 'BEGIN {
+    printf "%-10s s2s %8.3fs  rsync %8.3fs  ratio %5.2f  (s2s copy %.3fs, control commands %.3fs)\n",
+      l, s, r, s / r, c, o }'
+}
+echo "tree: $files files, $megabytes MiB; rsync $(rsync --version | awk 'NR == 1 { print $3 }')"
+report "full" "$s2s_full" "$rsync_full" "$work/full.json"
+report "no change" "$s2s_same" "$rsync_same" "$work/same.json"
+echo "control steps (s): full: $(sed -n '/^  "steps"/,/}/p' "$work/full.json" | tr -d ' \n')"
+echo "                   no change: $(sed -n '/^  "steps"/,/}/p' "$work/same.json" | tr -d ' \n')"
