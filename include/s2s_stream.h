@@ -100,6 +100,14 @@ class S2S_EXPORT PStream {
                std::vector<PObject>* array, std::map<std::string, PObject>* map);
     int Encode(Channel& channel, const PObject* object, const std::vector<PObject>* array,
                const std::map<std::string, PObject>* map);
+    // Channel access for the codec: straight to the rings for a plain Channel when debug lines are
+    // off (nothing could observe a difference), through the virtual operations otherwise.
+    static int ReadByte(Channel& channel, unsigned char& byte);
+    static int ReadInt16(Channel& channel, unsigned short& value);
+    static int ReadBytes(Channel& channel, char* dst, unsigned int len);
+    static int WriteByte(Channel& channel, unsigned char byte);
+    static int WriteBytes(Channel& channel, const char* src, size_t len);
+    static int WriteString(Channel& channel, const char* data, size_t len);
     int SendKey(Channel& channel, const char* key, size_t length);
     int ChannelFailure(int status);
     void ResetStatus();
@@ -107,9 +115,10 @@ class S2S_EXPORT PStream {
     void PopKey();
     const char* Indent() const;
 
-    // The key path is history_[0 .. history_size_): popped entries keep their storage for reuse.
-    std::vector<std::string> history_;
-    size_t history_size_ = 0;
+    // The stack of keys is kept already joined ("k1.k2.k3"); marks_ holds the length the path had
+    // before each push, so a pop is a truncation and neither allocates once the path has grown.
+    std::string history_;
+    std::vector<size_t> marks_;
     std::atomic<unsigned long long> status_b_{0};
     std::atomic<unsigned long long> status_a_{0};
     pthread_mutex_t mutex_;

@@ -1,8 +1,10 @@
 #include "s2s_stream.h"
 
 #include <algorithm>
+#include <climits>
 #include <cstring>
 #include <memory>
+#include <typeinfo>
 
 #include "net/log_debug.h"
 #include "s2s_logger.h"
@@ -53,29 +55,10 @@ const char* WireKey(const std::string& key, size_t& length) {
     return key.data();
 }
 
-// Writes `len` bytes in pieces the channel accepts (one Write carries at most its capacity).
-int WriteBytes(Channel& channel, const char* data, size_t len) {
-    const size_t step = std::max(1u, channel.GetCapacity());
-    for (size_t done = 0; done < len; done += step) {
-        int ret = channel.Write(data + done, static_cast<unsigned int>(std::min(step, len - done)));
-        if (ret < 0) {
-            return ret;
-        }
-    }
-    return 0;
-}
-
-// A string value: tag 0x10, the low 16 bits of the length, then every byte (the format's own
-// limit, which senders respect). Short strings reach the channel in one piece with their header.
-int WriteString(Channel& channel, const char* data, size_t len) {
-    char head[64] = {static_cast<char>(PStream::kTagString), static_cast<char>((len >> 8) & 0xFF),
-                     static_cast<char>(len & 0xFF)};
-    if (len <= sizeof(head) - 3) {
-        std::memcpy(head + 3, data, len);
-        return WriteBytes(channel, head, 3 + len);
-    }
-    int ret = WriteBytes(channel, head, 3);
-    return ret < 0 ? ret : WriteBytes(channel, data, len);
+// True when the codec may go straight to the rings: a plain Channel (no step replaced by a
+// subclass) and no debug line that the long way would log.
+bool Direct(const Channel& channel) {
+    return Logger::log_level < Logger::Debug && typeid(channel) == typeid(Channel);
 }
 
 }  // namespace
@@ -133,7 +116,7 @@ int PStream::RecvObject(Channel& channel, PObject& object) {
 }
 
 int PStream::RecvTag(Channel& channel, unsigned char& tag) {
-    int ret = channel.ReadByte(&tag);
+    int ret = ReadByte(channel, tag);
     return ret < 0 ? ChannelFailure(ret) : kStatusSuccessful;
 }
 
@@ -160,7 +143,7 @@ int PStream::Send(Channel& channel, unsigned long long value) {
 int PStream::Recv(Channel& channel, unsigned long long& value) {
     ResetStatus();
     unsigned char length = 0;
-    int ret = channel.ReadByte(&length);
+    int ret = ReadByte(channel, length);
     if (ret < 0) {
         return ChannelFailure(ret);
     }
@@ -173,7 +156,7 @@ int PStream::Recv(Channel& channel, unsigned long long& value) {
     }
     unsigned char bytes[8];
     if (length > 0) {
-        ret = channel.Read(reinterpret_cast<char*>(bytes), length);
+        ret = ReadBytes(channel, reinterpret_cast<char*>(bytes), length);
         if (ret < 0) {
             return ChannelFailure(ret);
         }
@@ -200,7 +183,7 @@ int PStream::Send(Channel& channel, const std::string& value) {
 int PStream::Recv(Channel& channel, std::string& value) {
     ResetStatus();
     unsigned short length = 0;
-    int ret = channel.ReadInt16(&length);
+    int ret = ReadInt16(channel, length);
     if (ret < 0) {
         return ChannelFailure(ret);
     }
@@ -213,7 +196,7 @@ int PStream::Recv(Channel& channel, std::string& value) {
         buf = large.get();
     }
     if (length > 0) {
-        ret = channel.Read(buf, length);
+        ret = ReadBytes(channel, buf, length);
         if (ret < 0) {
             return ChannelFailure(ret);
         }
@@ -273,14 +256,7 @@ void PStream::GetStatus(std::string& path, unsigned long long& a, unsigned long 
 }
 
 std::string PStream::GetHistory() {
-    std::string path;
-    for (size_t i = 0; i < history_size_; ++i) {
-        if (i > 0) {
-            path += '.';
-        }
-        path += history_[i];
-    }
-    return path;
+    return history_;
 }
 
 void PStream::DumpHistory() {
@@ -293,7 +269,7 @@ void PStream::DumpHistory() {
 void PStream::ClearHistory() {
     pthread_mutex_lock(&mutex_);
     history_.clear();
-    history_size_ = 0;
+    marks_.clear();
     status_a_.store(0, std::memory_order_relaxed);
     status_b_.store(0, std::memory_order_relaxed);
     pthread_mutex_unlock(&mutex_);
@@ -302,6 +278,65 @@ void PStream::ClearHistory() {
 
 void PStream::SetDefaultRecvLocation(const std::string& path) {
     recv_location_ = path;
+}
+
+int PStream::ReadByte(Channel& channel, unsigned char& byte) {
+    if (Direct(channel) && channel.ReadBuffered(reinterpret_cast<char*>(&byte), 1)) {
+        return 0;
+    }
+    return channel.ReadByte(&byte);
+}
+
+int PStream::ReadInt16(Channel& channel, unsigned short& value) {
+    unsigned char b[2];
+    if (Direct(channel) && channel.ReadBuffered(reinterpret_cast<char*>(b), 2)) {
+        value = static_cast<unsigned short>((b[0] << 8) | b[1]);
+        return 0;
+    }
+    return channel.ReadInt16(&value);
+}
+
+int PStream::ReadBytes(Channel& channel, char* dst, unsigned int len) {
+    if (Direct(channel) && channel.ReadBuffered(dst, len)) {
+        return 0;
+    }
+    return channel.Read(dst, len);
+}
+
+int PStream::WriteByte(Channel& channel, unsigned char byte) {
+    if (Direct(channel) && channel.WriteBuffered(reinterpret_cast<const char*>(&byte), 1)) {
+        return 0;
+    }
+    return channel.WriteByte(byte);
+}
+
+// Writes `len` bytes in pieces the channel accepts (one Write carries at most its capacity).
+int PStream::WriteBytes(Channel& channel, const char* src, size_t len) {
+    if (len <= UINT_MAX && Direct(channel) &&
+        channel.WriteBuffered(src, static_cast<unsigned int>(len))) {
+        return 0;
+    }
+    const size_t step = std::max(1u, channel.GetCapacity());
+    for (size_t done = 0; done < len; done += step) {
+        int ret = channel.Write(src + done, static_cast<unsigned int>(std::min(step, len - done)));
+        if (ret < 0) {
+            return ret;
+        }
+    }
+    return 0;
+}
+
+// A string value: tag 0x10, the low 16 bits of the length, then every byte (the format's own
+// limit, which senders respect). Short strings reach the channel in one piece with their header.
+int PStream::WriteString(Channel& channel, const char* data, size_t len) {
+    char head[64] = {static_cast<char>(kTagString), static_cast<char>((len >> 8) & 0xFF),
+                     static_cast<char>(len & 0xFF)};
+    if (len <= sizeof(head) - 3) {
+        std::memcpy(head + 3, data, len);
+        return WriteBytes(channel, head, 3 + len);
+    }
+    int ret = WriteBytes(channel, head, 3);
+    return ret < 0 ? ret : WriteBytes(channel, data, len);
 }
 
 int PStream::ChannelFailure(int status) {
@@ -322,18 +357,19 @@ void PStream::ResetStatus() {
 
 void PStream::PushKey(const char* key, size_t length) {
     pthread_mutex_lock(&mutex_);
-    // Popped entries keep their storage, so a steady stream of maps does not allocate here.
-    if (history_size_ == history_.size()) {
-        history_.emplace_back();
+    marks_.push_back(history_.size());
+    if (marks_.size() > 1) {
+        history_ += '.';
     }
-    history_[history_size_++].assign(key, length);
+    history_.append(key, length);
     pthread_mutex_unlock(&mutex_);
 }
 
 void PStream::PopKey() {
     pthread_mutex_lock(&mutex_);
-    if (history_size_ > 0) {
-        --history_size_;
+    if (!marks_.empty()) {
+        history_.resize(marks_.back());
+        marks_.pop_back();
     }
     pthread_mutex_unlock(&mutex_);
 }
@@ -355,7 +391,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
     };
     std::vector<Walk> stack;
     auto open_array = [&](const std::vector<PObject>& a) {
-        int ret = channel.WriteByte(kTagArray);
+        int ret = WriteByte(channel, kTagArray);
         if (ret < 0) {
             return ChannelFailure(ret);
         }
@@ -365,7 +401,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         return 0;
     };
     auto open_map = [&](const std::map<std::string, PObject>& m) {
-        int ret = channel.WriteByte(kTagMap);
+        int ret = WriteByte(channel, kTagMap);
         if (ret < 0) {
             return ChannelFailure(ret);
         }
@@ -417,7 +453,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             top.array != nullptr ? top.index == top.array->size() : top.next == top.map->end();
         if (at_end) {
             bool is_array = top.array != nullptr;
-            ret = channel.WriteByte(kTagEnd);
+            ret = WriteByte(channel, kTagEnd);
             if (ret < 0) {
                 return ChannelFailure(ret);
             }
@@ -512,7 +548,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                     continue;
                 case kTagNull: {
                     unsigned char length = 0;
-                    ret = channel.ReadByte(&length);
+                    ret = ReadByte(channel, length);
                     if (ret < 0) {
                         ret = ChannelFailure(ret);
                     } else if (length != 0) {

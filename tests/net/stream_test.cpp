@@ -345,6 +345,70 @@ TEST(PStreamTest, StatusIsReadableFromAnotherThreadDuringTransfer) {
     EXPECT_EQ(0u, b);
 }
 
+// A channel whose byte and block operations are replaced: the codec must use them (and the same
+// bytes must result) rather than going to the rings directly.
+class TappedChannel : public Channel {
+  public:
+    using Channel::Channel;
+    int Write(const char* src, unsigned int len) override {
+        written.append(src, len);
+        return Channel::Write(src, len);
+    }
+    int Read(char* dst, unsigned int len, unsigned int& count) override {
+        int ret = Channel::Read(dst, len, count);
+        read.append(dst, count);
+        return ret;
+    }
+    std::string written;
+    std::string read;
+};
+
+TEST(PStreamTest, ReplacedChannelStepsSeeEveryByte) {
+    PObject message;
+    message["list"] = Array({PObject("abc"), PObject(300ULL), PObject()});
+    message["_k"]["x"] = std::string(100, 'y');
+    std::string plain = Encode(message);
+
+    SocketPair pair;
+    std::string received;
+    Peer reader([&] { received = s2s_test::ReadToEnd(pair.b()); });
+    {
+        TappedChannel channel(4096);
+        ASSERT_EQ(0, channel.Open(pair.ReleaseA(), true));
+        PStream stream;
+        ASSERT_EQ(0, stream.Send(channel, message));
+        EXPECT_TRUE(channel.written == plain);
+    }
+    reader.Join();
+    EXPECT_TRUE(received == plain);
+
+    SocketPair in;
+    ASSERT_TRUE(WriteAll(in.b(), plain));
+    TappedChannel channel(4096);
+    ASSERT_EQ(0, channel.Open(in.ReleaseA(), true));
+    PStream stream;
+    PObject back;
+    ASSERT_EQ(0, stream.Recv(channel, back));
+    EXPECT_TRUE(channel.read == plain);
+    EXPECT_EQ("{\"k\": {\"x\": \"" + std::string(100, 'y') + "\"}, \"list\": [\"abc\", 300, null]}",
+              back.toString());
+}
+
+TEST(PStreamTest, DebugLinesFollowTheValues) {
+    LogCapture log(S2S::Logger::Debug);
+    PObject message;
+    message["a"] = Array({PObject(7ULL), PObject("s")});
+    PObject back;
+    ASSERT_EQ(0, Decode(Encode(message), back));
+    std::string text = log.Text();
+    for (const char* line :
+         {"[DEBUG] s2s_stream.cpp(", "): {\n", "):   \"a\"\n", "):   [\n", "):     7\n",
+          "):     \"s\"\n", "):   ]\n", "): }\n", "[DEBUG] s2s_channel.cpp(", "): Write: write ",
+          "): FlushWrite: flush at least 0 bytes\n", "): ReadMore: read at least "}) {
+        EXPECT_NE(std::string::npos, text.find(line)) << line;
+    }
+}
+
 TEST(PStreamTest, ConstantsAndSkip) {
     EXPECT_EQ(0x01, PStream::GetTag<unsigned long long>());
     EXPECT_EQ(0x10, PStream::GetTag<std::string>());
