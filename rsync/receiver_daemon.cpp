@@ -361,8 +361,9 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
       << "\tpost-xfer exec = " << hook << "hook-post\n\n";
     c << "[" << S2S_KEY_MODULE << "]\n"
       << "\tpath = " << keys << "\n"
-      << "\twrite only = yes\n"
-      << "\trefuse options = delete*\n\n";
+      // Every client run carries --delete; on a single key file it removes nothing, so the key
+      // module must not refuse it.
+      << "\twrite only = yes\n\n";
 
     VLIBSzList* rawNames = VLIBCSzListAlloc(16);
     int count = VURNShareEnum(&rawNames);

@@ -173,7 +173,6 @@ class RsyncerKeySyncSsh : public ::testing::Test {
 
         rsyncer_test::ToolResult r = server_->Configure();
         ASSERT_EQ(r.status, 0) << r.output;
-        AllowDeleteOptionInKeyModule();
         r = server_->Start();
         ASSERT_EQ(r.status, 0) << r.output;
         // Client and server share this machine: the server's configuration is where the client
@@ -184,27 +183,6 @@ class RsyncerKeySyncSsh : public ::testing::Test {
                   0);
         const std::string why = sshd_.Start();
         ASSERT_EQ(why, "");
-    }
-
-    // Every client run carries --delete (it is harmless for a single key file), but the
-    // receiver's key module refuses delete options, which fails every key transfer with code 4.
-    // Until the receiver accepts it there, the test lifts that one refusal from the written
-    // configuration.
-    void AllowDeleteOptionInKeyModule() {
-        const std::string conf = s2s_test::ReadFile(server_->ConfigFile());
-        std::istringstream in(conf);
-        std::string kept;
-        std::string section;
-        for (std::string line; std::getline(in, line);) {
-            if (!line.empty() && line[0] == '[') {
-                section = line;
-            }
-            if (section == "[@s2s-key]" && line.find("refuse options") != std::string::npos) {
-                continue;
-            }
-            kept += line + "\n";
-        }
-        s2s_test::WriteFile(server_->ConfigFile(), kept);
     }
 
     // Runs the key sync of each share in a child whose view of root's home is a temporary
