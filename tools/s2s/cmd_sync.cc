@@ -70,6 +70,8 @@ volatile sig_atomic_t g_stop_signal = 0;
 struct CopyWatch {
     TransferMeter meter;
     ProgressBar* bar = nullptr;
+    uint64_t total = 0;
+    int percent = -1;  // rsync's own overall progress, once it reports one
 };
 CopyWatch* g_watch = nullptr;
 
@@ -77,10 +79,21 @@ void OnStopSignal(int signo) {
     g_stop_signal = signo;
 }
 
+void OnProgress(int percent) {
+    if (g_watch != nullptr && percent >= 0 && percent <= 100) {
+        g_watch->percent = percent;
+    }
+}
+
 bool CancelRequested() {
     if (g_watch != nullptr && g_watch->bar != nullptr) {
         g_watch->meter.Poll();
-        g_watch->bar->Update(g_watch->meter.Bytes());
+        // rsync's percentage counts the files it skips as unchanged; the bytes read only what it
+        // sends. The percentage is the better measure of how far the share is, when there is one.
+        const uint64_t done = g_watch->percent >= 0
+                                  ? g_watch->total / 100 * static_cast<uint64_t>(g_watch->percent)
+                                  : g_watch->meter.Bytes();
+        g_watch->bar->Update(done);
     }
     return g_stop_signal != 0;
 }
@@ -237,6 +250,11 @@ int SyncRun::Pair() {
             return Finish(kExitCancelled, "stopped while pairing");
         }
         if (result != 0 && result != S2S::kRsyncResultConflict) {
+            if (result == S2S::kRsyncResultDryRunOK) {
+                // An old server pairs one client as a whole.
+                return Finish(kExitConflict, "the server is paired with another client: " +
+                                                 ResultName(result) + "; nothing was synced");
+            }
             return Finish(ClassifyCommandResult(result),
                           "the server refused the pairing: " + ResultName(result));
         }
@@ -263,6 +281,10 @@ int SyncRun::Pair() {
     if (result != 0) {
         if (g_stop_signal != 0) {
             return Finish(kExitCancelled, "stopped while pairing");
+        }
+        if (result == S2S::kRsyncResultDryRunOK) {
+            return Finish(kExitConflict, "the server is paired with another client: " +
+                                             ResultName(result) + "; nothing was synced");
         }
         for (ShareReport& share : shares_) {
             share.state = "refused";
@@ -313,6 +335,7 @@ void SyncRun::SyncShare(ShareReport& share) {
     ProgressBar bar(out_, terminal, !quiet_ && !opts_.Has("no-progress"));
     CopyWatch watch;
     watch.bar = &bar;
+    watch.total = share.size.bytes;
     bar.Start(share.name, share.size.bytes);
     g_watch = &watch;
     const std::vector<std::string> excludes_vec = opts_.GetAll("exclude");
@@ -401,6 +424,10 @@ int SyncRun::Run(S2S::SyncTask& task) {
 
     StopSignals signals;
     rsyncer_.SetCancelChecker(&CancelRequested);
+    // rsync reports its progress only when asked to; a run without a display does not ask.
+    if (!quiet_ && !opts_.Has("no-progress")) {
+        rsyncer_.SetProgressCallback(&OnProgress);
+    }
     Clock::time_point step = Clock::now();
     const int connected = Connect();
     connect_seconds_ = SecondsSince(step);
