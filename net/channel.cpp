@@ -35,8 +35,10 @@ inline void CopyBytes(char* dst, const char* src, unsigned int len) {
     }
 }
 
+// The flag is a plain int owned by the caller and set from another thread or a signal handler;
+// an atomic load keeps each check a fresh, well-defined read.
 bool AbortRequested(const int* flag) {
-    return flag != nullptr && *flag != 0;
+    return flag != nullptr && __atomic_load_n(flag, __ATOMIC_RELAXED) != 0;
 }
 
 }  // namespace

@@ -307,6 +307,25 @@ TEST(ChannelTest, DomainSocketOpenAndReopenAfterClose) {
     close(listener);
 }
 
+TEST(ChannelTest, ConnectingAnOpenChannelReplacesTheOldConnection) {
+    TcpListener listener;
+    Channel channel(32);
+    ASSERT_EQ(0, channel.Open("127.0.0.1", listener.port()));
+    int first = accept(listener.fd(), nullptr, nullptr);
+    ASSERT_GE(first, 0);
+    ASSERT_EQ(0, channel.Write("old", 3));
+    ASSERT_EQ(0, channel.Open("127.0.0.1", listener.port()));
+    int second = accept(listener.fd(), nullptr, nullptr);
+    ASSERT_GE(second, 0);
+    // The old connection was flushed and closed, not leaked.
+    EXPECT_EQ("old", s2s_test::ReadToEnd(first));
+    ASSERT_EQ(0, channel.Write("new", 3));
+    channel.Close();
+    EXPECT_EQ("new", s2s_test::ReadToEnd(second));
+    close(first);
+    close(second);
+}
+
 TEST(ChannelTest, AdoptingRefusesAnOpenChannelAndBadDescriptors) {
     LogCapture log;
     SocketPair pair;
