@@ -109,6 +109,8 @@ class S2S_EXPORT PStream {
     static int WriteBytes(Channel& channel, const char* src, size_t len);
     static int WriteString(Channel& channel, const char* data, size_t len);
     int SendKey(Channel& channel, const char* key, size_t length);
+    // A string body into `text` (scratch: its content is undefined after a failure).
+    int RecvText(Channel& channel, std::string& text);
     int ChannelFailure(int status);
     void ResetStatus();
     void PushKey(const char* key, size_t length);

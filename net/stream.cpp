@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <climits>
 #include <cstring>
-#include <memory>
 #include <typeinfo>
 
 #include "net/log_debug.h"
@@ -181,29 +180,32 @@ int PStream::Send(Channel& channel, const std::string& value) {
 }
 
 int PStream::Recv(Channel& channel, std::string& value) {
+    // Read aside first, so that a failed read leaves the caller's string as it was.
+    std::string text;
+    int ret = RecvText(channel, text);
+    if (ret >= 0) {
+        value.swap(text);
+    }
+    return ret;
+}
+
+int PStream::RecvText(Channel& channel, std::string& text) {
     ResetStatus();
     unsigned short length = 0;
     int ret = ReadInt16(channel, length);
     if (ret < 0) {
         return ChannelFailure(ret);
     }
-    // Short strings (keys, most values) are read on the stack; a length is at most 65535.
-    char small[256];
-    std::unique_ptr<char[]> large;
-    char* buf = small;
-    if (length > sizeof(small)) {
-        large.reset(new char[length]);
-        buf = large.get();
-    }
+    text.resize(length);
     if (length > 0) {
-        ret = ReadBytes(channel, buf, length);
+        ret = ReadBytes(channel, &text[0], length);
         if (ret < 0) {
             return ChannelFailure(ret);
         }
     }
     // Only the bytes up to the first NUL are kept, as the format always did.
-    value.assign(buf, strnlen(buf, length));
-    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(), value.c_str());
+    text.resize(strnlen(text.data(), length));
+    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(), text.c_str());
     return kStatusSuccessful;
 }
 
@@ -523,7 +525,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             have_tag = false;
             switch (tag) {
                 case kTagString:
-                    ret = Recv(channel, text);
+                    ret = RecvText(channel, text);
                     if (ret >= 0) {
                         target = text;
                     } else if (!target.isString() || target.isNull()) {
@@ -596,7 +598,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 ret = kStatusProtocolError;
                 break;
             } else {
-                ret = Recv(channel, text);
+                ret = RecvText(channel, text);
                 if (ret < 0) {
                     break;
                 }
