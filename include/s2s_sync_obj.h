@@ -158,6 +158,12 @@ class S2S_EXPORT Schedule {
 
     // Seconds since the epoch of the first run strictly after `now`; 0 when there is no next run
     // (manual, or a "once" task whose run is past); -1 on error (logged). Realtime gives now + 1.
+    // Run days: weekly on the chosen weekdays; monthly on begin_day of the current month and on,
+    // a day the month lacks rolling over into the next (the 31st after April is 1 May); yearly on
+    // begin month and day of the current year and on (29 February is 1 March in common years);
+    // once on the begin date. A day's runs keep their wall-clock start time across clock
+    // changes; a start inside the repeated hour runs at its first occurrence only, one inside the
+    // skipped hour just after the jump; repeats follow in plain seconds.
     // REQUIRES: a schedule that passes Validate(). The search walks day by day without a limit,
     // so an invalid one (a negative repeat count, for example) may never find a run.
     long GetNextScheduledSeconds(long now) const;

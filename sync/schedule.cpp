@@ -136,7 +136,8 @@ void LogTimeFields(int line, const char* what, const struct tm& tm) {
 
 int GetDaysToNextSync(unsigned weekday, std::string week_schedule) {
     for (unsigned d = 0; d < kWeekDays; ++d) {
-        size_t position = (weekday + d) % kWeekDays;
+        size_t position =
+            static_cast<size_t>((static_cast<unsigned long long>(weekday) + d) % kWeekDays);
         if (position < week_schedule.size() && week_schedule[position] == '1') {
             return static_cast<int>(d);
         }

@@ -152,6 +152,9 @@ TEST(GetDaysToNextSync, CountsFromTodayAndWrapsTheWeek) {
     EXPECT_EQ(-1, S2S::GetDaysToNextSync(2, "0000000"));
     EXPECT_EQ(-1, S2S::GetDaysToNextSync(2, "xxxxxxx"));  // only "1" counts here
     EXPECT_EQ(-1, S2S::GetDaysToNextSync(0, ""));
+    // Weekday numbers past 6 count modulo 7, without wrapping around 32 bits.
+    EXPECT_EQ(1, S2S::GetDaysToNextSync(9, "0001000"));
+    EXPECT_EQ(1, S2S::GetDaysToNextSync(4294967295u, "0000100"));  // 4294967295 mod 7 = 3
 }
 
 // ---------------------------------------------------------------------------------------------

@@ -3,6 +3,9 @@
 #ifndef S2S_TESTS_SYNC_SYNC_TEST_UTIL_H
 #define S2S_TESTS_SYNC_SYNC_TEST_UTIL_H
 
+#include <gtest/gtest.h>
+#include <unistd.h>
+
 #include <ctime>
 #include <regex>
 #include <string>
@@ -15,7 +18,14 @@ namespace s2s_test {
 // Sets TZ for the object's lifetime and makes the C library re-read it both ways.
 class ScopedTZ {
   public:
-    explicit ScopedTZ(const char* zone) : env_("TZ", zone) { tzset(); }
+    // Without the zone's file the C library silently falls back to UTC: say so instead.
+    explicit ScopedTZ(const char* zone) : env_("TZ", zone) {
+        if (std::string(zone) != "UTC" &&
+            access(("/usr/share/zoneinfo/" + std::string(zone)).c_str(), R_OK) != 0) {
+            ADD_FAILURE() << "time zone " << zone << " is not installed (Debian package tzdata)";
+        }
+        tzset();
+    }
     ScopedTZ(const ScopedTZ&) = delete;
     ScopedTZ& operator=(const ScopedTZ&) = delete;
 
