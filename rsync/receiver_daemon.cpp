@@ -4,12 +4,15 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <netinet/in.h>
+#include <poll.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cctype>
 #include <cerrno>
 #include <chrono>
@@ -18,6 +21,7 @@
 #include <cstring>
 #include <fstream>
 #include <memory>
+#include <set>
 #include <sstream>
 #include <thread>
 #include <vector>
@@ -35,6 +39,7 @@ namespace {
 
 constexpr auto kStartWait = std::chrono::seconds(10);
 constexpr auto kStopWait = std::chrono::seconds(10);
+constexpr auto kKillWait = std::chrono::seconds(5);
 
 struct ListDeleter {
     void operator()(VLIBSzList* l) const { VLIBCSzListFree(l); }
@@ -267,6 +272,137 @@ std::string LogTail() {
     return last;
 }
 
+// What /proc tells of one process: its parent, its process group, and whether it is only a
+// zombie (a finished process whose new parent has not reaped it yet).
+struct ProcEntry {
+    pid_t pid = 0;
+    pid_t ppid = 0;
+    pid_t pgrp = 0;
+    bool zombie = false;
+};
+
+std::vector<ProcEntry> ProcessTable() {
+    std::vector<ProcEntry> table;
+    DIR* d = opendir("/proc");
+    if (d == nullptr) {
+        return table;
+    }
+    while (struct dirent* e = readdir(d)) {
+        char* end = nullptr;
+        long pid = std::strtol(e->d_name, &end, 10);
+        if (end == e->d_name || *end != '\0' || pid <= 0) {
+            continue;
+        }
+        std::ifstream in(std::string("/proc/") + e->d_name + "/stat");
+        std::string stat;
+        if (!std::getline(in, stat)) {
+            continue;  // ended meanwhile
+        }
+        // "pid (comm) state ppid pgrp ...": the name may hold blanks and parentheses.
+        size_t paren = stat.rfind(')');
+        if (paren == std::string::npos) {
+            continue;
+        }
+        std::istringstream fields(stat.substr(paren + 1));
+        char state = 0;
+        long ppid = 0;
+        long pgrp = 0;
+        if (!(fields >> state >> ppid >> pgrp)) {
+            continue;
+        }
+        ProcEntry p;
+        p.pid = static_cast<pid_t>(pid);
+        p.ppid = static_cast<pid_t>(ppid);
+        p.pgrp = static_cast<pid_t>(pgrp);
+        p.zombie = state == 'Z' || state == 'X';
+        table.push_back(p);
+    }
+    closedir(d);
+    return table;
+}
+
+// The live processes that belong to the daemon `pid`: itself, its process group when it leads
+// one (connections whose parent has already gone keep the group), and the descendants of all of
+// these.
+std::vector<pid_t> DaemonProcesses(pid_t pid, bool leads) {
+    std::vector<ProcEntry> table = ProcessTable();
+    std::set<pid_t> found;
+    std::vector<pid_t> todo;
+    for (const ProcEntry& p : table) {
+        if (p.pid == pid || (leads && p.pgrp == pid)) {
+            found.insert(p.pid);
+            todo.push_back(p.pid);
+        }
+    }
+    while (!todo.empty()) {
+        pid_t parent = todo.back();
+        todo.pop_back();
+        for (const ProcEntry& p : table) {
+            if (p.ppid == parent && found.insert(p.pid).second) {
+                todo.push_back(p.pid);
+            }
+        }
+    }
+    std::vector<pid_t> live;
+    for (const ProcEntry& p : table) {
+        if (found.count(p.pid) != 0 && !p.zombie) {
+            live.push_back(p.pid);
+        }
+    }
+    return live;
+}
+
+// Sends `signo` to each process and waits (at most `wait`) until one of them ends. A pidfd turns
+// readable the moment its process ends, so no time is lost to polling.
+void SignalAndAwaitOne(const std::vector<pid_t>& pids, int signo, std::chrono::milliseconds wait) {
+    std::vector<struct pollfd> fds;
+    for (pid_t p : pids) {
+        int fd = static_cast<int>(syscall(SYS_pidfd_open, p, 0));
+        if (fd >= 0) {
+            if (syscall(SYS_pidfd_send_signal, fd, signo, nullptr, 0) != 0) {
+                close(fd);
+                continue;  // ended meanwhile
+            }
+            fds.push_back({fd, POLLIN, 0});
+        } else if (errno != ESRCH) {
+            kill(p, signo);  // a kernel without pidfds
+        }
+    }
+    if (fds.size() == pids.size() && !fds.empty()) {
+        while (poll(fds.data(), fds.size(), static_cast<int>(wait.count())) < 0 && errno == EINTR) {
+        }
+    } else if (!pids.empty()) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    for (const auto& f : fds) {
+        close(f.fd);
+    }
+}
+
+// Ends the daemon and every process it forked for its connections (their hooks included):
+// SIGTERM first, SIGKILL for what is left after kStopWait. True once none of them lives.
+bool EndDaemon(pid_t pid, bool leads) {
+    auto deadline = std::chrono::steady_clock::now() + kStopWait;
+    int signo = SIGTERM;
+    for (;;) {
+        std::vector<pid_t> left = DaemonProcesses(pid, leads);
+        if (left.empty()) {
+            return true;
+        }
+        auto now = std::chrono::steady_clock::now();
+        if (now >= deadline) {
+            if (signo == SIGKILL) {
+                return false;
+            }
+            signo = SIGKILL;
+            deadline = now + kKillWait;
+            continue;
+        }
+        auto remaining = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - now);
+        SignalAndAwaitOne(left, signo, std::min(remaining, std::chrono::milliseconds(200)));
+    }
+}
+
 }  // namespace
 
 namespace receiver_internal {
@@ -360,7 +496,8 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
       << "\tpre-xfer exec = " << hook << "hook-pre\n"
       << "\tpost-xfer exec = " << hook << "hook-post\n\n";
     c << "[" << S2S_KEY_MODULE << "]\n"
-      << "\tpath = " << keys << "\n"
+      << "\tpath = " << keys
+      << "\n"
       // Every client run carries --delete; on a single key file it removes nothing, so the key
       // module must not refuse it.
       << "\twrite only = yes\n\n";
@@ -434,8 +571,8 @@ int ReceiverStart(std::string* error) {
     std::string address;
     ListenSettings(&port, &address);
 
-    // The daemon gets a session of its own (it outlives this program) and stays in the
-    // foreground of it, so that the pid it writes is the one to stop.
+    // The daemon outlives this program in a session of its own and stays in the foreground of
+    // it (--no-detach), so that the pid it writes is the one to stop.
     std::string configArg = "--config=" + conf;
     std::vector<char*> argv = {const_cast<char*>(rsync.c_str()), const_cast<char*>("--daemon"),
                                const_cast<char*>("--no-detach"), &configArg[0], nullptr};
@@ -452,14 +589,16 @@ int ReceiverStart(std::string* error) {
         return Fail(error, std::string("fork: ") + strerror(errno));
     }
     if (first == 0) {
-        if (setsid() < 0) {
-            _exit(1);
-        }
         pid_t daemon = fork();
         if (daemon != 0) {
             ssize_t ignored = write(report[1], &daemon, sizeof daemon);
             (void)ignored;
             _exit(daemon < 0 ? 1 : 0);
+        }
+        // The daemon leads a session and process group of its own: every connection process
+        // and hook it forks stays in that group, which is how a stop finds and ends them all.
+        if (setsid() < 0) {
+            _exit(1);
         }
         int devnull = open("/dev/null", O_RDWR);
         if (devnull >= 0) {
@@ -511,22 +650,10 @@ int ReceiverStart(std::string* error) {
 int ReceiverStop(std::string* error) {
     pid_t pid = PidFromFile();
     if (pid > 0 && ProcessAlive(pid)) {
-        // The daemon leads its own process group: its connections end with it.
-        pid_t group = getpgid(pid) == pid ? -pid : pid;
-        kill(group, SIGTERM);
-        auto deadline = std::chrono::steady_clock::now() + kStopWait;
-        while (ProcessAlive(pid) && std::chrono::steady_clock::now() < deadline) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(20));
-        }
-        if (ProcessAlive(pid)) {
-            kill(group, SIGKILL);
-            std::this_thread::sleep_for(std::chrono::milliseconds(100));
-        }
-        if (ProcessAlive(pid)) {
-            return Fail(error, "the daemon would not stop");
-        }
-        if (group < 0) {
-            kill(group, SIGKILL);  // connections that ignored SIGTERM
+        // A daemon started before it led its own group is found through its descendants only.
+        const bool leads = getpgid(pid) == pid;
+        if (!EndDaemon(pid, leads)) {
+            return Fail(error, "the daemon or its connections would not stop");
         }
     }
     unlink(S2SPath(S2S_PATH_RSYNCD_PID));

@@ -9,6 +9,7 @@
 #include <netinet/in.h>
 
 #include <list>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -79,6 +80,23 @@ std::string ShareState(const std::string& name) {
         }
     }
     return "free";
+}
+
+// Alive and not merely a zombie waiting for its new parent to reap it.
+bool Alive(pid_t pid) {
+    std::string stat = s2s_test::ReadFile("/proc/" + std::to_string(pid) + "/stat");
+    size_t paren = stat.rfind(')');
+    return paren != std::string::npos && paren + 2 < stat.size() && stat[paren + 2] != 'Z';
+}
+
+std::vector<pid_t> Children(pid_t pid) {
+    std::vector<pid_t> out;
+    std::istringstream in(s2s_test::ReadFile("/proc/" + std::to_string(pid) + "/task/" +
+                                             std::to_string(pid) + "/children"));
+    for (long child = 0; in >> child;) {
+        out.push_back(static_cast<pid_t>(child));
+    }
+    return out;
 }
 
 class Handlers : public ::testing::Test {
@@ -359,6 +377,55 @@ TEST(ReceiverTool, StartStatusStop) {
     status = server.Tool({"status"});
     EXPECT_EQ(status.output.compare(0, 17, "service: stopped\n"), 0) << status.output;
     EXPECT_EQ(server.Tool({"stop"}).status, 0) << "stopping a stopped daemon is fine";
+}
+
+// A stop ends the connections the daemon forked, not only the daemon: a transfer must not go on
+// writing into a share of a stopped service.
+TEST(ReceiverTool, StopEndsTheDaemonsConnections) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "the daemon needs root";
+    }
+    Server server;
+    server.AddShare("photos");
+    ASSERT_EQ(server.Start(), "");
+    const pid_t daemon = std::stoi(s2s_test::ReadFile(server.Root() + "/var/run/rsyncd.pid"));
+
+    // Two connections that have been greeted (so the daemon has forked a process for each) and
+    // then stay silent, as a client in the middle of a long transfer would.
+    std::vector<int> conns;
+    for (int i = 0; i < 2; ++i) {
+        int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        ASSERT_GE(fd, 0);
+        conns.push_back(fd);
+        sockaddr_in addr{};
+        addr.sin_family = AF_INET;
+        addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        addr.sin_port = htons(static_cast<uint16_t>(server.Port()));
+        ASSERT_EQ(connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+        char greeting[64];
+        ASSERT_GT(read(fd, greeting, sizeof greeting), 0);
+        EXPECT_EQ(std::string(greeting, 8), "@RSYNCD:");
+        timeval limit{10, 0};
+        setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
+    }
+    std::vector<pid_t> children;
+    ASSERT_TRUE(s2s_test::WaitFor([&] {
+        children = Children(daemon);
+        return children.size() == 2;
+    }));
+
+    ASSERT_EQ(server.Tool({"stop"}).status, 0);
+    EXPECT_FALSE(Alive(daemon));
+    for (pid_t child : children) {
+        EXPECT_FALSE(Alive(child)) << "connection process " << child << " outlived the stop";
+    }
+    for (int fd : conns) {
+        char byte;
+        EXPECT_EQ(read(fd, &byte, 1), 0) << "the connection was closed";
+        close(fd);
+    }
+    EXPECT_NE(access((server.Root() + "/var/run/rsyncd.pid").c_str(), F_OK), 0);
+    EXPECT_EQ(server.Tool({"stop"}).status, 0);
 }
 
 TEST(ReceiverTool, StartFailsWhenThePortIsTaken) {
