@@ -23,6 +23,7 @@ constexpr const char* kDefaultLogFile = "/var/log/s2s_rsync.log";
 constexpr const char* kDefaultRemoteConfig = "/usr/vurn/etc/s2s_rsyncd.conf";
 constexpr const char* kKeyModule = "@s2s-key";
 constexpr size_t kKeptErrorLines = 8;
+constexpr int kRsyncVanished = 24;  // rsync: some source files vanished during the run
 
 bool HasControl(const std::string& s) {
     for (unsigned char c : s) {
@@ -258,6 +259,7 @@ int RsyncWrapper::Impl::Run(ChildSpec& spec, const boost::function<bool()>& canc
                             bool commandRun) {
     std::list<std::string> errors;
     bool unknownCommandModule = false;
+    int lastPercent = -1;
     const std::string unknownModule = "Unknown module '" + commandModule + "'";
     auto sink = [&](const std::string& raw) {
         std::string line = raw;
@@ -269,6 +271,7 @@ int RsyncWrapper::Impl::Run(ChildSpec& spec, const boost::function<bool()>& canc
         }
         int percent = ProgressPercent(line);
         if (percent >= 0) {
+            lastPercent = percent;
             if (progress) {
                 progress(percent);
             }
@@ -315,6 +318,13 @@ int RsyncWrapper::Impl::Run(ChildSpec& spec, const boost::function<bool()>& canc
         if (unknownCommandModule) {
             return kResultNoCommands;
         }
+    }
+    // rsync's overall figure is the share of the tree's bytes it moved: a run that sends little
+    // (or rounds its last report down) ends below 100, yet it went through the whole tree. Files
+    // that vanished on the way (24) are no longer part of it.
+    const bool complete = outcome.exit_code == 0 || outcome.exit_code == kRsyncVanished;
+    if (complete && progress && !commandRun && lastPercent != 100) {
+        progress(100);
     }
     return outcome.exit_code;
 }

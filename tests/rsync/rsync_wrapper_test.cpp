@@ -215,6 +215,41 @@ TEST_F(WrapperTest, DataRunsKeepMetadataAndFollowChanges) {
     EXPECT_EQ(got, expected);
 }
 
+// rsync's own overall figure counts the bytes it moved, so a run that sends little of a large
+// tree ends far below 100; a complete run must still end at 100, a failed one never.
+TEST_F(WrapperTest, ProgressEndsAtHundredOnlyWhenTheRunSucceeds) {
+    const std::string src = local_.path() + "/share";
+    MakeDirs(src + "/sub");
+    WriteRandom(src + "/large.bin", 8 << 20, 3);
+    for (int i = 0; i < 20; ++i) {
+        s2s_test::WriteFile(src + "/sub/f" + std::to_string(i), std::string(1000 + i, 'x'));
+    }
+    auto run = [&](const std::string& module, std::vector<int>* seen) {
+        RsyncWrapper w;
+        w.setDelete(true);
+        w.setSrcPath(src + "/");
+        server_->Aim(w, module);
+        w.setProgressCallback([seen](int percent) { seen->push_back(percent); });
+        return w.execute(boost::function<bool()>());
+    };
+    std::vector<int> full;
+    ASSERT_EQ(run("photos", &full), 0);
+    ASSERT_FALSE(full.empty());
+    EXPECT_EQ(full.back(), 100);
+
+    // Only a small file changed: rsync's figure stays near 0, the run is still complete.
+    s2s_test::WriteFile(src + "/sub/f3", "changed");
+    std::vector<int> small;
+    ASSERT_EQ(run("photos", &small), 0);
+    ASSERT_FALSE(small.empty());
+    EXPECT_EQ(small.back(), 100);
+    EXPECT_EQ(std::count(small.begin(), small.end(), 100), 1) << "100 is reported once";
+
+    std::vector<int> failed;
+    EXPECT_EQ(run("nosuchmodule", &failed), 5);
+    EXPECT_EQ(std::count(failed.begin(), failed.end(), 100), 0);
+}
+
 TEST_F(WrapperTest, RelativeRunRecreatesThePathInsideTheModule) {
     const std::string src = local_.path() + "/share";
     MakeDirs(src + "/a/b");
