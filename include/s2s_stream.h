@@ -10,7 +10,9 @@
 //
 // Besides the codec a stream keeps diagnostics: the key path it is inside (logged on a failure),
 // the nesting depth (indentation of debug lines) and two status counters. Another thread may read
-// them (GetStatus) while one thread transfers a message.
+// them (GetStatus) while one thread transfers a message. At debug level every value written or
+// read is logged, except a string under a key that names a password ("pswd", or any key
+// containing "passw" in any letter case): that one is logged as "********".
 #ifndef S2S_STREAM_H
 #define S2S_STREAM_H
 
@@ -109,13 +111,18 @@ class S2S_EXPORT PStream {
     static int WriteBytes(Channel& channel, const char* src, size_t len);
     static int WriteString(Channel& channel, const char* data, size_t len);
     int SendKey(Channel& channel, const char* key, size_t length);
-    // A string body into `text` (scratch: its content is undefined after a failure).
-    int RecvText(Channel& channel, std::string& text);
+    // A string body into `text` (scratch: its content is undefined after a failure). A map key
+    // (`is_key`) is logged as it is; a value may be masked (LoggedValue).
+    int RecvText(Channel& channel, std::string& text, bool is_key);
     int ChannelFailure(int status);
     void ResetStatus();
     void PushKey(const char* key, size_t length);
     void PopKey();
     const char* Indent() const;
+    // What a debug line shows for a string value: the value itself, or a mask when the innermost
+    // key of the history names a password. Called by the transferring thread, which alone changes
+    // the history, so it needs no lock.
+    const char* LoggedValue(const char* value) const;
 
     // The stack of keys is kept already joined ("k1.k2.k3"); marks_ holds the length the path had
     // before each push, so a pop is a truncation and neither allocates once the path has grown.

@@ -1,6 +1,7 @@
 #include "s2s_stream.h"
 
 #include <algorithm>
+#include <cctype>
 #include <climits>
 #include <cstring>
 #include <typeinfo>
@@ -53,6 +54,27 @@ const char* WireKey(const std::string& key, size_t& length) {
     length = key.size();
     return key.data();
 }
+
+// Task maps carry a password in plain text under "pswd"; other callers name theirs "password"
+// and the like. Values under such keys are never written to the log.
+bool IsSecretKey(const char* key, size_t length) {
+    auto contains = [&](const char* word) {
+        size_t n = std::strlen(word);
+        for (size_t i = 0; i + n <= length; ++i) {
+            size_t j = 0;
+            while (j < n && std::tolower(static_cast<unsigned char>(key[i + j])) == word[j]) {
+                ++j;
+            }
+            if (j == n) {
+                return true;
+            }
+        }
+        return false;
+    };
+    return contains("pswd") || contains("passw");
+}
+
+constexpr char kMasked[] = "********";
 
 // True when the codec may go straight to the rings: a plain Channel (no step replaced by a
 // subclass) and no debug line that the long way would log.
@@ -175,21 +197,22 @@ int PStream::Send(Channel& channel, const std::string& value) {
     if (ret < 0) {
         return ChannelFailure(ret);
     }
-    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(), value.c_str());
+    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(),
+                  LoggedValue(value.c_str()));
     return kStatusSuccessful;
 }
 
 int PStream::Recv(Channel& channel, std::string& value) {
     // Read aside first, so that a failed read leaves the caller's string as it was.
     std::string text;
-    int ret = RecvText(channel, text);
+    int ret = RecvText(channel, text, false);
     if (ret >= 0) {
         value.swap(text);
     }
     return ret;
 }
 
-int PStream::RecvText(Channel& channel, std::string& text) {
+int PStream::RecvText(Channel& channel, std::string& text, bool is_key) {
     ResetStatus();
     unsigned short length = 0;
     int ret = ReadInt16(channel, length);
@@ -205,7 +228,8 @@ int PStream::RecvText(Channel& channel, std::string& text) {
     }
     // Only the bytes up to the first NUL are kept, as the format always did.
     text.resize(strnlen(text.data(), length));
-    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(), text.c_str());
+    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(),
+                  is_key ? text.c_str() : LoggedValue(text.c_str()));
     return kStatusSuccessful;
 }
 
@@ -376,6 +400,18 @@ void PStream::PopKey() {
     pthread_mutex_unlock(&mutex_);
 }
 
+const char* PStream::LoggedValue(const char* value) const {
+    if (marks_.empty()) {
+        return value;
+    }
+    // The innermost key starts after its mark and, below the top level, after the joining dot.
+    size_t start = marks_.back() + (marks_.size() > 1 ? 1 : 0);
+    if (start > history_.size()) {
+        return value;
+    }
+    return IsSecretKey(history_.data() + start, history_.size() - start) ? kMasked : value;
+}
+
 const char* PStream::Indent() const {
     return kIndent[std::min(std::max(depth_, 0), kMaxIndent)];
 }
@@ -525,7 +561,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             have_tag = false;
             switch (tag) {
                 case kTagString:
-                    ret = RecvText(channel, text);
+                    ret = RecvText(channel, text, false);
                     if (ret >= 0) {
                         target = text;
                     } else if (!target.isString() || target.isNull()) {
@@ -598,7 +634,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 ret = kStatusProtocolError;
                 break;
             } else {
-                ret = RecvText(channel, text);
+                ret = RecvText(channel, text, true);
                 if (ret < 0) {
                     break;
                 }

@@ -409,6 +409,63 @@ TEST(PStreamTest, DebugLinesFollowTheValues) {
     }
 }
 
+// A task map's password travels under "pswd"; other maps use names such as "Password". The
+// debug lines of both ends show the keys and a mask, never the password itself.
+TEST(PStreamTest, DebugLinesNeverShowPasswords) {
+    LogCapture log(S2S::Logger::Debug);
+    const std::string task_secret = "Tr1cky-task-secret";
+    const std::string other_secret = "0ther-secret-value";
+    const std::string listed_secret = "listed-secret-value";
+    PObject message;
+    message["user"] = "admin-user";
+    message["pswd"] = task_secret;
+    message["_Admin_PassWord"] = other_secret;
+    message["old_passwords"] = Array({PObject(listed_secret)});
+    message["nested"]["pswd_hint"] = "visible-in-no-log";
+    message["nested"]["note"] = "plain-note";
+
+    SocketPair pair;
+    PObject back;
+    Peer receiver([&] {
+        Channel channel(4096);
+        EXPECT_EQ(0, channel.Open(pair.ReleaseB(), true));
+        PStream stream;
+        EXPECT_EQ(0, stream.Recv(channel, back));
+    });
+    {
+        Channel channel(4096);
+        ASSERT_EQ(0, channel.Open(pair.ReleaseA(), true));
+        PStream stream;
+        ASSERT_EQ(0, stream.Send(channel, message));
+    }
+    receiver.Join();
+
+    // The values themselves travel unchanged.
+    EXPECT_EQ(task_secret, back["pswd"].asString());
+    EXPECT_EQ(other_secret, back["Admin_PassWord"].asString());
+    ASSERT_EQ(1u, back["old_passwords"].asArray().size());
+    EXPECT_EQ(listed_secret, back["old_passwords"].asArray()[0].asString());
+    EXPECT_EQ("visible-in-no-log", back["nested"]["pswd_hint"].asString());
+
+    std::string text = log.Text();
+    for (const std::string& secret :
+         {task_secret, other_secret, listed_secret, std::string("visible-in-no-log")}) {
+        EXPECT_EQ(std::string::npos, text.find(secret)) << secret;
+    }
+    // Sent and received: each of the four masked values appears twice.
+    size_t masked = 0;
+    for (size_t at = text.find("\"********\"\n"); at != std::string::npos;
+         at = text.find("\"********\"\n", at + 1)) {
+        ++masked;
+    }
+    EXPECT_EQ(8u, masked);
+    for (const char* line :
+         {"):   \"pswd\"\n", "):   \"Admin_PassWord\"\n", "):   \"admin-user\"\n",
+          "):     \"pswd_hint\"\n", "):     \"plain-note\"\n"}) {
+        EXPECT_NE(std::string::npos, text.find(line)) << line;
+    }
+}
+
 TEST(PStreamTest, ConstantsAndSkip) {
     EXPECT_EQ(0x01, PStream::GetTag<unsigned long long>());
     EXPECT_EQ(0x10, PStream::GetTag<std::string>());
