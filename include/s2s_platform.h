@@ -45,7 +45,7 @@ extern "C" {
  * environment variable S2S_ROOT is set and not empty (one trailing slash of it ignored), else
  * fixedPath itself. A relative or null fixedPath is returned unchanged. The result stays valid
  * for the life of the process (it is interned; do not free it), also after S2S_ROOT changes.
- * Thread-safe. */
+ * Null only when out of memory (never the unredirected path then). Thread-safe. */
 S2S_EXPORT const char* S2SPath(const char* fixedPath);
 
 /* ---------------------------------------------------------------------------------------------

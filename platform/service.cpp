@@ -146,8 +146,14 @@ int Systemctl(const char* verb, const char* name, bool quiet) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
+// A fixed path, or "" in the out-of-memory case where S2SPath has none to give.
+std::string Fixed(const char* path) {
+    const char* resolved = S2SPath(path);
+    return resolved == nullptr ? std::string() : resolved;
+}
+
 std::string RunDir() {
-    return S2SPath(S2S_PATH_RUN_DIR);
+    return Fixed(S2S_PATH_RUN_DIR);
 }
 
 std::string PidFilePath(const char* name) {
@@ -410,7 +416,11 @@ int VLIBServiceStart(const char* name, int flags) {
     if (ServiceAlive(name, nullptr)) {
         return Fail(VLIB_ERR_SERVICE_ALREADY);
     }
-    std::string exe = std::string(S2SPath(S2S_PATH_SERVICE_DIR)) + "/" + name;
+    std::string service_dir = Fixed(S2S_PATH_SERVICE_DIR);
+    if (service_dir.empty()) {
+        return Fail(VLIB_ERR_OUT_OF_MEMORY);
+    }
+    std::string exe = service_dir + "/" + name;
     if (access(exe.c_str(), X_OK) != 0) {
         Logger::LogMsg(Logger::Error,
                        "[ERROR] service.cpp(%d): No executable for service '%s' at '%s'\n",

@@ -2,13 +2,16 @@
 // format cannot carry, failed and interrupted writes, and concurrent writers in real processes.
 #include <dirent.h>
 #include <errno.h>
+#include <poll.h>
 #include <signal.h>
+#include <sys/inotify.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
+#include <cstring>
 #include <random>
 #include <string>
 #include <vector>
@@ -389,6 +392,31 @@ TEST(SectionFile, ConcurrentWritersInSeparateProcessesLoseNoUpdate) {
     EXPECT_EQ(Leftovers(dir), 0);
 }
 
+void DrainEvents(int watch) {
+    char buf[4096];
+    while (read(watch, buf, sizeof(buf)) > 0) {
+    }
+}
+
+// Waits (up to 10 s) for the creation of a writer's temporary file in the watched directory.
+bool WaitForTemporary(int watch) {
+    for (;;) {
+        struct pollfd pfd = {watch, POLLIN, 0};
+        if (poll(&pfd, 1, 10000) != 1) {
+            return false;
+        }
+        alignas(struct inotify_event) char buf[4096];
+        ssize_t n = read(watch, buf, sizeof(buf));
+        for (ssize_t at = 0; at < n;) {
+            const auto* event = reinterpret_cast<const struct inotify_event*>(buf + at);
+            if (event->len > 0 && std::strstr(event->name, ".s2stmp-") != nullptr) {
+                return true;
+            }
+            at += static_cast<ssize_t>(sizeof(struct inotify_event) + event->len);
+        }
+    }
+}
+
 // A writer process is killed at random moments in the middle of rewriting a large file. After
 // every kill the file must parse, and each section must be one whole generation: every key of a
 // section carries the same generation number, which a torn or half-merged write would break.
@@ -402,6 +430,9 @@ TEST(SectionFile, WriterKilledMidUpdateNeverLeavesATornFile) {
     const std::string padding(300, 'p');
     int last_seen_generation = -1;
     int killed_mid_replacement = 0;
+    int watch = inotify_init1(IN_CLOEXEC | IN_NONBLOCK);
+    ASSERT_GE(watch, 0);
+    ASSERT_GE(inotify_add_watch(watch, dir.path().c_str(), IN_CREATE), 0);
     for (int round = 0; round < kRounds; ++round) {
         int progress[2];
         ASSERT_EQ(pipe(progress), 0);
@@ -429,7 +460,9 @@ TEST(SectionFile, WriterKilledMidUpdateNeverLeavesATornFile) {
             }
         }
         close(progress[1]);
-        // Let it complete a few writes, then kill it at a random point inside a later one.
+        // Let it complete a few writes, then kill it: in even rounds shortly after it created
+        // the temporary file of a replacement (so inside one for sure), in odd rounds at a
+        // random moment of its cycle.
         int wanted = 1 + static_cast<int>(rng() % 4);
         for (int got = 0; got < wanted;) {
             char tick;
@@ -437,7 +470,13 @@ TEST(SectionFile, WriterKilledMidUpdateNeverLeavesATornFile) {
             ASSERT_EQ(n, 1) << "writer died on its own in round " << round;
             ++got;
         }
-        usleep(rng() % 1500);
+        if (round % 2 == 0) {
+            DrainEvents(watch);
+            ASSERT_TRUE(WaitForTemporary(watch)) << "round " << round;
+            usleep(rng() % 300);
+        } else {
+            usleep(rng() % 1500);
+        }
         kill(pid, SIGKILL);
         int status = 0;
         ASSERT_EQ(waitpid(pid, &status, 0), pid);
@@ -462,8 +501,9 @@ TEST(SectionFile, WriterKilledMidUpdateNeverLeavesATornFile) {
         }
     }
     EXPECT_GE(last_seen_generation, (kRounds - 1) * 100000);
+    close(watch);
     // The kills must really have landed inside replacements (a temporary file was in flight).
-    EXPECT_GT(killed_mid_replacement, kRounds / 6) << killed_mid_replacement;
+    EXPECT_GE(killed_mid_replacement, kRounds / 4) << killed_mid_replacement;
     // The next writer clears what killed writers left behind.
     Table values({{"k", "v"}});
     ASSERT_EQ(VLIBCFileSetSection(file.c_str(), "final", nullptr, values.get(), nullptr), 1);
