@@ -154,13 +154,26 @@ class S2S_EXPORT Channel {
     // Read and Write. False when the bytes are not buffered (or the room is not free) in one
     // piece, or the channel is closed; the codec then goes the long way.
     bool ReadBuffered(char* dst, unsigned int len) {
-        if (handle_ == nullptr || len > r_size_ || len > capacity_ - r_head_) {
+        const char* at = BufferedRun(len);
+        if (at == nullptr) {
             return false;
         }
-        std::memcpy(dst, r_buf_.get() + r_head_, len);
+        std::memcpy(dst, at, len);
+        Consume(len);
+        return true;
+    }
+    // The next `len` unconsumed bytes when they lie in one piece of the ring, else null. The
+    // codec reads them in place and then consumes them.
+    const char* BufferedRun(unsigned int len) const {
+        if (handle_ == nullptr || len > r_size_ || len > capacity_ - r_head_) {
+            return nullptr;
+        }
+        return r_buf_.get() + r_head_;
+    }
+    // REQUIRES: BufferedRun(len) was not null.
+    void Consume(unsigned int len) {
         r_size_ -= len;
         r_head_ = r_size_ == 0 ? 0 : r_head_ + len;
-        return true;
     }
     bool WriteBuffered(const char* src, unsigned int len) {
         if (handle_ == nullptr) {

@@ -117,6 +117,8 @@ class S2S_EXPORT PStream {
     int ChannelFailure(int status);
     void ResetStatus();
     void PushKey(const char* key, size_t length);
+    // Pop and push in one locked step: the entry's key gives way to the next key of its map.
+    void ReplaceKey(const char* key, size_t length);
     void PopKey();
     const char* Indent() const;
     // What a debug line shows for a string value: the value itself, or a mask when the innermost

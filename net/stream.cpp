@@ -87,10 +87,13 @@ bool Direct(const Channel& channel) {
 // One open container of the decoder. The decoder keeps these on the heap so that nesting depth
 // never reaches the call stack. `pending` is set while the container's current entry is being
 // read: for an array that entry is its last element, which is dropped again if it fails.
+// `key_done` is set when a map entry has been read whole but its key is still on the history: the
+// pop is owed, and the next key takes its place under one lock (ReplaceKey).
 struct PStream::Frame {
     std::vector<PObject>* array;
     std::map<std::string, PObject>* map;
     bool pending;
+    bool key_done;
 };
 
 PStream::PStream() {
@@ -163,6 +166,22 @@ int PStream::Send(Channel& channel, unsigned long long value) {
 
 int PStream::Recv(Channel& channel, unsigned long long& value) {
     ResetStatus();
+    if (Direct(channel)) {
+        // Length byte and value bytes are usually buffered together: one look at the ring.
+        const char* at = channel.BufferedRun(1);
+        if (at != nullptr) {
+            unsigned int length = static_cast<unsigned char>(at[0]);
+            if (length <= 8 && channel.BufferedRun(1 + length) != nullptr) {
+                unsigned long long result = 0;
+                for (unsigned int i = 1; i <= length; ++i) {
+                    result = (result << 8) + static_cast<unsigned char>(at[i]);
+                }
+                channel.Consume(1 + length);
+                value = result;
+                return kStatusSuccessful;  // no debug line is due on this path
+            }
+        }
+    }
     unsigned char length = 0;
     int ret = ReadByte(channel, length);
     if (ret < 0) {
@@ -219,15 +238,22 @@ int PStream::RecvText(Channel& channel, std::string& text, bool is_key) {
     if (ret < 0) {
         return ChannelFailure(ret);
     }
-    text.resize(length);
-    if (length > 0) {
-        ret = ReadBytes(channel, &text[0], length);
-        if (ret < 0) {
-            return ChannelFailure(ret);
-        }
-    }
     // Only the bytes up to the first NUL are kept, as the format always did.
-    text.resize(strnlen(text.data(), length));
+    const char* at = Direct(channel) ? channel.BufferedRun(length) : nullptr;
+    if (at != nullptr) {
+        // Buffered in one piece: one copy, straight from the ring.
+        text.assign(at, strnlen(at, length));
+        channel.Consume(length);
+    } else {
+        text.resize(length);
+        if (length > 0) {
+            ret = ReadBytes(channel, &text[0], length);
+            if (ret < 0) {
+                return ChannelFailure(ret);
+            }
+        }
+        text.resize(strnlen(text.data(), length));
+    }
     S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(),
                   is_key ? text.c_str() : LoggedValue(text.c_str()));
     return kStatusSuccessful;
@@ -391,6 +417,18 @@ void PStream::PushKey(const char* key, size_t length) {
     pthread_mutex_unlock(&mutex_);
 }
 
+void PStream::ReplaceKey(const char* key, size_t length) {
+    pthread_mutex_lock(&mutex_);
+    if (!marks_.empty()) {
+        history_.resize(marks_.back());
+        if (marks_.size() > 1) {
+            history_ += '.';
+        }
+        history_.append(key, length);
+    }
+    pthread_mutex_unlock(&mutex_);
+}
+
 void PStream::PopKey() {
     pthread_mutex_lock(&mutex_);
     if (!marks_.empty()) {
@@ -483,12 +521,14 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             return kStatusSuccessful;
         }
         Walk& top = stack.back();
-        if (top.key_pushed) {  // the previous value went out whole
+        bool at_end =
+            top.array != nullptr ? top.index == top.array->size() : top.next == top.map->end();
+        // The previous value went out whole: its key leaves the history, at once before the end
+        // tag, or replaced by the next key (one lock for both) once that key is written.
+        if (at_end && top.key_pushed) {
             PopKey();
             top.key_pushed = false;
         }
-        bool at_end =
-            top.array != nullptr ? top.index == top.array->size() : top.next == top.map->end();
         if (at_end) {
             bool is_array = top.array != nullptr;
             ret = WriteByte(channel, kTagEnd);
@@ -509,10 +549,18 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         const char* key = WireKey(top.next->first, length);
         ret = SendKey(channel, key, length);
         if (ret < 0) {
+            if (top.key_pushed) {
+                PopKey();
+                top.key_pushed = false;
+            }
             break;
         }
-        PushKey(key, length);
-        top.key_pushed = true;
+        if (top.key_pushed) {
+            ReplaceKey(key, length);
+        } else {
+            PushKey(key, length);
+            top.key_pushed = true;
+        }
         value = &top.next->second;
         ++top.next;
     }
@@ -539,7 +587,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
                       a != nullptr ? "[" : "{");
         ++depth_;
-        stack.push_back(Frame{a, m, false});
+        stack.push_back(Frame{a, m, false, false});
     };
     if (array != nullptr || map != nullptr) {
         open(array, map);
@@ -615,6 +663,10 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 break;
             }
             if (tag == kTagEnd) {
+                if (top.key_done) {
+                    PopKey();
+                    top.key_done = false;
+                }
                 bool is_array = top.array != nullptr;
                 --depth_;
                 S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
@@ -638,7 +690,12 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 if (ret < 0) {
                     break;
                 }
-                PushKey(text.data(), text.size());
+                if (top.key_done) {
+                    ReplaceKey(text.data(), text.size());
+                    top.key_done = false;
+                } else {
+                    PushKey(text.data(), text.size());
+                }
                 top.pending = true;
                 // Keys arrive in order from a conforming writer: the end is the likely place.
                 slot = &top.map->try_emplace(top.map->end(), text)->second;
@@ -650,9 +707,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             }
             Frame& top = stack.back();
             if (top.pending) {
-                if (top.map != nullptr) {
-                    PopKey();
-                }
+                top.key_done = top.map != nullptr;  // the pop is owed (see Frame)
                 top.pending = false;
             }
         }
@@ -662,6 +717,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     for (auto it = stack.rbegin(); it != stack.rend(); ++it) {
         if (it->array != nullptr && it->pending) {
             it->array->pop_back();
+        }
+        if (it->key_done) {  // a finished entry's key is not part of the failing path
+            PopKey();
         }
     }
     return ret;

@@ -231,6 +231,42 @@ TEST(PStreamTest, TruncatedStalledAndClosedPeersEndWithAStatus) {
     EXPECT_TRUE(log.Contains("): Channel: -9\n"));
 }
 
+// A map entry read or written whole leaves the key path; a failure right after it names only the
+// enclosing keys (or the failing entry's own key).
+TEST(PStreamTest, KeyPathAfterFinishedEntries) {
+    struct Case {
+        std::string bytes;  // the peer closes after them
+        const char* stack;
+    };
+    const std::string a_x =
+        Bytes({0x42, 0x10, 0x00, 0x01, 'a', 0x42, 0x10, 0x00, 0x01, 'x', 0x01, 0x01, 0x01});
+    for (const Case& c : {
+             Case{a_x + Bytes({0x01}), "a"},                               // integer tag as a key
+             Case{a_x + Bytes({0x10, 0x00, 0x01, 'y', 0x07}), "a.y"},      // bad value of y
+             Case{a_x + Bytes({0x10, 0x00}), "a"},                         // closed inside a key
+             Case{a_x + Bytes({0x40}), ""},                                // closed after a
+             Case{a_x + Bytes({0x40, 0x10, 0x00, 0x01, 'b', 0x42}), "b"},  // closed inside b
+         }) {
+        LogCapture log(S2S::Logger::Error);
+        PObject back;
+        EXPECT_GT(0, Decode(c.bytes, back));
+        EXPECT_TRUE(log.Contains(std::string("): Error stack: ") + c.stack + "\n")) << c.stack;
+    }
+
+    LogCapture log(S2S::Logger::Warning);
+    PObject message;
+    message["a"] = 1ULL;
+    message["a_key_longer_than_the_ring"] = 2ULL;
+    SocketPair pair;
+    pair.CloseB();
+    Channel channel(16);  // the second key forces a send, which fails
+    ASSERT_EQ(0, channel.Open(pair.ReleaseA(), true));
+    PStream stream;
+    EXPECT_EQ(S2S::kStatusIOError, stream.Send(channel, message));
+    EXPECT_TRUE(log.Contains("): Error stack: \n"));
+    EXPECT_FALSE(log.Contains("): Error stack: a"));
+}
+
 TEST(PStreamTest, SendFailureLogsTheKeyPathOfTheFailingValue) {
     LogCapture log(S2S::Logger::Warning);
     PObject message;
