@@ -101,3 +101,5 @@ void BM_EnumSection(benchmark::State& state) {
 BENCHMARK(BM_EnumSection)->Arg(1000);
 
 }  // namespace
+
+BENCHMARK_MAIN();
