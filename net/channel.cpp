@@ -729,6 +729,14 @@ int Channel::ReadFd(int* handle, void* buf, unsigned int len, const timeval& wai
         return kStatusInvalidArgument;
     }
     int fd = PlainGetFd(handle);
+    // Bytes already queued on the socket need no wait: one non-blocking try first (as WriteFd
+    // does) saves the select. A set abort flag still ends the call without reading.
+    if (fd >= 0 && !AbortRequested(flag)) {
+        ssize_t n = ::recv(fd, buf, len, MSG_DONTWAIT);
+        if (!WouldBlock(n)) {
+            return ReadResult(n);
+        }
+    }
     fd_set read_set;
     fd_set except_set;
     int ret = WaitFd(fd, &read_set, nullptr, &except_set, wait, flag);

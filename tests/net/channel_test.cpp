@@ -360,6 +360,28 @@ TEST(ChannelTest, ClosedChannelRefusesIoAndEmptyOperationsDoNothing) {
     EXPECT_TRUE(log.Contains("): ReadFd: request 0\n"));
 }
 
+// Queued bytes are taken without a wait; a set abort flag still wins over them, and a peer that
+// has gone is reported as before.
+TEST(ChannelTest, ReadFdTakesQueuedBytesUnlessAborted) {
+    LogCapture log;
+    SocketPair pair;
+    ASSERT_TRUE(WriteAll(pair.b(), "abc"));
+    int handle = pair.a();
+    timeval wait{1, 0};
+    char buf[8];
+    int flag = 1;
+    EXPECT_EQ(S2S::kStatusInterrupted, Channel::ReadFd(&handle, buf, sizeof(buf), wait, &flag));
+    flag = 0;
+    ASSERT_EQ(3, Channel::ReadFd(&handle, buf, sizeof(buf), wait, &flag));
+    EXPECT_EQ("abc", std::string(buf, 3));
+    EXPECT_TRUE(log.Contains("): ReadFd: read 3 bytes\n"));
+    pair.CloseB();
+    EXPECT_EQ(S2S::kStatusIOError, Channel::ReadFd(&handle, buf, sizeof(buf), wait, nullptr));
+    EXPECT_TRUE(
+        log.Contains("): Diagnose: select says the socket is readable but actually we "
+                     "can't read ... connection closed?\n"));
+}
+
 TEST(ChannelTest, ReadMoreGivesUpAfterTheInactivityTimeout) {
     LogCapture log;
     SocketPair pair;
