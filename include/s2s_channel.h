@@ -176,19 +176,27 @@ class S2S_EXPORT Channel {
         r_head_ = r_size_ == 0 ? 0 : r_head_ + len;
     }
     bool WriteBuffered(const char* src, unsigned int len) {
-        if (handle_ == nullptr) {
+        char* at = WriteRoom(len);
+        if (at == nullptr) {
             return false;
+        }
+        std::memcpy(at, src, len);
+        Commit(len);
+        return true;
+    }
+    // Where the next `len` bytes go when that much room is free in one piece of the ring, else
+    // null. The codec writes them in place and then commits them.
+    char* WriteRoom(unsigned int len) {
+        if (handle_ == nullptr) {
+            return nullptr;
         }
         unsigned int end = w_head_ + w_size_;
         unsigned int tail = end < capacity_ ? end : end - capacity_;
         unsigned int room = end < capacity_ ? capacity_ - tail : w_head_ - tail;
-        if (len > room) {
-            return false;
-        }
-        std::memcpy(w_buf_.get() + tail, src, len);
-        w_size_ += len;
-        return true;
+        return len > room ? nullptr : w_buf_.get() + tail;
     }
+    // REQUIRES: WriteRoom(len) was not null and the bytes are written there.
+    void Commit(unsigned int len) { w_size_ += len; }
 
   protected:
     // One bounded wait on `fd`: each given set is reset to hold only `fd` before every select.

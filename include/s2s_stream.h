@@ -126,8 +126,9 @@ class S2S_EXPORT PStream {
     // the history, so it needs no lock.
     const char* LoggedValue(const char* value) const;
 
-    // The stack of keys is kept already joined ("k1.k2.k3"); marks_ holds the length the path had
-    // before each push, so a pop is a truncation and neither allocates once the path has grown.
+    // The stack of keys is kept already joined ("k1.k2.k3"); marks_ holds where each key starts,
+    // so a pop or a replacement is one string operation and none allocates once the path has
+    // grown.
     std::string history_;
     std::vector<size_t> marks_;
     std::atomic<unsigned long long> status_b_{0};

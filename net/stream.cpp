@@ -233,18 +233,22 @@ int PStream::Recv(Channel& channel, std::string& value) {
 
 int PStream::RecvText(Channel& channel, std::string& text, bool is_key) {
     ResetStatus();
-    unsigned short length = 0;
-    int ret = ReadInt16(channel, length);
-    if (ret < 0) {
-        return ChannelFailure(ret);
-    }
     // Only the bytes up to the first NUL are kept, as the format always did.
-    const char* at = Direct(channel) ? channel.BufferedRun(length) : nullptr;
-    if (at != nullptr) {
-        // Buffered in one piece: one copy, straight from the ring.
-        text.assign(at, strnlen(at, length));
-        channel.Consume(length);
+    const char* at = Direct(channel) ? channel.BufferedRun(2) : nullptr;
+    unsigned int length = at == nullptr ? 0
+                                        : (static_cast<unsigned char>(at[0]) << 8) |
+                                              static_cast<unsigned char>(at[1]);
+    if (at != nullptr && channel.BufferedRun(2 + length) != nullptr) {
+        // Length and body buffered in one piece: one copy, straight from the ring.
+        text.assign(at + 2, strnlen(at + 2, length));
+        channel.Consume(2 + length);
     } else {
+        unsigned short wire_length = 0;
+        int ret = ReadInt16(channel, wire_length);
+        if (ret < 0) {
+            return ChannelFailure(ret);
+        }
+        length = wire_length;
         text.resize(length);
         if (length > 0) {
             ret = ReadBytes(channel, &text[0], length);
@@ -381,6 +385,17 @@ int PStream::WriteBytes(Channel& channel, const char* src, size_t len) {
 // A string value: tag 0x10, the low 16 bits of the length, then every byte (the format's own
 // limit, which senders respect). Short strings reach the channel in one piece with their header.
 int PStream::WriteString(Channel& channel, const char* data, size_t len) {
+    char* room = len <= 0xFFFF && Direct(channel)
+                     ? channel.WriteRoom(static_cast<unsigned int>(3 + len))
+                     : nullptr;
+    if (room != nullptr) {
+        room[0] = static_cast<char>(kTagString);
+        room[1] = static_cast<char>((len >> 8) & 0xFF);
+        room[2] = static_cast<char>(len & 0xFF);
+        std::memcpy(room + 3, data, len);
+        channel.Commit(static_cast<unsigned int>(3 + len));
+        return 0;
+    }
     char head[64] = {static_cast<char>(kTagString), static_cast<char>((len >> 8) & 0xFF),
                      static_cast<char>(len & 0xFF)};
     if (len <= sizeof(head) - 3) {
@@ -409,10 +424,10 @@ void PStream::ResetStatus() {
 
 void PStream::PushKey(const char* key, size_t length) {
     pthread_mutex_lock(&mutex_);
-    marks_.push_back(history_.size());
-    if (marks_.size() > 1) {
+    if (!marks_.empty()) {
         history_ += '.';
     }
+    marks_.push_back(history_.size());
     history_.append(key, length);
     pthread_mutex_unlock(&mutex_);
 }
@@ -420,11 +435,7 @@ void PStream::PushKey(const char* key, size_t length) {
 void PStream::ReplaceKey(const char* key, size_t length) {
     pthread_mutex_lock(&mutex_);
     if (!marks_.empty()) {
-        history_.resize(marks_.back());
-        if (marks_.size() > 1) {
-            history_ += '.';
-        }
-        history_.append(key, length);
+        history_.replace(marks_.back(), std::string::npos, key, length);
     }
     pthread_mutex_unlock(&mutex_);
 }
@@ -432,8 +443,10 @@ void PStream::ReplaceKey(const char* key, size_t length) {
 void PStream::PopKey() {
     pthread_mutex_lock(&mutex_);
     if (!marks_.empty()) {
-        history_.resize(marks_.back());
+        size_t start = marks_.back();
         marks_.pop_back();
+        // Below the top level the key is preceded by its joining dot, which goes with it.
+        history_.resize(marks_.empty() ? 0 : start - 1);
     }
     pthread_mutex_unlock(&mutex_);
 }
@@ -442,11 +455,7 @@ const char* PStream::LoggedValue(const char* value) const {
     if (marks_.empty()) {
         return value;
     }
-    // The innermost key starts after its mark and, below the top level, after the joining dot.
-    size_t start = marks_.back() + (marks_.size() > 1 ? 1 : 0);
-    if (start > history_.size()) {
-        return value;
-    }
+    size_t start = marks_.back();
     return IsSecretKey(history_.data() + start, history_.size() - start) ? kMasked : value;
 }
 
