@@ -4,6 +4,7 @@
 #include <cctype>
 #include <climits>
 #include <cstring>
+#include <tuple>
 #include <typeinfo>
 
 #include "net/log_debug.h"
@@ -435,7 +436,8 @@ void PStream::PushKey(const char* key, size_t length) {
 void PStream::ReplaceKey(const char* key, size_t length) {
     pthread_mutex_lock(&mutex_);
     if (!marks_.empty()) {
-        history_.replace(marks_.back(), std::string::npos, key, length);
+        history_.resize(marks_.back());
+        history_.append(key, length);
     }
     pthread_mutex_unlock(&mutex_);
 }
@@ -602,6 +604,19 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         open(array, map);
     }
 
+    // The channel's class cannot change during the call; the log level is looked at each time.
+    const bool plain = typeid(channel) == typeid(Channel);
+    auto direct = [&] { return plain && Logger::log_level < Logger::Debug; };
+    auto next_tag = [&](unsigned char& next) {
+        const char* at = direct() ? channel.BufferedRun(1) : nullptr;
+        if (at == nullptr) {
+            return RecvTag(channel, next);
+        }
+        next = static_cast<unsigned char>(*at);
+        channel.Consume(1);
+        return 0;
+    };
+
     int ret = 0;
     std::string text;
     for (;;) {
@@ -610,7 +625,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             PObject& target = *slot;
             slot = nullptr;
             if (!have_tag) {
-                ret = RecvTag(channel, tag);
+                ret = next_tag(tag);
                 if (ret < 0) {
                     break;
                 }
@@ -667,7 +682,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             completed = true;
         } else {
             Frame& top = stack.back();
-            ret = RecvTag(channel, tag);
+            ret = next_tag(tag);
             if (ret < 0) {
                 break;
             }
@@ -695,19 +710,37 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 ret = kStatusProtocolError;
                 break;
             } else {
-                ret = RecvText(channel, text, true);
-                if (ret < 0) {
-                    break;
+                // Keys arrive in order from a conforming writer: the end is the likely place.
+                std::map<std::string, PObject>::iterator entry;
+                const char* at = direct() ? channel.BufferedRun(2) : nullptr;
+                unsigned int length = at == nullptr ? 0
+                                                    : (static_cast<unsigned char>(at[0]) << 8) |
+                                                          static_cast<unsigned char>(at[1]);
+                if (at != nullptr && channel.BufferedRun(2 + length) != nullptr) {
+                    // A key buffered whole is built straight from the ring into its entry (no
+                    // debug line is due on this path).
+                    ResetStatus();
+                    entry = top.map->emplace_hint(
+                        top.map->end(), std::piecewise_construct,
+                        std::forward_as_tuple(at + 2, strnlen(at + 2, length)),
+                        std::forward_as_tuple());
+                    channel.Consume(2 + length);
+                } else {
+                    ret = RecvText(channel, text, true);
+                    if (ret < 0) {
+                        break;
+                    }
+                    entry = top.map->try_emplace(top.map->end(), text);
                 }
+                const std::string& key = entry->first;
                 if (top.key_done) {
-                    ReplaceKey(text.data(), text.size());
+                    ReplaceKey(key.data(), key.size());
                     top.key_done = false;
                 } else {
-                    PushKey(text.data(), text.size());
+                    PushKey(key.data(), key.size());
                 }
                 top.pending = true;
-                // Keys arrive in order from a conforming writer: the end is the likely place.
-                slot = &top.map->try_emplace(top.map->end(), text)->second;
+                slot = &entry->second;
             }
         }
         if (completed) {
