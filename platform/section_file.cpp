@@ -5,13 +5,17 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
+#include <pthread.h>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
+#include <list>
+#include <mutex>
 #include <new>
 
 #include "platform/platform_internal.h"
@@ -175,70 +179,91 @@ int ParseFailure(const std::string& path, int bad_line) {
 
 bool SectionDoc::Parse(const std::string& text, int& bad_line) {
     lines_.clear();
+    DropIndex();
     bad_line = 0;
-    if (text.find('\0') != std::string::npos) {
-        bad_line =
-            1 + static_cast<int>(std::count(text.begin(), text.begin() + text.find('\0'), '\n'));
+    const char* const data = text.data();
+    const char* const stop = data + text.size();
+    if (const void* nul = std::memchr(data, '\0', text.size())) {
+        bad_line = 1 + static_cast<int>(std::count(data, static_cast<const char*>(nul), '\n'));
         return false;
     }
+    lines_.reserve(static_cast<size_t>(std::count(data, stop, '\n')) + 1);
+    // Lines are taken apart in place; only what a line keeps (its text, name and value) is copied.
+    auto blank = [](char c) { return c == ' ' || c == '\t' || c == '\r' || c == '\n'; };
+    auto trim = [&blank](const char*& begin, const char*& end) {
+        while (begin < end && blank(*begin)) {
+            ++begin;
+        }
+        while (end > begin && blank(end[-1])) {
+            --end;
+        }
+    };
     bool in_section = false;
-    size_t pos = 0;
     int number = 0;
-    while (pos < text.size()) {
-        size_t end = text.find('\n', pos);
-        if (end == std::string::npos) {
-            end = text.size();
-        }
+    for (const char* pos = data; pos < stop;) {
+        const char* newline = static_cast<const char*>(std::memchr(pos, '\n', stop - pos));
+        const char* eol = newline != nullptr ? newline : stop;
+        const char* raw_end = eol > pos && eol[-1] == '\r' ? eol - 1 : eol;
+        const char* begin = pos;
+        pos = eol + 1;
         ++number;
-        std::string raw = text.substr(pos, end - pos);
-        pos = end + 1;
-        if (!raw.empty() && raw.back() == '\r') {
-            raw.pop_back();
-        }
-        if (raw.size() > kSectionLineMax) {
+        if (static_cast<size_t>(raw_end - begin) > kSectionLineMax) {
             bad_line = number;
             return false;
         }
-        Line line{Line::kBlank, raw, std::string(), std::string()};
-        std::string trimmed = Trim(raw);
-        if (trimmed.empty()) {
+        Line line{Line::kBlank, std::string(begin, raw_end), std::string(), std::string()};
+        const char* first = begin;
+        const char* last = raw_end;
+        trim(first, last);
+        if (first == last) {
             line.kind = Line::kBlank;
-        } else if (trimmed[0] == '#' || trimmed[0] == ';') {
+        } else if (*first == '#' || *first == ';') {
             line.kind = Line::kComment;
-        } else if (trimmed[0] == '[' && trimmed.back() == ']') {
-            line.kind = Line::kHeader;
-            line.name = Trim(trimmed.substr(1, trimmed.size() - 2));
-            if (line.name.empty()) {
+        } else if (*first == '[' && last[-1] == ']') {
+            const char* name = first + 1;
+            const char* name_end = last - 1;
+            trim(name, name_end);
+            if (name >= name_end) {
                 bad_line = number;
                 return false;
             }
+            line.kind = Line::kHeader;
+            line.name.assign(name, name_end);
+            headers_.emplace(line.name, lines_.size());
             in_section = true;
         } else {
-            size_t eq = trimmed.find('=');
-            if (eq == std::string::npos || !in_section) {
+            const char* eq = static_cast<const char*>(std::memchr(first, '=', last - first));
+            if (eq == nullptr || !in_section) {
                 bad_line = number;
                 return false;
             }
-            line.kind = Line::kPair;
-            line.name = Trim(trimmed.substr(0, eq));
-            std::string value = Trim(trimmed.substr(eq + 1));
-            if (line.name.empty()) {
+            const char* key = first;
+            const char* key_end = eq;
+            const char* value = eq + 1;
+            const char* value_end = last;
+            trim(key, key_end);
+            trim(value, value_end);
+            if (key == key_end) {
                 bad_line = number;
                 return false;
             }
-            if (!value.empty() && value[0] == '"') {
+            if (value < value_end && *value == '"') {
                 // The value runs to the last quote of the line, so a value holding quotes reads
                 // back unchanged.
-                if (value.size() < 2 || value.back() != '"') {
+                if (value_end - value < 2 || value_end[-1] != '"') {
                     bad_line = number;
                     return false;
                 }
-                value = value.substr(1, value.size() - 2);
+                ++value;
+                --value_end;
             }
-            line.value = value;
+            line.kind = Line::kPair;
+            line.name.assign(key, key_end);
+            line.value.assign(value, value_end);
         }
         lines_.push_back(std::move(line));
     }
+    indexed_ = true;
     return true;
 }
 
@@ -259,7 +284,16 @@ SectionDoc::Line SectionDoc::MakeHeader(const std::string& name) {
     return Line{Line::kHeader, "[" + name + "]", name, std::string()};
 }
 
+void SectionDoc::DropIndex() {
+    headers_.clear();
+    indexed_ = false;
+}
+
 int SectionDoc::FindHeader(const std::string& name) const {
+    if (indexed_) {
+        auto it = headers_.find(name);
+        return it == headers_.end() ? -1 : static_cast<int>(it->second);
+    }
     for (size_t i = 0; i < lines_.size(); ++i) {
         if (lines_[i].kind == Line::kHeader && lines_[i].name == name) {
             return static_cast<int>(i);
@@ -329,6 +363,7 @@ bool SectionDoc::SetPairs(const std::string& name, const Pairs& pairs, bool add_
     if (header < 0) {
         return false;
     }
+    DropIndex();
     for (const auto& pair : pairs) {
         size_t begin = static_cast<size_t>(header) + 1;
         size_t end = SectionEnd(static_cast<size_t>(header));
@@ -358,11 +393,13 @@ bool SectionDoc::Rename(const std::string& from, const std::string& to) {
     if (header < 0) {
         return false;
     }
+    DropIndex();
     lines_[static_cast<size_t>(header)] = MakeHeader(to);
     return true;
 }
 
 void SectionDoc::AppendSection(const std::string& name, const Pairs& pairs) {
+    DropIndex();
     lines_.push_back(MakeHeader(name));
     for (const auto& pair : pairs) {
         lines_.push_back(MakePair(pair.first, pair.second));
@@ -374,6 +411,7 @@ bool SectionDoc::ReplacePairs(const std::string& name, const Pairs& pairs) {
     if (header < 0) {
         return false;
     }
+    DropIndex();
     size_t begin = static_cast<size_t>(header) + 1;
     size_t end = SectionEnd(static_cast<size_t>(header));
     std::vector<Line> kept;
@@ -398,6 +436,7 @@ bool SectionDoc::RemoveSection(const std::string& name) {
     if (header < 0) {
         return false;
     }
+    DropIndex();
     size_t end = SectionEnd(static_cast<size_t>(header));
     lines_.erase(lines_.begin() + header, lines_.begin() + static_cast<std::ptrdiff_t>(end));
     return true;
@@ -405,23 +444,192 @@ bool SectionDoc::RemoveSection(const std::string& name) {
 
 // --- files -------------------------------------------------------------------
 
-int LoadSectionFile(const std::string& path, SectionDoc& doc) {
-    std::string text;
-    if (ReadWholeFile(path, text, kSectionFileMax) != 0) {
-        int saved = errno;
-        if (saved == ENOENT) {
-            return Fail(VLIB_ERR_FILE_NOT_FOUND);
-        }
-        Logger::LogMsg(Logger::Error,
-                       "[ERROR] section_file.cpp(%d): Fail to read section file '%s', error:'%s'\n",
-                       __LINE__, path.c_str(), std::strerror(saved));
-        return Fail(saved == EFBIG ? VLIB_ERR_BAD_FORMAT : ErrorFromErrno(saved));
+namespace {
+
+// What a cached document was read from. Any write by rename gives a new inode, an edit in place
+// a new ctime, a change of mode or owner a new ctime too; a change of the reading process's
+// identity could change whether the file may be read at all.
+struct FileIdentity {
+    dev_t dev;
+    ino_t ino;
+    off_t size;
+    mode_t mode;
+    struct timespec mtime;
+    struct timespec ctime;
+    uid_t euid;
+    gid_t egid;
+
+    static FileIdentity Of(const struct stat& st) {
+        return FileIdentity{st.st_dev,  st.st_ino,  st.st_size, st.st_mode,
+                            st.st_mtim, st.st_ctim, geteuid(),  getegid()};
     }
+    bool operator==(const FileIdentity& o) const {
+        return dev == o.dev && ino == o.ino && size == o.size && mode == o.mode &&
+               mtime.tv_sec == o.mtime.tv_sec && mtime.tv_nsec == o.mtime.tv_nsec &&
+               ctime.tv_sec == o.ctime.tv_sec && ctime.tv_nsec == o.ctime.tv_nsec &&
+               euid == o.euid && egid == o.egid;
+    }
+};
+
+// File times come from a clock that advances in ticks (and on some file systems in whole
+// seconds), so an edit made within a tick of the last one may leave every field of stat() as it
+// was. A file whose ctime lies at least this far before a read began cannot be changed unseen
+// after that read: any later change stamps a later ctime. Times without a fraction of a second
+// suggest a file system that keeps only seconds (or two), hence the wider margin.
+constexpr long long kSettleFineNs = 1000000000LL;
+constexpr long long kSettleCoarseNs = 3000000000LL;
+
+long long Nanoseconds(const struct timespec& t) {
+    return static_cast<long long>(t.tv_sec) * 1000000000LL + t.tv_nsec;
+}
+
+bool Settled(const FileIdentity& id, const struct timespec& read_start) {
+    long long margin = id.ctime.tv_nsec == 0 ? kSettleCoarseNs : kSettleFineNs;
+    return Nanoseconds(read_start) - Nanoseconds(id.ctime) >= margin;
+}
+
+struct CachedFile {
+    std::string path;
+    FileIdentity id;
+    bool settled;
+    std::shared_ptr<const std::string> text;
+    std::shared_ptr<const SectionDoc> doc;
+};
+
+// A handful of files (the pairing store, the share registry, the host file) are read over and
+// over; larger files than this are read anew each time rather than held in memory.
+constexpr size_t kCachedFiles = 4;
+constexpr size_t kCachedFileMax = 4u << 20;
+
+class DocCache {
+  public:
+    static DocCache& Instance() {
+        // Leaked on purpose: readers in other threads or atexit handlers may still use it while
+        // static objects are destroyed at exit.
+        static DocCache* cache = new DocCache();
+        return *cache;
+    }
+
+    // The cached entry of `path` when it was read from the file `id` names; false otherwise.
+    bool Find(const std::string& path, const FileIdentity& id, CachedFile& out) {
+        std::lock_guard<std::mutex> hold(mutex_);
+        for (auto it = files_.begin(); it != files_.end(); ++it) {
+            if (it->path == path) {
+                if (!(it->id == id)) {
+                    return false;
+                }
+                files_.splice(files_.begin(), files_, it);
+                out = *it;
+                return true;
+            }
+        }
+        return false;
+    }
+
+    void Store(CachedFile entry) {
+        std::lock_guard<std::mutex> hold(mutex_);
+        EraseLocked(entry.path);
+        files_.push_front(std::move(entry));
+        while (files_.size() > kCachedFiles) {
+            files_.pop_back();
+        }
+    }
+
+    void Forget(const std::string& path) {
+        std::lock_guard<std::mutex> hold(mutex_);
+        EraseLocked(path);
+    }
+
+  private:
+    DocCache() {
+        // A child forked while another thread holds the lock would wait for it forever.
+        pthread_atfork([] { Instance().mutex_.lock(); }, [] { Instance().mutex_.unlock(); },
+                       [] { Instance().mutex_.unlock(); });
+    }
+
+    void EraseLocked(const std::string& path) {
+        files_.remove_if([&path](const CachedFile& f) { return f.path == path; });
+    }
+
+    std::mutex mutex_;
+    std::list<CachedFile> files_;
+};
+
+int ReadFailure(const std::string& path, int saved) {
+    if (saved == ENOENT) {
+        return Fail(VLIB_ERR_FILE_NOT_FOUND);
+    }
+    Logger::LogMsg(Logger::Error,
+                   "[ERROR] section_file.cpp(%d): Fail to read section file '%s', error:'%s'\n",
+                   __LINE__, path.c_str(), std::strerror(saved));
+    return Fail(saved == EFBIG ? VLIB_ERR_BAD_FORMAT : ErrorFromErrno(saved));
+}
+
+}  // namespace
+
+int LoadSectionFileShared(const std::string& path, std::shared_ptr<const SectionDoc>& doc) {
+    DocCache& cache = DocCache::Instance();
+    CachedFile cached;
+    bool have_cached = false;
+    struct stat st;
+    if (stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode)) {
+        have_cached = cache.Find(path, FileIdentity::Of(st), cached);
+        if (have_cached && cached.settled) {
+            doc = cached.doc;
+            return Succeed(0);
+        }
+    }
+    // Taken before the file is opened: whatever changes it after this moment stamps a ctime no
+    // earlier than about now.
+    struct timespec read_start;
+    clock_gettime(CLOCK_REALTIME, &read_start);
+    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+        return ReadFailure(path, errno);
+    }
+    struct stat opened;
+    bool known = fstat(fd, &opened) == 0 && S_ISREG(opened.st_mode);
+    auto text = std::make_shared<std::string>();
+    if (ReadWholeFd(fd, *text, kSectionFileMax) != 0) {
+        int saved = errno;
+        close(fd);
+        return ReadFailure(path, saved);
+    }
+    close(fd);
+    // A file changed while it was read may not match what fstat() saw; it is not kept.
+    FileIdentity id = FileIdentity::Of(opened);
+    known = known && static_cast<size_t>(opened.st_size) == text->size() &&
+            text->size() <= kCachedFileMax;
+    if (have_cached && known && id == cached.id && *text == *cached.text) {
+        cached.settled = Settled(id, read_start);
+        doc = cached.doc;
+        cache.Store(std::move(cached));
+        return Succeed(0);
+    }
+    auto parsed = std::make_shared<SectionDoc>();
     int bad_line = 0;
-    if (!doc.Parse(text, bad_line)) {
+    if (!parsed->Parse(*text, bad_line)) {
+        cache.Forget(path);
         return ParseFailure(path, bad_line);
     }
+    doc = parsed;
+    if (known) {
+        cache.Store(CachedFile{path, id, Settled(id, read_start), std::move(text), parsed});
+    }
     return Succeed(0);
+}
+
+int LoadSectionFile(const std::string& path, SectionDoc& doc) {
+    std::shared_ptr<const SectionDoc> shared;
+    if (LoadSectionFileShared(path, shared) != 0) {
+        return -1;
+    }
+    doc = *shared;
+    return Succeed(0);
+}
+
+void ForgetSectionFile(const std::string& path) {
+    DocCache::Instance().Forget(path);
 }
 
 int UpdateSectionFile(const std::string& path, bool create,
@@ -490,8 +698,14 @@ int UpdateSectionFile(const std::string& path, bool create,
         int result;
         try {
             result = edit(doc);
-            if (result == 1 && ReplaceFile(target, held, doc.Serialize()) != 0) {
-                result = -1;
+            if (result == 1) {
+                if (ReplaceFile(target, held, doc.Serialize()) != 0) {
+                    result = -1;
+                }
+                // The replacement has a new inode, which readers notice by themselves; dropping
+                // the old document here just frees it sooner.
+                ForgetSectionFile(path);
+                ForgetSectionFile(target);
             }
         } catch (const std::bad_alloc&) {
             result = Fail(VLIB_ERR_OUT_OF_MEMORY);
@@ -574,15 +788,15 @@ int VLIBCFileGetSection(const char* file, const char* section, VLIBSzHash** tabl
         return Fail(VLIB_ERR_BAD_PARAMETER);
     }
     try {
-        SectionDoc doc;
-        if (s2s_platform::LoadSectionFile(file, doc) != 0) {
+        std::shared_ptr<const SectionDoc> doc;
+        if (s2s_platform::LoadSectionFileShared(file, doc) != 0) {
             return -1;
         }
-        if (!doc.HasSection(section)) {
+        if (!doc->HasSection(section)) {
             s2s_platform::SetError(VLIB_ERR_NOT_FOUND);
             return 0;
         }
-        for (const auto& pair : doc.SectionPairs(section)) {
+        for (const auto& pair : doc->SectionPairs(section)) {
             if (VLIBCSzHashSetValue(table, pair.first.c_str(), pair.second.c_str()) < 0) {
                 return -1;
             }
@@ -600,13 +814,13 @@ int VLIBCFileGetSectionValue(const char* file, const char* section, const char* 
         return Fail(VLIB_ERR_BAD_PARAMETER);
     }
     try {
-        SectionDoc doc;
-        if (s2s_platform::LoadSectionFile(file, doc) != 0) {
+        std::shared_ptr<const SectionDoc> doc;
+        if (s2s_platform::LoadSectionFileShared(file, doc) != 0) {
             buf[0] = '\0';
             return -1;
         }
         std::string value;
-        if (!doc.GetValue(section, key, value)) {
+        if (!doc->GetValue(section, key, value)) {
             buf[0] = '\0';
             return Fail(VLIB_ERR_NOT_FOUND);
         }
@@ -726,11 +940,11 @@ int VLIBCFileEnumSection(const char* file, VLIBSzList** list) {
         return Fail(VLIB_ERR_BAD_PARAMETER);
     }
     try {
-        SectionDoc doc;
-        if (s2s_platform::LoadSectionFile(file, doc) != 0) {
+        std::shared_ptr<const SectionDoc> doc;
+        if (s2s_platform::LoadSectionFileShared(file, doc) != 0) {
             return -1;
         }
-        std::vector<std::string> names = doc.SectionNames();
+        std::vector<std::string> names = doc->SectionNames();
         for (const std::string& name : names) {
             if (VLIBCSzListPush(list, name.c_str()) < 0) {
                 return -1;

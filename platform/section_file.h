@@ -5,7 +5,9 @@
 #define S2S_PLATFORM_SECTION_FILE_H
 
 #include <functional>
+#include <memory>
 #include <string>
+#include <unordered_map>
 #include <utility>
 #include <vector>
 
@@ -23,6 +25,7 @@ class SectionDoc {
     std::string Serialize() const;
 
     bool HasSection(const std::string& name) const { return FindHeader(name) >= 0; }
+    // Section names in file order, a name repeated by hand once per header.
     std::vector<std::string> SectionNames() const;
     // The pairs of a section in file order; a key repeated by hand counts with its first value.
     Pairs SectionPairs(const std::string& name) const;
@@ -51,8 +54,14 @@ class SectionDoc {
     int FindHeader(const std::string& name) const;
     // One past the last line of the section whose header is at `header`.
     size_t SectionEnd(size_t header) const;
+    // Every edit may move or rename headers; lookups then scan the lines until the next parse.
+    void DropIndex();
 
     std::vector<Line> lines_;
+    // First header line of each section name, built by Parse so that a read of one section in a
+    // large file does not walk every line. Valid only while `indexed_`.
+    std::unordered_map<std::string, size_t> headers_;
+    bool indexed_ = false;
 };
 
 // Largest section file read (bytes) and longest line accepted.
@@ -64,6 +73,17 @@ constexpr size_t kSectionLineMax = 65536;
 // caller knows whether that is normal), VLIB_ERR_ACCESS / VLIB_ERR_IO / VLIB_ERR_BAD_FORMAT
 // (logged).
 int LoadSectionFile(const std::string& path, SectionDoc& doc);
+
+// The same, handing out the parsed document shared with a per-process cache of the last few
+// files read. A cached document is used only while the file's identity (device, inode, size,
+// mode, mtime, ctime) is unchanged and the file changed long enough before it was read that a
+// later change must show in its ctime; until then the file is read again and compared byte for
+// byte. Writers replace the file by rename, so any write gives a new inode. Failures are never
+// cached: each read of a malformed file is refused and logged again. Thread-safe.
+int LoadSectionFileShared(const std::string& path, std::shared_ptr<const SectionDoc>& doc);
+
+// Drops what the cache holds for `path` (this process's own writes call it).
+void ForgetSectionFile(const std::string& path);
 
 // The one writer path. Locks the file against other writers, reads and parses it (creating it
 // empty first when `create` and it is missing), lets `edit` change the document, and when `edit`

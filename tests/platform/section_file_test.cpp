@@ -2,6 +2,7 @@
 // format cannot carry, failed and interrupted writes, and concurrent writers in real processes.
 #include <dirent.h>
 #include <errno.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
 #include <sys/inotify.h>
@@ -11,9 +12,12 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <chrono>
 #include <cstring>
 #include <random>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/platform_test_util.h"
@@ -508,6 +512,170 @@ TEST(SectionFile, WriterKilledMidUpdateNeverLeavesATornFile) {
     Table values({{"k", "v"}});
     ASSERT_EQ(VLIBCFileSetSection(file.c_str(), "final", nullptr, values.get(), nullptr), 1);
     EXPECT_EQ(Leftovers(dir), 0);
+}
+
+// --- the per-process read cache ---------------------------------------------------
+
+std::string ValueOf(const std::string& file, const char* section, const char* key) {
+    char buf[64];
+    if (VLIBCFileGetSectionValue(file.c_str(), section, key, buf, sizeof(buf)) < 0) {
+        return "<error " + std::to_string(VLIBCErrGet()) + ">";
+    }
+    return buf;
+}
+
+// Gives the file the modification time `when` exactly, so that neither size nor mtime differ.
+void SetMtime(const std::string& file, const struct timespec& when) {
+    struct timespec times[2] = {when, when};
+    ASSERT_EQ(utimensat(AT_FDCWD, file.c_str(), times, 0), 0);
+}
+
+// Runs `body` in a child process and expects it to succeed.
+template <typename Body>
+void InChild(Body body) {
+    pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+        _exit(body() ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(pid, &status, 0), pid);
+    ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+}
+
+// Overwrites the file's bytes where it stands, as an editor saving in place would.
+bool RewriteInPlace(const std::string& file, const std::string& content) {
+    int fd = open(file.c_str(), O_WRONLY | O_CLOEXEC);
+    bool ok = fd >= 0 &&
+              pwrite(fd, content.data(), content.size(), 0) == static_cast<ssize_t>(content.size());
+    return fd >= 0 && close(fd) == 0 && ok;
+}
+
+// Another process rewrites the file between two reads of this one, keeping its size and (put
+// back by hand) its mtime to the nanosecond: the second read must see the new content. By rename,
+// as every writer does, many times in a row so that freed inode numbers come back; and in place.
+TEST(SectionFile, CachedReadsNeverServeStaleContent) {
+    TempDir dir;
+    std::string file = dir / "store.info";
+    ASSERT_EQ(VLIBCFileAddSection(file.c_str(), "s", Table({{"k", "0000"}}).get(), nullptr), 1);
+    struct stat first;
+    ASSERT_EQ(stat(file.c_str(), &first), 0);
+    ASSERT_EQ(ValueOf(file, "s", "k"), "0000");
+    for (int round = 1; round <= 60; ++round) {
+        char value[8];
+        snprintf(value, sizeof(value), "%04d", round);
+        InChild([&] {
+            Table values({{"k", value}});
+            return VLIBCFileSetSection(file.c_str(), "s", nullptr, values.get(), nullptr) == 1;
+        });
+        SetMtime(file, first.st_mtim);
+        struct stat now;
+        ASSERT_EQ(stat(file.c_str(), &now), 0);
+        ASSERT_EQ(now.st_size, first.st_size);
+        ASSERT_EQ(ValueOf(file, "s", "k"), value) << "round " << round;
+    }
+    for (int round = 1; round <= 20; ++round) {
+        std::string value = std::string(4, static_cast<char>('a' + round));
+        InChild([&] { return RewriteInPlace(file, "[s]\n\tk=\"" + value + "\"\n"); });
+        SetMtime(file, first.st_mtim);
+        ASSERT_EQ(ValueOf(file, "s", "k"), value) << "round " << round;
+        ASSERT_EQ(Sections(file), std::vector<std::string>{"s"});
+    }
+    // Edits right after a read may fall within the same tick of the file system's clock (where
+    // the kernel does not hand out finer change times to files whose times were just looked at),
+    // so that even the change time stays as it was.
+    for (int round = 0; round < 200; ++round) {
+        std::string value = std::to_string(1000 + round);
+        ASSERT_TRUE(RewriteInPlace(file, "[s]\n\tk=\"" + value + "\"\n"));
+        SetMtime(file, first.st_mtim);
+        ASSERT_EQ(ValueOf(file, "s", "k"), value) << "round " << round;
+    }
+}
+
+// A file left alone for a while is trusted on stat() alone; an edit in place must still show
+// through the change time it stamps, even with size and mtime as they were.
+TEST(SectionFile, CachedCopyOfASettledFileStillSeesAnEditInPlace) {
+    TempDir dir;
+    std::string file = dir / "host.conf";
+    WriteFile(file, "[s]\n\tk=\"old\"\n");
+    struct stat first;
+    ASSERT_EQ(stat(file.c_str(), &first), 0);
+    // Only the passing of time settles a file; nothing else can be waited for here.
+    std::this_thread::sleep_for(std::chrono::milliseconds(1100));
+    ASSERT_EQ(ValueOf(file, "s", "k"), "old");
+    ASSERT_EQ(ValueOf(file, "s", "k"), "old");
+    InChild([&] { return RewriteInPlace(file, "[s]\n\tk=\"new\"\n"); });
+    SetMtime(file, first.st_mtim);
+    EXPECT_EQ(ValueOf(file, "s", "k"), "new");
+    // Made unreadable in place: the read fails as it would without a cache.
+    WriteFile(file, "[s]\n\tk=\"new\"\nnot a pair\n");
+    SetMtime(file, first.st_mtim);
+    EXPECT_EQ(ValueOf(file, "s", "k"), "<error " + std::to_string(VLIB_ERR_BAD_FORMAT) + ">");
+}
+
+// Failures are never cached: each read of a malformed file is refused and logged again, and a
+// read of a removed file reports it missing.
+TEST(SectionFile, EveryReadOfAMalformedFileIsRefusedAndLogged) {
+    LogCapture log;
+    TempDir dir;
+    std::string file = dir / "f";
+    WriteFile(file, "[s]\n\tk=\"v\"\n");
+    ASSERT_EQ(ValueOf(file, "s", "k"), "v");
+    WriteFile(file, "[s]\ngarbage\n");
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_EQ(ValueOf(file, "s", "k"), "<error " + std::to_string(VLIB_ERR_BAD_FORMAT) + ">");
+    }
+    std::string text = log.Text();
+    std::string line = "Malformed line 2 in section file '" + file + "'";
+    size_t count = 0;
+    for (size_t at = text.find(line); at != std::string::npos; at = text.find(line, at + 1)) {
+        ++count;
+    }
+    EXPECT_EQ(count, 3u);
+    WriteFile(file, "[s]\n\tk=\"w\"\n");
+    EXPECT_EQ(ValueOf(file, "s", "k"), "w");
+    ASSERT_EQ(unlink(file.c_str()), 0);
+    EXPECT_EQ(ValueOf(file, "s", "k"), "<error " + std::to_string(VLIB_ERR_FILE_NOT_FOUND) + ">");
+}
+
+// Threads of one process share the cache while one of them writes: every read sees one whole
+// version of the section, and versions never go backwards for a reader.
+TEST(SectionFile, ThreadsReadingWhileOneWritesSeeWholeVersions) {
+    TempDir dir;
+    std::string file = dir / "f";
+    ASSERT_EQ(
+        VLIBCFileAddSection(file.c_str(), "s", Table({{"a", "0"}, {"b", "0"}}).get(), nullptr), 1);
+    std::atomic<bool> done{false};
+    std::atomic<int> failures{0};
+    std::vector<std::thread> readers;
+    for (int t = 0; t < 3; ++t) {
+        readers.emplace_back([&] {
+            int last = 0;
+            while (!done.load()) {
+                Table out;
+                if (VLIBCFileGetSection(file.c_str(), "s", out.ptr()) != 1 ||
+                    out["a"] != out["b"] || std::stoi(out["a"]) < last) {
+                    ++failures;
+                    return;
+                }
+                last = std::stoi(out["a"]);
+            }
+        });
+    }
+    for (int i = 1; i <= 40; ++i) {
+        std::string n = std::to_string(i);
+        Table values({{"a", n.c_str()}, {"b", n.c_str()}});
+        if (VLIBCFileSetSection(file.c_str(), "s", nullptr, values.get(), nullptr) != 1) {
+            ADD_FAILURE() << "write " << i;
+            break;
+        }
+    }
+    done = true;
+    for (auto& reader : readers) {
+        reader.join();
+    }
+    EXPECT_EQ(failures.load(), 0);
+    EXPECT_EQ(ValueOf(file, "s", "a"), "40");
 }
 
 }  // namespace
