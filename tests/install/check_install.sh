@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # check_install.sh BUILD_DIR THIS_DIR: install, then compile and run outside programs.
 set -euo pipefail
+trap 'echo "check_install.sh: failed at line $LINENO: $BASH_COMMAND" >&2' ERR
 build=$1
 here=$2
 scratch=$(mktemp -d "${TMPDIR:-/tmp}/s2s-install.XXXXXX")
@@ -46,5 +47,6 @@ CMAKE
 cmake -S "$scratch/cmake-project" -B "$scratch/cmake-build" -G Ninja \
   -DCMAKE_PREFIX_PATH="$prefix" >/dev/null
 cmake --build "$scratch/cmake-build" >/dev/null
-"$scratch/cmake-build/outside" | grep -q '^Protocal error$'
+"$scratch/cmake-build/outside" >"$scratch/out2.txt"
+grep -q '^Protocal error$' "$scratch/out2.txt"
 echo "installed library usable from outside programs"
