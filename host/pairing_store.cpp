@@ -18,9 +18,13 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <memory>
+#include <new>
 #include <string>
+#include <vector>
 
 #include "host/pairing_store.h"
+#include "platform/section_file.h"
 #include "s2s_platform.h"
 
 namespace S2S {
@@ -62,7 +66,7 @@ const char* StorePath() {
     return S2SPath(S2S_PATH_PAIRING_STORE);
 }
 
-// Owners of the platform's objects. The platform may replace a table or list when it grows it,
+// Owners of the platform's objects. The platform may replace a table when it grows it,
 // so callers pass `slot()` and the owner frees whatever ends up there.
 class Table {
   public:
@@ -81,21 +85,6 @@ class Table {
 
   private:
     VLIBSzHash* hash_;
-};
-
-class List {
-  public:
-    explicit List(int size) : list_(VLIBCSzListAlloc(size)) {}
-    ~List() { VLIBCSzListFree(list_); }
-    List(const List&) = delete;
-    List& operator=(const List&) = delete;
-
-    bool ok() const { return list_ != nullptr; }
-    VLIBSzList* get() const { return list_; }
-    VLIBSzList** slot() { return &list_; }
-
-  private:
-    VLIBSzList* list_;
 };
 
 class PlatformString {
@@ -192,18 +181,86 @@ char* SectionName(const char* prefix, const char* name) {
     return VLIBCStrGet("%s%s", prefix, name);
 }
 
+// One read of the store for a whole decision over many sections. Reading each share or task
+// section on its own would read (or at least check) the whole file once per section; here every
+// section is taken from the one version of the file read first, which is also the version a quick
+// enough series of single reads would have seen. Lookups report what VLIBCFileGetSection would:
+// the same results and platform errors, and a failed read is logged once, by the platform.
+class StoreSnapshot {
+  public:
+    explicit StoreSnapshot(const char* file) : file_(file) {}
+
+    // -1 (platform error set), or 0 with the file's document read.
+    int Load() {
+        if (!loaded_) {
+            loaded_ = true;
+            if (file_ == nullptr || *file_ == '\0') {
+                error_ = VLIB_ERR_BAD_PARAMETER;
+            } else {
+                try {
+                    error_ = s2s_platform::LoadSectionFileShared(file_, doc_) == 0 ? VLIB_ERR_NONE
+                                                                                   : VLIBCErrGet();
+                } catch (const std::bad_alloc&) {
+                    error_ = VLIB_ERR_OUT_OF_MEMORY;
+                }
+            }
+        }
+        VLIBCErrSet(error_);
+        return error_ == VLIB_ERR_NONE ? 0 : -1;
+    }
+
+    // Like VLIBCFileGetSection on `section`, keeping only the `count` keys of `keys`: -1 on a
+    // failed read, 0 when the section is absent, 1 when found, with values[i] set and present[i]
+    // true where the section has keys[i].
+    int GetSection(const char* section, int count, const char* const* keys, std::string* values,
+                   bool* present) {
+        for (int i = 0; i < count; ++i) {
+            present[i] = false;
+        }
+        if (section == nullptr || *section == '\0') {
+            VLIBCErrSet(VLIB_ERR_BAD_PARAMETER);
+            return -1;
+        }
+        if (Load() != 0) {
+            return -1;
+        }
+        try {
+            if (!doc_->HasSection(section)) {
+                VLIBCErrSet(VLIB_ERR_NOT_FOUND);
+                return 0;
+            }
+            for (int i = 0; i < count; ++i) {
+                present[i] = doc_->GetValue(section, keys[i], values[i]);
+            }
+        } catch (const std::bad_alloc&) {
+            VLIBCErrSet(VLIB_ERR_OUT_OF_MEMORY);
+            return -1;
+        }
+        VLIBCErrSet(VLIB_ERR_NONE);
+        return 1;
+    }
+
+    const s2s_platform::SectionDoc& doc() const { return *doc_; }
+
+  private:
+    const char* file_;
+    bool loaded_ = false;
+    int error_ = VLIB_ERR_NONE;
+    std::shared_ptr<const s2s_platform::SectionDoc> doc_;
+};
+
 // Why a share cannot be paired by some client: its status and the client bound to it.
 struct ShareState {
     int status = kShareFree;
     char owner[kIdBufferSize] = "";
 };
 
-// Reads the share's binding into `state`, using `table` as scratch. 0; 206 when its section
-// cannot be read; 200 out of memory. An empty name keeps the previous share's state.
+// Reads the share's binding from `store` into `state`. 0; 206 when its section cannot be read;
+// 200 out of memory. An empty name keeps the previous share's state.
 //
 // Both IDs come from one read of the section, so a share rewritten meanwhile is judged on one
 // version of it, never on the completed ID of one and the running ID of the next.
-int GetSharePairStatus(const char* share, Table* table, ShareState* state) {
+int GetSharePairStatus(const char* share, StoreSnapshot* store, ShareState* state) {
     if (share == nullptr || *share == '\0') {
         Message("Parameter error on getSharePairStatus.");
         return 0;
@@ -212,10 +269,12 @@ int GetSharePairStatus(const char* share, Table* table, ShareState* state) {
     if (section.get() == nullptr) {
         return S2S_SVR_ERR_ALLOC;
     }
-    VLIBCHashRemoveAll(table->get());
-    const int found = VLIBCFileGetSection(StorePath(), section.get(), table->slot());
-    const char* complete = found > 0 ? table->Get("CompleteID") : nullptr;
-    const char* running = found > 0 ? table->Get("RunningID") : nullptr;
+    static const char* const kKeys[] = {"CompleteID", "RunningID"};
+    std::string ids[2];
+    bool present[2];
+    const int found = store->GetSection(section.get(), 2, kKeys, ids, present);
+    const char* complete = found > 0 && present[0] ? ids[0].c_str() : nullptr;
+    const char* running = found > 0 && present[1] ? ids[1].c_str() : nullptr;
     // IDs live in buffers of kIdBufferSize bytes; a longer one cannot be read.
     if (found < 0 || (complete != nullptr && strlen(complete) >= sizeof(ShareState::owner))) {
         Message("Failed to get section [%s] CompleteID value.", section.get());
@@ -260,26 +319,32 @@ bool CanClientPairTheShare(const ShareState& state, const char* clientId) {
     }
 }
 
-// Whether some task sent a heartbeat within the window. Any failure reads as not busy.
+// Whether some task sent a heartbeat within the window. Any failure reads as not busy. The
+// section names and every task section come from one read of the file.
 int AnyTaskBusy(const char* file) {
-    List names(kPairTableSize);
-    Table task(kPairTableSize);
-    if (!names.ok() || !task.ok() || VLIBCFileEnumSection(file, names.slot()) < 0) {
+    StoreSnapshot store(file);
+    std::vector<std::string> names;
+    try {
+        if (store.Load() != 0) {
+            return 0;
+        }
+        names = store.doc().SectionNames();
+    } catch (const std::bad_alloc&) {
         return 0;
     }
     const time_t now = time(nullptr);
-    const int count = VLIBCSzListCount(names.get());
-    for (int i = 0; i < count; ++i) {
-        const char* name = VLIBCSzListGet(names.get(), i);
-        if (name == nullptr || strncmp(name, "TASK_", 5) != 0) {
+    static const char* const kKeys[] = {"status"};
+    for (const std::string& name : names) {
+        if (name.compare(0, 5, "TASK_") != 0) {
             continue;
         }
-        VLIBCHashRemoveAll(task.get());
-        const int found = VLIBCFileGetSection(file, name, task.slot());
+        std::string value;
+        bool present = false;
+        const int found = store.GetSection(name.c_str(), 1, kKeys, &value, &present);
         if (found < 0) {
             return 0;
         }
-        const char* status = task.Get("status");
+        const char* status = present ? value.c_str() : nullptr;
         if (found == 0 || status == nullptr || strcmp(status, "idle") == 0) {
             continue;
         }
@@ -560,16 +625,14 @@ int S2SCheckIfSharePaired(VLIBSzList* shares, const char* client_id, VLIBSzList*
         }
     }
     VLIBCSzListRemoveAll(*refused);
-    Table table(kPairTableSize);
-    if (!table.ok()) {
-        return S2S_SVR_ERR_ALLOC;
-    }
     EnsureFile();
+    // The file is read when the first share is looked up, after it was ensured.
+    StoreSnapshot store(StorePath());
     ShareState state;
     const int count = VLIBCSzListCount(shares);
     for (int i = 0; i < count; ++i) {
         const char* share = VLIBCSzListGet(shares, i);
-        const int read = GetSharePairStatus(share, &table, &state);
+        const int read = GetSharePairStatus(share, &store, &state);
         if (read != 0) {
             return read;
         }
