@@ -11,8 +11,8 @@
 // Besides the codec a stream keeps diagnostics: the key path it is inside (logged on a failure),
 // the nesting depth (indentation of debug lines) and two status counters. Another thread may read
 // them (GetStatus) while one thread transfers a message. At debug level every value written or
-// read is logged, except a string under a key that names a password ("pswd", or any key
-// containing "passw" in any letter case): that one is logged as "********".
+// read is logged, except a string under a key that names a password (a key containing "pswd" or
+// "passw" in any letter case, such as a task map's "pswd"): that one is logged as "********".
 #ifndef S2S_STREAM_H
 #define S2S_STREAM_H
 
