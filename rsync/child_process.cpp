@@ -4,9 +4,11 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdlib>
@@ -21,6 +23,8 @@ namespace rsync_internal {
 namespace {
 
 constexpr int kPollMillis = 100;  // well under the 200 ms the cancel predicate is promised
+// Without a pidfd (kernels before 5.3) nothing signals the child's end: it is checked this often.
+constexpr int kReapCheckMillis = 5;
 constexpr auto kTermGrace = std::chrono::seconds(3);
 constexpr auto kKillGrace = std::chrono::seconds(3);
 
@@ -45,6 +49,22 @@ class Fd {
 bool IsExecutable(const std::string& path) {
     struct stat st;
     return stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) && access(path.c_str(), X_OK) == 0;
+}
+
+// A descriptor that turns readable the moment the process ends (-1 where the kernel has none).
+int OpenPidFd(pid_t pid) {
+    return static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+}
+
+// Waits until the process behind `pidfd` ends, at most `millis`; sleeps instead without one.
+void AwaitExit(int pidfd, int millis) {
+    if (pidfd >= 0) {
+        struct pollfd pfd = {pidfd, POLLIN, 0};
+        while (poll(&pfd, 1, millis) < 0 && errno == EINTR) {
+        }
+    } else {
+        std::this_thread::sleep_for(std::chrono::milliseconds(std::min(millis, kReapCheckMillis)));
+    }
 }
 
 // Splits the merged output into lines; progress meters rewrite their line with '\r'.
@@ -114,18 +134,24 @@ void DrainAvailable(int fd, LineSplitter* splitter) {
 }
 
 // Ends the group: SIGTERM, a grace period, then SIGKILL; reaps `pid` on the way.
-void StopGroup(pid_t pid, int fd, LineSplitter* splitter, bool* reaped, int* status) {
+void StopGroup(pid_t pid, int pidfd, int fd, LineSplitter* splitter, bool* reaped, int* status) {
     kill(-pid, SIGTERM);
     auto deadline = std::chrono::steady_clock::now() + kTermGrace;
-    while (std::chrono::steady_clock::now() < deadline) {
+    for (;;) {
         if (!*reaped) {
             *reaped = TryReap(pid, status);
         }
+        DrainAvailable(fd, splitter);
         if (*reaped && !GroupAlive(pid)) {
             break;
         }
-        DrainAvailable(fd, splitter);
-        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+            deadline - std::chrono::steady_clock::now());
+        if (left.count() <= 0) {
+            break;
+        }
+        // The leader's end wakes this at once; the rest of the group is looked at every 20 ms.
+        AwaitExit(*reaped ? -1 : pidfd, static_cast<int>(std::min<long long>(left.count(), 20)));
     }
     if (!*reaped || GroupAlive(pid)) {
         kill(-pid, SIGKILL);
@@ -259,6 +285,9 @@ ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& canc
     null_fd.reset();
     fcntl(read_end.get(), F_SETFL, fcntl(read_end.get(), F_GETFL) | O_NONBLOCK);
 
+    // The child's end wakes the loop through its pidfd, its output through the pipe: nothing
+    // waits for a timer unless a cancel predicate has to be asked.
+    Fd pid_fd(OpenPidFd(pid));
     LineSplitter splitter(sink);
     bool reaped = false;
     bool eof = false;
@@ -266,28 +295,41 @@ ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& canc
     while (!reaped || !eof) {
         if (cancel && cancel()) {
             outcome.cancelled = true;
-            StopGroup(pid, read_end.get(), &splitter, &reaped, &status);
+            StopGroup(pid, pid_fd.get(), read_end.get(), &splitter, &reaped, &status);
             break;
         }
+        struct pollfd pfds[2];
+        nfds_t count = 0;
         if (!eof) {
-            struct pollfd pfd = {read_end.get(), POLLIN, 0};
-            int r = poll(&pfd, 1, kPollMillis);
-            if (r > 0) {
-                char buffer[4096];
-                ssize_t n = read(read_end.get(), buffer, sizeof buffer);
-                if (n > 0) {
-                    splitter.Feed(buffer, static_cast<size_t>(n));
-                } else if (n == 0) {
-                    eof = true;
-                }
+            pfds[count++] = {read_end.get(), POLLIN, 0};
+        }
+        if (!reaped && pid_fd.get() >= 0) {
+            pfds[count++] = {pid_fd.get(), POLLIN, 0};
+        }
+        int timeout = cancel ? kPollMillis : -1;
+        if (!reaped && pid_fd.get() < 0) {
+            timeout = eof ? kReapCheckMillis : std::min(kPollMillis, 4 * kReapCheckMillis);
+        }
+        int r = count > 0 ? poll(pfds, count, timeout) : 0;
+        if (r < 0 && errno != EINTR) {
+            // Nothing to wait on any more: fall back to a short pause before looking again.
+            std::this_thread::sleep_for(std::chrono::milliseconds(kReapCheckMillis));
+        }
+        if (!eof && r > 0 && pfds[0].revents != 0) {
+            char buffer[4096];
+            ssize_t n = read(read_end.get(), buffer, sizeof buffer);
+            if (n > 0) {
+                splitter.Feed(buffer, static_cast<size_t>(n));
+            } else if (n == 0 || (errno != EAGAIN && errno != EINTR)) {
+                eof = true;
             }
-        } else {
-            std::this_thread::sleep_for(std::chrono::milliseconds(kPollMillis / 4));
         }
         if (!reaped) {
             reaped = TryReap(pid, &status);
             if (reaped && !eof) {
-                // Whatever of the group still holds the pipe open goes with its leader.
+                // Output the child wrote before it ended is still in the pipe: take it. Whatever
+                // of the group still holds the pipe open then goes with its leader.
+                DrainAvailable(read_end.get(), &splitter);
                 if (GroupAlive(pid)) {
                     kill(-pid, SIGKILL);
                 }
