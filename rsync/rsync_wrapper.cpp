@@ -210,6 +210,10 @@ void RsyncWrapper::Impl::ConnectionOptions(std::vector<std::string>* argv) const
         if (connectTimeout > 0) {
             argv->push_back("--contimeout=" + std::to_string(connectTimeout));
         }
+        // The daemon protocol trades many small messages; with Nagle's algorithm each one that
+        // follows an unacknowledged one waits for the peer's delayed ACK (40 ms and more), four
+        // times in a plain run and more in a command. The receiver sets the same on its side.
+        argv->push_back("--sockopts=TCP_NODELAY");
         return;
     }
     // rsync splits this at blanks itself; every piece was checked to hold no blank or quote.
