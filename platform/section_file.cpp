@@ -211,7 +211,8 @@ bool SectionDoc::Parse(const std::string& text, int& bad_line) {
             bad_line = number;
             return false;
         }
-        Line line{Line::kBlank, std::string(begin, raw_end), std::string(), std::string()};
+        Line line;
+        line.raw.assign(begin, raw_end);
         const char* first = begin;
         const char* last = raw_end;
         trim(first, last);
@@ -228,8 +229,9 @@ bool SectionDoc::Parse(const std::string& text, int& bad_line) {
                 return false;
             }
             line.kind = Line::kHeader;
-            line.name.assign(name, name_end);
-            headers_.emplace(line.name, lines_.size());
+            line.name_at = static_cast<size_t>(name - begin);
+            line.name_size = static_cast<size_t>(name_end - name);
+            headers_.emplace(line.name(), lines_.size());
             in_section = true;
         } else {
             const char* eq = static_cast<const char*>(std::memchr(first, '=', last - first));
@@ -258,8 +260,10 @@ bool SectionDoc::Parse(const std::string& text, int& bad_line) {
                 --value_end;
             }
             line.kind = Line::kPair;
-            line.name.assign(key, key_end);
-            line.value.assign(value, value_end);
+            line.name_at = static_cast<size_t>(key - begin);
+            line.name_size = static_cast<size_t>(key_end - key);
+            line.value_at = static_cast<size_t>(value - begin);
+            line.value_size = static_cast<size_t>(value_end - value);
         }
         lines_.push_back(std::move(line));
     }
@@ -277,11 +281,23 @@ std::string SectionDoc::Serialize() const {
 }
 
 SectionDoc::Line SectionDoc::MakePair(const std::string& key, const std::string& value) {
-    return Line{Line::kPair, "\t" + key + "=\"" + value + "\"", key, value};
+    Line line;
+    line.kind = Line::kPair;
+    line.raw = "\t" + key + "=\"" + value + "\"";
+    line.name_at = 1;
+    line.name_size = key.size();
+    line.value_at = key.size() + 3;
+    line.value_size = value.size();
+    return line;
 }
 
 SectionDoc::Line SectionDoc::MakeHeader(const std::string& name) {
-    return Line{Line::kHeader, "[" + name + "]", name, std::string()};
+    Line line;
+    line.kind = Line::kHeader;
+    line.raw = "[" + name + "]";
+    line.name_at = 1;
+    line.name_size = name.size();
+    return line;
 }
 
 void SectionDoc::DropIndex() {
@@ -295,7 +311,7 @@ int SectionDoc::FindHeader(const std::string& name) const {
         return it == headers_.end() ? -1 : static_cast<int>(it->second);
     }
     for (size_t i = 0; i < lines_.size(); ++i) {
-        if (lines_[i].kind == Line::kHeader && lines_[i].name == name) {
+        if (lines_[i].kind == Line::kHeader && lines_[i].name() == name) {
             return static_cast<int>(i);
         }
     }
@@ -314,7 +330,7 @@ std::vector<std::string> SectionDoc::SectionNames() const {
     std::vector<std::string> names;
     for (const Line& line : lines_) {
         if (line.kind == Line::kHeader) {
-            names.push_back(line.name);
+            names.emplace_back(line.name());
         }
     }
     return names;
@@ -333,10 +349,10 @@ Pairs SectionDoc::SectionPairs(const std::string& name) const {
         }
         bool seen = false;
         for (const auto& pair : pairs) {
-            seen = seen || pair.first == lines_[i].name;
+            seen = seen || lines_[i].name() == pair.first;
         }
         if (!seen) {
-            pairs.emplace_back(lines_[i].name, lines_[i].value);
+            pairs.emplace_back(lines_[i].name(), lines_[i].value());
         }
     }
     return pairs;
@@ -350,8 +366,8 @@ bool SectionDoc::GetValue(const std::string& section, const std::string& key,
     }
     size_t end = SectionEnd(static_cast<size_t>(header));
     for (size_t i = static_cast<size_t>(header) + 1; i < end; ++i) {
-        if (lines_[i].kind == Line::kPair && lines_[i].name == key) {
-            value = lines_[i].value;
+        if (lines_[i].kind == Line::kPair && lines_[i].name() == key) {
+            value = lines_[i].value();
             return true;
         }
     }
@@ -374,7 +390,7 @@ bool SectionDoc::SetPairs(const std::string& name, const Pairs& pairs, bool add_
                 continue;
             }
             insert_at = i + 1;
-            if (lines_[i].name == pair.first) {
+            if (lines_[i].name() == pair.first) {
                 lines_[i] = MakePair(pair.first, pair.second);
                 found = true;
                 break;

@@ -7,6 +7,7 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <utility>
 #include <vector>
@@ -42,12 +43,22 @@ class SectionDoc {
     bool RemoveSection(const std::string& name);
 
   private:
+    // The name and value are pieces of the text as written, so a parsed line costs one string.
     struct Line {
         enum Kind { kBlank, kComment, kHeader, kPair };
-        Kind kind;
-        std::string raw;    // the text as written, without its newline
-        std::string name;   // section name (header) or key (pair)
-        std::string value;  // pair value
+        Kind kind = kBlank;
+        std::string raw;  // the text as written, without its newline
+        size_t name_at = 0;
+        size_t name_size = 0;
+        size_t value_at = 0;
+        size_t value_size = 0;
+
+        // Section name (header) or key (pair).
+        std::string_view name() const { return std::string_view(raw).substr(name_at, name_size); }
+        // Pair value.
+        std::string_view value() const {
+            return std::string_view(raw).substr(value_at, value_size);
+        }
     };
     static Line MakePair(const std::string& key, const std::string& value);
     static Line MakeHeader(const std::string& name);
