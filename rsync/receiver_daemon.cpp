@@ -5,6 +5,7 @@
 #include <fcntl.h>
 #include <netinet/in.h>
 #include <poll.h>
+#include <pwd.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -461,6 +462,18 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
     }
     MakeDirs(spool + "/replies", 0700);
     MakeDirs(spool + "/conns", 0700);
+    // The command module reads replies as an unprivileged user that may enter the replies
+    // directory but not list it: a reply is read by its token only. Nobody else gets past the
+    // spool itself.
+    if (chmod(spool.c_str(), 0700) != 0 || chmod((spool + "/replies").c_str(), 0711) != 0) {
+        return Fail(error, "cannot set the modes of " + spool + ": " + strerror(errno));
+    }
+    uid_t readerUid = 65534;
+    gid_t readerGid = 65534;
+    if (const struct passwd* pw = getpwnam("nobody")) {
+        readerUid = pw->pw_uid;
+        readerGid = pw->pw_gid;
+    }
     MakeDirs(keys, 0700);
 
     std::ostringstream c;
@@ -494,9 +507,13 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
     c << "[" << S2S_COMMAND_MODULE << "]\n"
       << "\tpath = " << spool << "/replies\n"
       << "\tread only = yes\n"
-      << "\tearly exec = " << hook << "hook-early" << (s.oldServer ? " --old-server" : "") << "\n"
-      << "\tpre-xfer exec = " << hook << "hook-pre\n"
-      << "\tpost-xfer exec = " << hook << "hook-post\n\n";
+      << "\tuid = " << readerUid << "\n"
+      << "\tgid = " << readerGid
+      << "\n"
+      // One hook process per command: it answers, and a watcher it leaves removes the reply
+      // when the connection ends.
+      << "\tearly exec = " << hook << "hook-early" << (s.oldServer ? " --old-server" : "")
+      << "\n\n";
     c << "[" << S2S_KEY_MODULE << "]\n"
       << "\tpath = " << keys
       << "\n"
@@ -658,6 +675,8 @@ int ReceiverStop(std::string* error) {
             return Fail(error, "the daemon or its connections would not stop");
         }
     }
+    // Replies of the connections just ended (their watchers went with the daemon's group).
+    receiver_internal::RemoveFinishedReplies();
     unlink(S2SPath(S2S_PATH_RSYNCD_PID));
     if (SetEnabled(false) != 0) {
         return Fail(error, "cannot mark the service switched off in the pairing store");

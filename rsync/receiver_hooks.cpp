@@ -1,12 +1,22 @@
 // The command module's hooks, run by the rsync daemon for each connection. The spool holds
 //   replies/<token>/result, replies/<token>/output   the answer, pulled by the client's run
-//   conns/<RSYNC_PID>                                the token of that connection
-// The early hook answers; the pre-transfer hook lets a connection read only its own reply; the
-// post-transfer hook removes both. Entries of connections that never finished are removed by
-// later early hooks once they are older than any command may take.
+//   conns/<RSYNC_PID>                                the token of that connection and the
+//                                                    connection process's start time
+// The early hook answers and leaves a small watcher process that removes the reply and the
+// record the moment the connection process ends. The module reads as an unprivileged user from
+// a replies directory it may enter but not list, so a connection reads a reply only by its token.
+// What a watcher could not remove (the daemon was stopped, a kernel without pidfds) goes with a
+// later early hook: records of connections that have ended, and anything older than any command
+// may take.
+//
+// The pre- and post-transfer hooks did that work in configurations written by earlier versions;
+// they are kept for those until the next configure.
 #include <dirent.h>
 #include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -17,8 +27,10 @@
 #include <fstream>
 #include <sstream>
 #include <string>
+#include <vector>
 
 #include "rsync/command_reply.h"
+#include "rsync/receiver_internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_receiver.h"
@@ -47,13 +59,15 @@ std::string ConnectionId() {
     return v;
 }
 
-bool WriteNew(const std::string& path, const std::string& content) {
-    int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0600);
+// The module's unprivileged user reads replies: files are world-readable, and the spool above
+// them (mode 0700) keeps local users out.
+bool WriteNew(const std::string& path, const std::string& content, mode_t mode) {
+    int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, mode);
     if (fd < 0) {
         return false;
     }
+    bool ok = fchmod(fd, mode) == 0;
     size_t done = 0;
-    bool ok = true;
     while (ok && done < content.size()) {
         ssize_t n = write(fd, content.data() + done, content.size() - done);
         if (n < 0 && errno == EINTR) {
@@ -65,6 +79,30 @@ bool WriteNew(const std::string& path, const std::string& content) {
         }
     }
     return close(fd) == 0 && ok;
+}
+
+// The start time of process `pid` in clock ticks since boot ("" when it has ended):
+// with the pid it names one process for good, whatever pid reuse does later.
+std::string ProcessStart(const std::string& pid) {
+    std::ifstream in("/proc/" + pid + "/stat");
+    std::string stat;
+    if (!std::getline(in, stat)) {
+        return std::string();
+    }
+    size_t paren = stat.rfind(')');
+    if (paren == std::string::npos) {
+        return std::string();
+    }
+    std::istringstream fields(stat.substr(paren + 1));
+    std::string field;
+    // After the name: state is field 3, starttime field 22. A zombie has ended: it only waits
+    // for its new parent to collect it.
+    for (int i = 3; i <= 22; ++i) {
+        if (!(fields >> field) || (i == 3 && (field == "Z" || field == "X"))) {
+            return std::string();
+        }
+    }
+    return field;
 }
 
 std::string TokenOf(const std::string& conn) {
@@ -94,10 +132,90 @@ void RemoveStale(const std::string& dir) {
     closedir(d);
 }
 
+// Removes the reply that connection record `conn` names, and the record.
+void RemoveConnection(const std::string& conn) {
+    std::string token = TokenOf(conn);
+    if (!token.empty()) {
+        command_reply::RemoveTree(Spool() + "/replies/" + token);
+    }
+    unlink((Spool() + "/conns/" + conn).c_str());
+}
+
+// Leaves a process behind that waits for the connection process to end and then removes the
+// reply and the record. It holds none of the hook's descriptors (the daemon waits for nothing of
+// it) and, being forked from a process that may have threads, makes only async-signal-safe calls.
+void WatchConnection(const std::string& conn, const std::string& token) {
+    int pidfd = static_cast<int>(syscall(SYS_pidfd_open, std::atoi(conn.c_str()), 0));
+    if (pidfd < 0) {
+        return;  // a later early hook removes it
+    }
+    const std::string dir = Spool() + "/replies/" + token;
+    const std::string result = dir + "/" + command_reply::kResultFile;
+    const std::string output = dir + "/" + command_reply::kOutputFile;
+    const std::string record = Spool() + "/conns/" + conn;
+    pid_t pid = fork();
+    if (pid == 0) {
+        int devnull = open("/dev/null", O_RDWR | O_CLOEXEC);
+        for (int fd = 0; fd < 3; ++fd) {
+            dup2(devnull, fd);
+        }
+        for (int fd = 3; fd < 1024; ++fd) {
+            if (fd != pidfd) {
+                close(fd);
+            }
+        }
+        // Not the client's interrupt or hang-up: only the connection's end (or a stop of the
+        // daemon, which ends its whole group) ends the watcher.
+        signal(SIGHUP, SIG_IGN);
+        signal(SIGINT, SIG_IGN);
+        struct pollfd pfd = {pidfd, POLLIN, 0};
+        while (poll(&pfd, 1, -1) < 0 && errno == EINTR) {
+        }
+        unlink(result.c_str());
+        unlink(output.c_str());
+        rmdir(dir.c_str());
+        unlink(record.c_str());
+        _exit(0);
+    }
+    close(pidfd);
+}
+
 }  // namespace
+
+namespace receiver_internal {
+
+void RemoveFinishedReplies() {
+    const std::string conns = Spool() + "/conns";
+    DIR* d = opendir(conns.c_str());
+    if (d == nullptr) {
+        return;
+    }
+    std::vector<std::string> ended;
+    while (struct dirent* e = readdir(d)) {
+        std::string conn = e->d_name;
+        if (conn.empty() || conn.find_first_not_of("0123456789") != std::string::npos) {
+            continue;
+        }
+        std::ifstream in(conns + "/" + conn);
+        std::string token;
+        std::string start;
+        // A record without a start time was written by an earlier version: its age decides.
+        if (std::getline(in, token) && std::getline(in, start) && !start.empty() &&
+            ProcessStart(conn) != start) {
+            ended.push_back(conn);
+        }
+    }
+    closedir(d);
+    for (const auto& conn : ended) {
+        RemoveConnection(conn);
+    }
+}
+
+}  // namespace receiver_internal
 
 int ReceiverHookEarly(int in_fd, bool oldServer) {
     const std::string spool = Spool();
+    receiver_internal::RemoveFinishedReplies();
     RemoveStale(spool + "/replies");
     RemoveStale(spool + "/conns");
 
@@ -116,34 +234,42 @@ int ReceiverHookEarly(int in_fd, bool oldServer) {
         input.append(buffer, static_cast<size_t>(n));
     }
     std::string conn = ConnectionId();
+    std::string start = conn.empty() ? std::string() : ProcessStart(conn);
     ReceiverAnswer answer = ReceiverRunCommand(input, oldServer);
-    if (answer.token.empty() || conn.empty()) {
+    if (answer.token.empty() || conn.empty() || start.empty()) {
         Logger::LogMsg(Logger::Error,
-                       "[ERROR] receiver_hooks.cpp(%d): command without reply token refused\n",
+                       "[ERROR] receiver_hooks.cpp(%d): command without reply token or "
+                       "connection refused\n",
                        __LINE__);
         return 1;
     }
     const std::string dir = spool + "/replies/" + answer.token;
     // An existing directory means a replayed or colliding token: never answer into it.
-    if (mkdir(dir.c_str(), 0700) != 0) {
+    if (mkdir(dir.c_str(), 0755) != 0) {
         Logger::LogMsg(Logger::Error, "[ERROR] receiver_hooks.cpp(%d): cannot create reply: %s\n",
                        __LINE__, strerror(errno));
         return 1;
     }
-    bool ok = true;
+    bool ok = chmod(dir.c_str(), 0755) == 0;
     if (answer.hasOutput) {
-        ok = answer.output.size() <= command_reply::kMaxOutput &&
-             WriteNew(dir + "/" + command_reply::kOutputFile, answer.output);
+        ok = ok && answer.output.size() <= command_reply::kMaxOutput &&
+             WriteNew(dir + "/" + command_reply::kOutputFile, answer.output, 0644);
     }
-    ok = ok &&
-         WriteNew(dir + "/" + command_reply::kResultFile, std::to_string(answer.result) + "\n");
-    ok = ok && WriteNew(spool + "/conns/" + conn, answer.token + "\n");
+    ok = ok && WriteNew(dir + "/" + command_reply::kResultFile,
+                        std::to_string(answer.result) + "\n", 0644);
+    // A record left by an ended connection whose pid came round again is replaced.
+    const std::string record = spool + "/conns/" + conn;
+    if (ok && !TokenOf(conn).empty()) {
+        RemoveConnection(conn);
+    }
+    ok = ok && WriteNew(record, answer.token + "\n" + start + "\n", 0600);
     if (!ok) {
         command_reply::RemoveTree(dir);
         Logger::LogMsg(Logger::Error, "[ERROR] receiver_hooks.cpp(%d): cannot write reply\n",
                        __LINE__);
         return 1;
     }
+    WatchConnection(conn, answer.token);
     return 0;
 }
 
@@ -165,11 +291,7 @@ int ReceiverHookPost() {
     if (conn.empty()) {
         return 1;
     }
-    std::string token = TokenOf(conn);
-    if (!token.empty()) {
-        command_reply::RemoveTree(Spool() + "/replies/" + token);
-    }
-    unlink((Spool() + "/conns/" + conn).c_str());
+    RemoveConnection(conn);
     return 0;
 }
 

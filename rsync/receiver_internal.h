@@ -20,6 +20,10 @@ bool ValidTaskName(const std::string& name);
 int ParseCommandFile(const std::string& input, std::string* token,
                      std::map<std::string, std::string>* pairs);
 
+// Removes the replies (and records) of connections that have ended: the command module's early
+// hook does it before it answers, a stop once the daemon's processes are gone.
+void RemoveFinishedReplies();
+
 // 1 when the share registry has the share (`*encrypted` set), 0 when not, -1 on failure.
 int ShareEncrypted(const std::string& name, bool* encrypted);
 

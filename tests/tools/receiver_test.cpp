@@ -2,8 +2,10 @@
 // files, pairing with conflicts, old-server answers, share binding, heartbeats), the command
 // module's hooks, and the program's configure / start / status / stop against a real daemon.
 #include <fcntl.h>
+#include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <netinet/in.h>
@@ -80,6 +82,11 @@ std::string ShareState(const std::string& name) {
         }
     }
     return "free";
+}
+
+bool IsThere(const std::string& path) {
+    struct stat st;
+    return lstat(path.c_str(), &st) == 0;
 }
 
 // Alive and not merely a zombie waiting for its new parent to reap it.
@@ -268,12 +275,38 @@ TEST_F(Handlers, OldServerAnswersLikeOne) {
     EXPECT_EQ(MultiPair("B", "photos", &out), 214);
 }
 
-// The early hook writes only below the spool, only under a valid token, and never twice into one
-// reply.
+// A stand-in for a daemon connection process: alive until End().
+class Connection {
+  public:
+    Connection() {
+        pid_ = fork();
+        if (pid_ == 0) {
+            pause();
+            _exit(0);
+        }
+    }
+    ~Connection() { End(); }
+    Connection(const Connection&) = delete;
+    Connection& operator=(const Connection&) = delete;
+    std::string Id() const { return std::to_string(pid_); }
+    void End() {
+        if (pid_ > 0) {
+            kill(pid_, SIGKILL);
+            waitpid(pid_, nullptr, 0);
+            pid_ = -1;
+        }
+    }
+
+  private:
+    pid_t pid_ = -1;
+};
+
+// The early hook writes only below the spool, only under a valid token, never twice into one
+// reply, and its reply goes the moment its connection ends.
 TEST_F(Handlers, EarlyHookAnswersIntoTheSpoolOnly) {
     ASSERT_EQ(server_.Configure().status, 0);
-    auto hook = [](const std::string& input, const char* conn) {
-        s2s_test::ScopedEnv pid("RSYNC_PID", conn);
+    auto hook = [](const std::string& input, const std::string& conn) {
+        s2s_test::ScopedEnv pid("RSYNC_PID", conn.c_str());
         int fds[2];
         EXPECT_EQ(pipe(fds), 0);
         EXPECT_EQ(write(fds[1], input.data(), input.size()), static_cast<ssize_t>(input.size()));
@@ -283,28 +316,56 @@ TEST_F(Handlers, EarlyHookAnswersIntoTheSpoolOnly) {
         return rc;
     };
     const std::string replies = server_.Spool() + "/replies";
+    const std::string conns = server_.Spool() + "/conns";
     std::string cmd = "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"\n";
-    EXPECT_EQ(hook("token=\"../../../../tmp/evil\"\n" + cmd, "100"), 1);
+    Connection first;
+    Connection second;
+    EXPECT_EQ(hook("token=\"../../../../tmp/evil\"\n" + cmd, first.Id()), 1);
     EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, "../x"), 1);
+    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, "999999999"), 1) << "no such connection";
     EXPECT_EQ(CountEntries(replies), 0u);
-    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, "101"), 0);
+    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, first.Id()), 0);
     EXPECT_EQ(s2s_test::ReadFile(replies + "/" + kToken + "/result"), "0\n");
     EXPECT_EQ(s2s_test::ReadFile(replies + "/" + kToken + "/output"), "1\n");
+    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, second.Id()), 1) << "a replayed token";
+
+    // The module's unprivileged reader may enter the replies but not list them; nobody else gets
+    // past the spool.
     struct stat st;
+    ASSERT_EQ(stat(server_.Spool().c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0700u);
+    ASSERT_EQ(stat(replies.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0711u);
     ASSERT_EQ(stat((replies + "/" + kToken + "/result").c_str(), &st), 0);
-    EXPECT_EQ(st.st_mode & 077, 0u);
-    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, "102"), 1) << "a replayed token";
+    EXPECT_EQ(st.st_mode & 0777, 0644u);
 
     {
-        s2s_test::ScopedEnv pid("RSYNC_PID", "101");
+        // The hooks of configurations written by earlier versions still work.
+        s2s_test::ScopedEnv pid("RSYNC_PID", first.Id().c_str());
         s2s_test::ScopedEnv other("RSYNC_REQUEST", "@s2s-cmd/ffffffffffffffffffffffffffffffff/");
         EXPECT_NE(S2S::ReceiverHookPre(), 0) << "another connection's reply";
         s2s_test::ScopedEnv own("RSYNC_REQUEST", ("@s2s-cmd/" + kToken + "/").c_str());
         EXPECT_EQ(S2S::ReceiverHookPre(), 0);
-        EXPECT_EQ(S2S::ReceiverHookPost(), 0);
     }
-    EXPECT_EQ(CountEntries(replies), 0u);
-    EXPECT_EQ(CountEntries(server_.Spool() + "/conns"), 0u);
+
+    // The watcher the hook left removes reply and record as soon as the connection ends.
+    EXPECT_EQ(CountEntries(conns), 1u);
+    first.End();
+    EXPECT_TRUE(
+        s2s_test::WaitFor([&] { return CountEntries(replies) == 0 && CountEntries(conns) == 0; }));
+
+    // A record whose connection has ended (its watcher gone with a stopped daemon) goes with the
+    // next command.
+    const std::string other = "fedcba9876543210fedcba9876543210";
+    wrapper_test::MakeDirs(replies + "/" + other);
+    s2s_test::WriteFile(replies + "/" + other + "/result", "0\n");
+    s2s_test::WriteFile(conns + "/" + second.Id(), other + "\n1\n");
+    EXPECT_EQ(hook("token=\"" + kToken + "\"\n" + cmd, second.Id()), 0);
+    EXPECT_FALSE(IsThere(replies + "/" + other)) << "the ended connection's reply stayed";
+    EXPECT_EQ(s2s_test::ReadFile(replies + "/" + kToken + "/result"), "0\n");
+    second.End();
+    EXPECT_TRUE(
+        s2s_test::WaitFor([&] { return CountEntries(replies) == 0 && CountEntries(conns) == 0; }));
 }
 
 TEST(ReceiverTool, ConfigureWritesModulesAndAPrivateSecret) {
@@ -426,6 +487,48 @@ TEST(ReceiverTool, StopEndsTheDaemonsConnections) {
     }
     EXPECT_NE(access((server.Root() + "/var/run/rsyncd.pid").c_str(), F_OK), 0);
     EXPECT_EQ(server.Tool({"stop"}).status, 0);
+}
+
+// A client that sends a valid command but then asks for the whole command module (to learn
+// other clients' tokens) or for a pattern gets nothing: the module reads as an unprivileged user
+// that cannot list the replies. Its own reply it reads by its token.
+TEST(ReceiverTool, CommandModuleServesRepliesByTokenOnly) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "the daemon needs root";
+    }
+    Server server;
+    ASSERT_EQ(server.Start(), "");
+    const std::string secret = "0badc0de0badc0de0badc0de0badc0de";
+    wrapper_test::MakeDirs(server.Spool() + "/replies/" + secret);
+    s2s_test::WriteFile(server.Spool() + "/replies/" + secret + "/output", "conflicts\n");
+    chmod((server.Spool() + "/replies/" + secret + "/output").c_str(), 0644);
+
+    s2s_test::ScopedEnv password("RSYNC_PASSWORD", server.Password().c_str());
+    const std::string base =
+        "rsync://" + server.User() + "@127.0.0.1:" + std::to_string(server.Port()) + "/@s2s-cmd/";
+    int n = 0;
+    auto ask = [&](const std::string& request) {
+        const std::string token = "00000000000000000000000000000" + std::to_string(100 + n);
+        const std::string input = server.Root() + "/input" + std::to_string(n);
+        const std::string dest = server.Root() + "/got" + std::to_string(n++);
+        s2s_test::WriteFile(input, "token=\"" + token +
+                                       "\"\ncommand=\"S2S_GetProtocolVer\"\nclientID=\"A\"\n"
+                                       "outfile=\"/x\"\n");
+        std::string path = request == "own" ? token + "/" : request;
+        wrapper_test::Run r = wrapper_test::RunProgram(
+            {"/usr/bin/rsync", "-r", "--early-input=" + input, base + path, dest + "/"});
+        EXPECT_EQ(r.output.find(secret), std::string::npos) << r.output;
+        return std::make_pair(r.status, CountEntries(dest));
+    };
+    auto listed = ask("");
+    EXPECT_NE(listed.first, 0);
+    EXPECT_EQ(listed.second, 0u) << "the command module was listed";
+    auto pattern = ask("*");
+    EXPECT_NE(pattern.first, 0);
+    EXPECT_EQ(pattern.second, 0u);
+    auto own = ask("own");
+    EXPECT_EQ(own.first, 0);
+    EXPECT_EQ(own.second, 2u) << "result and output";
 }
 
 TEST(ReceiverTool, StartFailsWhenThePortIsTaken) {
