@@ -176,8 +176,35 @@ int CheckShares(const std::vector<std::string>& shares, const std::string& clien
     return rc;
 }
 
+// True when `section` of the store already holds every pair of `kv`. Every store write is a
+// synced rewrite of the file, so a write that would change nothing is skipped: a resync sends the
+// same pairing, start and finish each time. False (write) when the store cannot be read.
+bool StoreHolds(const std::string& section,
+                const std::vector<std::pair<const char*, std::string>>& kv) {
+    Hash h = NewHash();
+    if (!h) {
+        return false;
+    }
+    VLIBSzHash* raw = h.release();
+    int rc = S2SGetServerInfo(section.c_str(), &raw);
+    h.reset(raw);
+    if (rc <= 0) {
+        return false;
+    }
+    for (const auto& p : kv) {
+        const char* v = VLIBCSzHashGetValue(h.get(), p.first);
+        if (v == nullptr || p.second != v) {
+            return false;
+        }
+    }
+    return true;
+}
+
 int UpdateShare(const std::string& share,
                 const std::vector<std::pair<const char*, std::string>>& kv) {
+    if (StoreHolds("SHARE_" + share, kv)) {
+        return kReceiverOK;
+    }
     Hash h = NewHash();
     if (!h) {
         return kReceiverInternal;
@@ -205,6 +232,11 @@ int RecordMultiClient(const std::string& clientID, const std::string& serverName
     int old = S2SServerIfOldClientPaired();
     if (old < 0) {
         return kReceiverStoreRead;
+    }
+    if (old == 0 && StoreHolds("CLIENTID_" + clientID, {{"ServerName", serverName}}) &&
+        StoreHolds("PairedClientInfo",
+                   {{"clientID", kMultiMarker}, {"serverName", kMultiMarker}})) {
+        return kReceiverOK;
     }
     if (old == 1 && s2s_svr_reset_pair() != 0) {
         return kReceiverStoreWrite;

@@ -216,6 +216,58 @@ TEST_F(Handlers, MultiSourcePairingReportsConflictsAndBindsShares) {
     EXPECT_TRUE(st.busy);
 }
 
+// Every store write is a synced rewrite of the whole file. A resync repeats pairing, start and
+// finish with the same values: those leave the file alone; only what changes is written.
+TEST_F(Handlers, CommandsThatChangeNothingLeaveTheStoreAlone) {
+    const std::string store = S2SPath(S2S_PATH_PAIRING_STORE);
+    // A rewrite is a new file renamed over the old one: a new change time (the inode number alone
+    // may come round again).
+    auto version = [&] {
+        struct stat st;
+        if (stat(store.c_str(), &st) != 0) {
+            return std::string();
+        }
+        return std::to_string(st.st_ino) + ":" + std::to_string(st.st_ctim.tv_sec) + "." +
+               std::to_string(st.st_ctim.tv_nsec);
+    };
+    std::string out;
+    ASSERT_EQ(MultiPair("A", "photos", &out), 0);
+    ASSERT_EQ(Start("A", "photos"), 0);
+    ASSERT_EQ(Finish("A", "complete", "photos"), 0);
+    const auto written = version();
+    ASSERT_NE(written, "");
+
+    EXPECT_EQ(MultiPair("A", "photos", &out), 0);
+    EXPECT_EQ(Start("A", "photos"), 0);
+    EXPECT_EQ(Finish("A", "complete", "photos"), 0);
+    EXPECT_EQ(Finish("A", "abort", "photos"), 0);
+    EXPECT_EQ(version(), written) << "a command that changes nothing rewrote the store";
+    EXPECT_EQ(ShareState("photos"), "completed A");
+
+    EXPECT_EQ(MultiPair("A", "photos", &out, false), 0);
+    EXPECT_EQ(Cmd("A", "S2S_PairingMultiSrc",
+                  {{"serverName", "renamed"},
+                   {"syncShares", "photos"},
+                   {"dryRun", "no"},
+                   {"outfile", "/x"}})
+                  .result,
+              0);
+    const auto renamed = version();
+    EXPECT_NE(renamed, written) << "a new server name must be stored";
+    S2S::ReceiverStatus st;
+    ASSERT_EQ(S2S::ReceiverGetStatus(&st), 0);
+    ASSERT_EQ(st.clients.size(), 1u);
+    EXPECT_EQ(st.clients[0].serverName, "renamed");
+
+    EXPECT_EQ(Start("B", "docs"), 208);
+    EXPECT_EQ(Start("A", "docs"), 0) << "a share bound for the first time";
+    EXPECT_NE(version(), renamed);
+    EXPECT_EQ(ShareState("docs"), "running A");
+    const auto started = version();
+    EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "t"}}), 0);
+    EXPECT_NE(version(), started) << "the heartbeat is written every time";
+}
+
 TEST_F(Handlers, SyncStartChecksShareAndAttributes) {
     ASSERT_EQ(Code("A", "S2S_Pairing", {{"dryRun", "no"}, {"serverName", "host-a"}}), 0);
     auto attrs = [](const std::string& share, const std::string& enc) {
