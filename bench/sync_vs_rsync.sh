@@ -1,13 +1,16 @@
 #!/usr/bin/env bash
 # Benchmark: `s2s sync` against a plain `rsync -a --delete` of the same generated tree to the same
-# rsync daemon (s2s-receiver's), in one run: a full copy into an empty share, then a run with
-# nothing changed. Prints the times and the ratios s2s / rsync, and how much of s2s's time went to
-# its control commands (server test, pairing, share start and finish, status beacon).
+# rsync daemon (s2s-receiver's): a full copy into an empty share, then a run with nothing changed.
+# Both tools run side by side in every round (the order alternates), the targets are emptied
+# between rounds, and the medians are compared, so that a busy machine skews both alike. Prints
+# the times and the ratios s2s / rsync, and how much of s2s's time went to its control commands
+# (server test, pairing, share start and finish, status beacon).
 #
 # Usage: bash bench/sync_vs_rsync.sh            (needs root: private network namespace)
-#   S2S_BENCH_FILES  number of files (default 5000)
-#   S2S_BENCH_MB     total size in MiB (default 1024)
-#   S2S_BUILD_DIR    build directory holding bin/s2s and bin/s2s-receiver (default build)
+#   S2S_BENCH_FILES   number of files (default 5000)
+#   S2S_BENCH_MB      total size in MiB (default 1024)
+#   S2S_BENCH_ROUNDS  rounds of full + no-change runs of both tools (default 3)
+#   S2S_BUILD_DIR     build directory holding bin/s2s and bin/s2s-receiver (default build)
 set -euo pipefail
 cd "$(dirname "$0")/.."
 repo=$(pwd)
@@ -83,25 +86,46 @@ run_rsync() {
   awk -v a="$start" -v b="$end" 'BEGIN { printf "%.3f", b - a }'
 }
 
-rsync_full=$(run_rsync)
-s2s_full=$(run_s2s full)
-rsync_same=$(run_rsync)
-s2s_same=$(run_s2s same)
-if ! diff -rq "$sender/volume1/data" "$receiver/volume1/data" >/dev/null; then
-  echo "bench: the s2s copy differs from the source" >&2
-  exit 1
-fi
+rounds=${S2S_BENCH_ROUNDS:-3}
+declare -a rsync_full s2s_full rsync_same s2s_same copy_full copy_same
+for ((r = 0; r < rounds; r++)); do
+  if ((r > 0)); then
+    find "$receiver/volume1/data" "$receiver/volume1/plain" -mindepth 1 -delete
+    sync
+  fi
+  if ((r % 2 == 0)); then
+    rsync_full[r]=$(run_rsync)
+    s2s_full[r]=$(run_s2s full)
+    rsync_same[r]=$(run_rsync)
+    s2s_same[r]=$(run_s2s same)
+  else
+    s2s_full[r]=$(run_s2s full)
+    rsync_full[r]=$(run_rsync)
+    s2s_same[r]=$(run_s2s same)
+    rsync_same[r]=$(run_rsync)
+  fi
+  copy_full[r]=$(field "$work/full.json" copy_seconds)
+  copy_same[r]=$(field "$work/same.json" copy_seconds)
+  if ! diff -rq "$sender/volume1/data" "$receiver/volume1/data" >/dev/null; then
+    echo "bench: the s2s copy differs from the source" >&2
+    exit 1
+  fi
+  echo "round $((r + 1)): full s2s ${s2s_full[r]}s rsync ${rsync_full[r]}s;" \
+    "no change s2s ${s2s_same[r]}s rsync ${rsync_same[r]}s"
+done
+median() { printf '%s\n' "$@" | sort -g | awk '{ v[NR] = $1 } END {
+  printf "%.3f", NR % 2 ? v[(NR + 1) / 2] : (v[NR / 2] + v[NR / 2 + 1]) / 2 }'; }
 
-report() {  # label s2s rsync json
-  local copy overhead
-  copy=$(field "$4" copy_seconds)
-  overhead=$(awk -v t="$2" -v c="$copy" 'BEGIN { printf "%.3f", t - c }')
-  awk -v l="$1" -v s="$2" -v r="$3" -v c="$copy" -v o="$overhead" 'BEGIN {
+report() {  # label s2s rsync copy
+  awk -v l="$1" -v s="$2" -v r="$3" -v c="$4" 'BEGIN {
     printf "%-10s s2s %8.3fs  rsync %8.3fs  ratio %5.2f  (s2s copy %.3fs, control commands %.3fs)\n",
-      l, s, r, s / r, c, o }'
+      l, s, r, s / r, c, s - c }'
 }
-echo "tree: $files files, $megabytes MiB; rsync $(rsync --version | awk 'NR == 1 { print $3 }')"
-report "full" "$s2s_full" "$rsync_full" "$work/full.json"
-report "no change" "$s2s_same" "$rsync_same" "$work/same.json"
-echo "control steps (s): full: $(sed -n '/^  "steps"/,/}/p' "$work/full.json" | tr -d ' \n')"
-echo "                   no change: $(sed -n '/^  "steps"/,/}/p' "$work/same.json" | tr -d ' \n')"
+echo "tree: $files files, $megabytes MiB; rsync $(rsync --version | awk 'NR == 1 { print $3 }');" \
+  "medians of $rounds rounds"
+report "full" "$(median "${s2s_full[@]}")" "$(median "${rsync_full[@]}")" \
+  "$(median "${copy_full[@]}")"
+report "no change" "$(median "${s2s_same[@]}")" "$(median "${rsync_same[@]}")" \
+  "$(median "${copy_same[@]}")"
+echo "control steps (s), last round: full: $(sed -n '/^  "steps"/,/}/p' "$work/full.json" | tr -d ' \n')"
+echo "                                no change: $(sed -n '/^  "steps"/,/}/p' "$work/same.json" | tr -d ' \n')"
