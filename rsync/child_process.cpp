@@ -310,9 +310,9 @@ ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& canc
         if (!reaped && pid_fd.get() < 0) {
             timeout = eof ? kReapCheckMillis : std::min(kPollMillis, 4 * kReapCheckMillis);
         }
-        int r = count > 0 ? poll(pfds, count, timeout) : 0;
+        // With nothing left to watch (output closed, no pidfd) this is a plain pause.
+        int r = poll(pfds, count, timeout);
         if (r < 0 && errno != EINTR) {
-            // Nothing to wait on any more: fall back to a short pause before looking again.
             std::this_thread::sleep_for(std::chrono::milliseconds(kReapCheckMillis));
         }
         if (!eof && r > 0 && pfds[0].revents != 0) {

@@ -157,7 +157,9 @@ void WatchConnection(const std::string& conn, const std::string& token) {
     if (pid == 0) {
         int devnull = open("/dev/null", O_RDWR | O_CLOEXEC);
         for (int fd = 0; fd < 3; ++fd) {
-            dup2(devnull, fd);
+            if (devnull < 0 || dup2(devnull, fd) < 0) {
+                close(fd);
+            }
         }
         for (int fd = 3; fd < 1024; ++fd) {
             if (fd != pidfd) {

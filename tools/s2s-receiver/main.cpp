@@ -18,7 +18,8 @@ const char kUsage[] =
     "usage: s2s-receiver configure --user NAME [--port N] [--address ADDR] [--old-server]\n"
     "           (the password is read from the first line of standard input)\n"
     "       s2s-receiver start | stop | status\n"
-    "       s2s-receiver hook-early [--old-server] | hook-pre | hook-post   (run by the daemon)\n";
+    "       s2s-receiver hook-early [--old-server]   (run by the daemon)\n"
+    "       s2s-receiver hook-pre | hook-post   (daemon configurations of earlier versions)\n";
 
 int Usage() {
     std::fputs(kUsage, stderr);
