@@ -502,8 +502,9 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
       << "socket options = TCP_NODELAY\n\n";
 
     // The hooks run through the daemon's shell: every value is single-quoted and was checked to
-    // hold no quote.
-    std::string hook = "S2S_ROOT=" + Quote(rootValue) + " " + Quote(s.handlerPath) + " ";
+    // hold no quote. The shell replaces itself with the handler instead of forking it.
+    std::string hook =
+        "S2S_ROOT=" + Quote(rootValue) + "; export S2S_ROOT; exec " + Quote(s.handlerPath) + " ";
     c << "[" << S2S_COMMAND_MODULE << "]\n"
       << "\tpath = " << spool << "/replies\n"
       << "\tread only = yes\n"

@@ -161,9 +161,14 @@ void WatchConnection(const std::string& conn, const std::string& token) {
                 close(fd);
             }
         }
-        for (int fd = 3; fd < 1024; ++fd) {
-            if (fd != pidfd) {
-                close(fd);
+        // Every descriptor but the pidfd; one call where the kernel has close_range.
+        bool closed = pidfd == 3 || close_range(3, static_cast<unsigned>(pidfd) - 1, 0) == 0;
+        closed = closed && close_range(static_cast<unsigned>(pidfd) + 1, ~0U, 0) == 0;
+        if (!closed) {
+            for (int fd = 3; fd < 1024; ++fd) {
+                if (fd != pidfd) {
+                    close(fd);
+                }
             }
         }
         // Not the client's interrupt or hang-up: only the connection's end (or a stop of the
