@@ -69,8 +69,11 @@ password_file=$work/password
 now() { date +%s.%N; }
 field() { sed -n "s/^  \"$2\": \([0-9.]*\),\{0,1\}$/\1/p" "$1"; }
 
+# Every run starts with the page cache written back, so that neither tool pays for the other's
+# writeback.
 run_s2s() {  # label
   local start end
+  sync
   start=$(now)
   S2S_ROOT=$sender "$bin/s2s" sync --server-ip 127.0.0.1 --user "$user" --share data \
     --password-file "$password_file" --name bench --json --quiet >"$work/$1.json"
@@ -79,6 +82,7 @@ run_s2s() {  # label
 }
 run_rsync() {
   local start end
+  sync
   start=$(now)
   RSYNC_PASSWORD=$password rsync -a --delete "$sender/volume1/data/" \
     "rsync://$user@127.0.0.1/plain/"
