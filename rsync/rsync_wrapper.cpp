@@ -417,7 +417,10 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     std::vector<std::string>& a = spec.argv;
     // --hard-links costs nothing measurable where there are no hard links (rsync tracks only files
     // with more than one link) and keeps them where there are: always asked for.
-    a = {"--recursive", "--links", "--perms", "--times", "--hard-links"};
+    // rsync's quick check compares whole seconds by default: a file rewritten with the same size
+    // within the second of the last run, and a folder's time, would be taken as unchanged. A
+    // negative window compares the nanoseconds too.
+    a = {"--recursive", "--links", "--perms", "--times", "--modify-window=-1", "--hard-links"};
     if (!listOnly && HoldsSparseFile(src)) {
         a.push_back("--sparse");
     }

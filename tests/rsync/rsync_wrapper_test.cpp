@@ -215,6 +215,46 @@ TEST_F(WrapperTest, DataRunsKeepMetadataAndFollowChanges) {
     EXPECT_EQ(got, expected);
 }
 
+// A file rewritten with the same size within the second of the previous run, and a folder whose
+// entries changed then, must still be mirrored: times are compared to the nanosecond.
+TEST_F(WrapperTest, ChangesWithinTheSameSecondAreNotMissed) {
+    const std::string src = local_.path() + "/share";
+    MakeDirs(src + "/dir");
+    auto setTime = [](const std::string& path, long nsec) {
+        struct timespec times[2] = {{1600000000, nsec}, {1600000000, nsec}};
+        ASSERT_EQ(utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW), 0) << path;
+    };
+    auto mtimeOf = [](const std::string& path) {
+        struct stat st;
+        EXPECT_EQ(lstat(path.c_str(), &st), 0) << path;
+        return std::make_pair(st.st_mtim.tv_sec, st.st_mtim.tv_nsec);
+    };
+    s2s_test::WriteFile(src + "/dir/same-size.txt", "first\n");
+    s2s_test::WriteFile(src + "/dir/gone.txt", "removed later\n");
+    setTime(src + "/dir/same-size.txt", 100000000);
+    setTime(src + "/dir", 100000000);
+    auto run = [&]() {
+        RsyncWrapper w;
+        w.setDelete(true);
+        w.setNumericIds(true);
+        w.setVurnPseudoRoot(true);
+        w.setSrcPath(src + "/");
+        server_->Aim(w, "docs");
+        EXPECT_EQ(w.execute(boost::function<bool()>()), 0) << w.lastError();
+    };
+    run();
+    const std::string dst = server_->SharePath("docs");
+    s2s_test::WriteFile(src + "/dir/same-size.txt", "later\n");
+    unlink((src + "/dir/gone.txt").c_str());
+    setTime(src + "/dir/same-size.txt", 900000000);
+    setTime(src + "/dir", 900000000);
+    run();
+    EXPECT_EQ(s2s_test::ReadFile(dst + "/dir/same-size.txt"), "later\n");
+    EXPECT_EQ(mtimeOf(dst + "/dir/same-size.txt"), mtimeOf(src + "/dir/same-size.txt"));
+    EXPECT_EQ(mtimeOf(dst + "/dir"), mtimeOf(src + "/dir"));
+    EXPECT_NE(access((dst + "/dir/gone.txt").c_str(), F_OK), 0);
+}
+
 // rsync's own overall figure counts the bytes it moved, so a run that sends little of a large
 // tree ends far below 100; a complete run must still end at 100, a failed one never.
 TEST_F(WrapperTest, ProgressEndsAtHundredOnlyWhenTheRunSucceeds) {
