@@ -25,6 +25,7 @@
 #include <vector>
 
 #include "gtest/gtest.h"
+#include "rsync/child_process.h"
 #include "rsync/rsyncer_fixture.h"
 #include "s2s_host.h"
 #include "s2s_rsyncer.h"
@@ -401,6 +402,11 @@ bool CancelWhenTransferStarted() {
             closedir(d);
         }
     }
+    // On a fast machine the whole transfer can fit between two polls, so the run is stopped at the
+    // latest at the first poll after rsync started (the wrapper polls right after the start).
+    if (g_polls >= 1) {
+        g_cancel = true;
+    }
     return g_cancel;
 }
 
@@ -444,10 +450,11 @@ TEST_F(RsyncerServer, CancellationStopsALargeTransfer) {
     info.SetCompression(true);  // incompressible data through -z keeps the transfer going
     S2S::Rsyncer rsyncer;
     ASSERT_EQ(rsyncer.Initialize(info), 0);
-    rsyncer.SetCancelChecker(&CancelWhenTransferStarted);
     int result = -1;
     Lines conflicts;
     ASSERT_EQ(rsyncer.DoPairing(false, {"music"}, conflicts, result), 0);
+    rsyncer.SetCancelChecker(&CancelWhenTransferStarted);
+    g_polls = 0;
     const auto start = std::chrono::steady_clock::now();
     ASSERT_EQ(rsyncer.RunSync(1, "music", "/", {}, result), 0);
     const auto took = std::chrono::steady_clock::now() - start;
@@ -467,63 +474,54 @@ TEST_F(RsyncerServer, CancellationStopsALargeTransfer) {
     EXPECT_EQ(static_cast<size_t>(st.st_size), kBig);
 }
 
-// The command lines of the rsync processes each run started, read from /proc by the cancel
-// checker (which the wrapper calls right after starting rsync and then while it runs).
-std::vector<std::vector<std::string>> g_argvs;
-std::set<pid_t> g_seen;
+// The command lines of the rsync runs: an "rsync" first on PATH records its arguments (one run a
+// line, each argument ended by \x1f) and hands over to the real program. Reading /proc from the
+// cancel checker instead missed runs that ended before the first look.
+std::string g_argvLog;
 
-std::vector<std::string> CmdLine(pid_t pid) {
-    std::vector<std::string> args;
-    std::string raw = s2s_test::ReadFile("/proc/" + std::to_string(pid) + "/cmdline");
-    for (size_t start = 0; start < raw.size();) {
-        const size_t end = raw.find('\0', start);
-        args.push_back(raw.substr(start, end - start));
-        start = end == std::string::npos ? raw.size() : end + 1;
+std::vector<std::vector<std::string>> Argvs() {
+    std::vector<std::vector<std::string>> runs;
+    std::istringstream in(s2s_test::ReadFile(g_argvLog));
+    for (std::string line; std::getline(in, line);) {
+        std::vector<std::string> args;
+        for (size_t start = 0; start < line.size();) {
+            const size_t end = line.find('\x1f', start);
+            args.push_back(line.substr(start, end - start));
+            start = end == std::string::npos ? line.size() : end + 1;
+        }
+        runs.push_back(args);
     }
-    return args;
+    return runs;
 }
 
-std::vector<pid_t> Children() {
-    std::vector<pid_t> out;
-    DIR* proc = opendir("/proc");
-    const std::string self = std::to_string(getpid());
-    while (struct dirent* e = readdir(proc)) {
-        std::ifstream stat(std::string("/proc/") + e->d_name + "/stat");
-        std::string line;
-        if (!std::getline(stat, line) || line.rfind(')') == std::string::npos) {
-            continue;
-        }
-        std::istringstream rest(line.substr(line.rfind(')') + 2));
-        std::string state;
-        std::string ppid;
-        rest >> state >> ppid;
-        if (ppid == self && state != "Z") {
-            out.push_back(std::atoi(e->d_name));
-        }
-    }
-    closedir(proc);
-    return out;
+void ClearArgvs() {
+    s2s_test::WriteFile(g_argvLog, "");
 }
 
+// Puts the recording rsync first on PATH for the object's lifetime.
+class RecordingRsync {
+  public:
+    RecordingRsync() {
+        const std::string real = S2S::rsync_internal::FindProgram("rsync");
+        g_argvLog = dir_ / "argv.log";
+        const std::string shim = dir_ / "rsync";
+        s2s_test::WriteFile(
+            shim, "#!/bin/sh\nfor a in \"$@\"; do printf '%s\\037' \"$a\"; done >>'" + g_argvLog +
+                      "'\necho >>'" + g_argvLog + "'\nexec '" + real + "' \"$@\"\n");
+        chmod(shim.c_str(), 0755);
+        const char* old = std::getenv("PATH");
+        path_.reset(new s2s_test::ScopedEnv(
+            "PATH", (dir_.path() + ":" + (old != nullptr ? old : "/usr/bin:/bin")).c_str()));
+        ClearArgvs();
+    }
+
+  private:
+    s2s_test::TempDir dir_{"s2s-rsync-shim"};
+    std::unique_ptr<s2s_test::ScopedEnv> path_;
+};
+
+// The cancel checker every run polls; runs are recorded by the shim above.
 bool RecordRsyncArgv() {
-    for (pid_t pid : Children()) {
-        if (g_seen.count(pid) != 0) {
-            continue;
-        }
-        // The child may not have exec'd rsync yet: wait for it (bounded), it runs for far longer.
-        const bool found = s2s_test::WaitFor(
-            [pid] {
-                const std::vector<std::string> args = CmdLine(pid);
-                return args.empty() || (args[0].size() >= 5 &&
-                                        args[0].compare(args[0].size() - 5, 5, "rsync") == 0);
-            },
-            std::chrono::seconds(2));
-        const std::vector<std::string> args = CmdLine(pid);
-        if (found && !args.empty()) {
-            g_seen.insert(pid);
-            g_argvs.push_back(args);
-        }
-    }
     return false;
 }
 
@@ -545,8 +543,7 @@ bool HasPrefix(const std::vector<std::string>& args, const std::string& prefix) 
 // the source paths of RunSync and the share's module as destination.
 TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     StartServer();
-    g_argvs.clear();
-    g_seen.clear();
+    RecordingRsync recording;
     const std::string src = client_->Volume() + "/photos";
     rsyncer_test::MakeDirs(src + "/a");
     s2s_test::WriteFile(src + "/a/b", "b");
@@ -557,8 +554,8 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     S2S::Rsyncer rsyncer;
     rsyncer.SetCancelChecker(&RecordRsyncArgv);
     ASSERT_EQ(rsyncer.Initialize(info), 0);
-    ASSERT_EQ(g_argvs.size(), 2u);  // the dry-run pairing and the version query
-    for (const auto& args : g_argvs) {
+    ASSERT_EQ(Argvs().size(), 2u);  // the dry-run pairing and the version query
+    for (const auto& args : Argvs()) {
         EXPECT_TRUE(Contains(args, "--timeout=60"));
         EXPECT_FALSE(HasPrefix(args, "--rsh"));
         EXPECT_FALSE(HasPrefix(args, "--log-file"));
@@ -569,11 +566,11 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     int result = -1;
     Lines conflicts;
     ASSERT_EQ(rsyncer.DoPairing(false, {"photos"}, conflicts, result), 0);
-    g_argvs.clear();
+    ClearArgvs();
     ASSERT_EQ(rsyncer.RunSync(1, "photos", "/", {"*.tmp", "cache/"}, result), 0);
     ASSERT_EQ(result, 0);
-    ASSERT_EQ(g_argvs.size(), 1u);
-    std::vector<std::string> args = g_argvs[0];
+    ASSERT_EQ(Argvs().size(), 1u);
+    std::vector<std::string> args = Argvs()[0];
     for (const char* expected : {"--timeout=600", "--delete", "--numeric-ids", "--compress",
                                  "--whole-file", "--acls", "--exclude=*.tmp", "--exclude=cache/"}) {
         EXPECT_TRUE(Contains(args, expected)) << expected;
@@ -590,11 +587,11 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     S2S::Rsyncer delta;
     ASSERT_EQ(delta.Initialize(info), 0);
     delta.SetCancelChecker(&RecordRsyncArgv);
-    g_argvs.clear();
+    ClearArgvs();
     ASSERT_EQ(delta.RunSync(2, "photos", "/a/b", {}, result), 0);
     ASSERT_EQ(result, 0);
-    ASSERT_EQ(g_argvs.size(), 1u);
-    args = g_argvs[0];
+    ASSERT_EQ(Argvs().size(), 1u);
+    args = Argvs()[0];
     EXPECT_TRUE(Contains(args, "--relative"));
     EXPECT_TRUE(Contains(args, "--no-whole-file"));
     EXPECT_FALSE(Contains(args, "--compress"));
@@ -604,27 +601,28 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     // A test task runs without the debug log; with SSH the task's SSH port goes to ssh.
     S2S::Rsyncer::RsyncTask quiet;
     ASSERT_EQ(delta.InitRsyncTask(quiet, true), 0);
-    g_argvs.clear();
+    ClearArgvs();
     EXPECT_EQ(quiet.Execute(src + "/", "photos", &RecordRsyncArgv, "", {}), 0);
-    ASSERT_EQ(g_argvs.size(), 1u);
-    EXPECT_FALSE(HasPrefix(g_argvs[0], "--log-file"));
-    EXPECT_TRUE(Contains(g_argvs[0], "--timeout=600"));
+    ASSERT_EQ(Argvs().size(), 1u);
+    EXPECT_FALSE(HasPrefix(Argvs()[0], "--log-file"));
+    EXPECT_TRUE(Contains(Argvs()[0], "--timeout=600"));
 
     info.SetSSH(true);
     S2S::Rsyncer overSsh;
     overSsh.Initialize(info);  // no sshd here: only the command line matters
     S2S::Rsyncer::RsyncTask sshTask;
     ASSERT_EQ(overSsh.InitRsyncTask(sshTask, false), 0);
-    g_argvs.clear();
+    ClearArgvs();
     EXPECT_NE(
         sshTask.ExecuteCmd({"command=\"S2S_UpdateTaskStatus\"", "clientID=\"x\"", "taskName=\"t\""},
                            &RecordRsyncArgv),
         0);
-    ASSERT_EQ(g_argvs.size(), 1u);
-    EXPECT_TRUE(HasPrefix(g_argvs[0], "--rsh=sshpass -e ssh -p 2222 "));
-    EXPECT_FALSE(HasPrefix(g_argvs[0], "--log-file"));
-    EXPECT_TRUE(Contains(g_argvs[0], "--timeout=60"));
-    for (const auto& a : g_argvs[0]) {
+    ASSERT_EQ(Argvs().size(), 1u);
+    EXPECT_TRUE(HasPrefix(Argvs()[0], "--rsh=sshpass -e ssh -p 2222 "));
+    EXPECT_FALSE(HasPrefix(Argvs()[0], "--log-file"));
+    EXPECT_TRUE(Contains(Argvs()[0], "--timeout=60"));
+    const std::vector<std::string> sshArgs = Argvs()[0];
+    for (const auto& a : sshArgs) {
         EXPECT_EQ(a.find(kPassword), std::string::npos) << a;
     }
     EXPECT_EQ(LiveChildren(), 0u);
