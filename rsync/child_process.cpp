@@ -199,16 +199,16 @@ std::string FindProgram(const std::string& program) {
     return std::string();
 }
 
-ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& cancel,
+ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& cancel,
                       const LineSink& sink) {
     ChildOutcome outcome;
-    if (spec.argv.empty()) {
+    if (job.argv.empty()) {
         outcome.error = "no program given";
         return outcome;
     }
-    std::string program = FindProgram(spec.argv[0]);
+    std::string program = FindProgram(job.argv[0]);
     if (program.empty() || !IsExecutable(program)) {
-        outcome.error = "cannot find the program " + spec.argv[0];
+        outcome.error = "cannot find the program " + job.argv[0];
         return outcome;
     }
 
@@ -218,17 +218,17 @@ ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& canc
         std::string entry(*e);
         std::string name = entry.substr(0, entry.find('='));
         bool drop = false;
-        for (const auto& unset : spec.unset_env) {
+        for (const auto& unset : job.unset_env) {
             drop = drop || name == unset;
         }
-        for (const auto& set : spec.set_env) {
+        for (const auto& set : job.set_env) {
             drop = drop || name == set.first;
         }
         if (!drop) {
             env_strings.push_back(entry);
         }
     }
-    for (const auto& set : spec.set_env) {
+    for (const auto& set : job.set_env) {
         env_strings.push_back(set.first + "=" + set.second);
     }
     std::vector<char*> envp;
@@ -236,7 +236,7 @@ ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& canc
         envp.push_back(&s[0]);
     }
     envp.push_back(nullptr);
-    std::vector<std::string> argv_strings(spec.argv);
+    std::vector<std::string> argv_strings(job.argv);
     std::vector<char*> argv;
     for (auto& s : argv_strings) {
         argv.push_back(&s[0]);

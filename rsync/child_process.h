@@ -13,7 +13,7 @@
 namespace S2S {
 namespace rsync_internal {
 
-struct ChildSpec {
+struct ChildCommand {
     // argv[0] is the program: a path, or a name looked up in PATH.
     std::vector<std::string> argv;
     // Variables set (NAME, value) or removed (NAME, nullopt-like: removed when listed in `unset`)
@@ -34,7 +34,7 @@ struct ChildOutcome {
 typedef std::function<void(const std::string& line)> LineSink;
 
 // Polls `cancel` (when set) at least every 200 ms while the child runs.
-ChildOutcome RunChild(const ChildSpec& spec, const boost::function<bool()>& cancel,
+ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& cancel,
                       const LineSink& sink);
 
 // The absolute path of `program` (returned as is when it holds a '/'), or "" when PATH has none.

@@ -19,8 +19,8 @@ namespace Backup {
 namespace {
 
 using S2S::Logger;
+using S2S::rsync_internal::ChildCommand;
 using S2S::rsync_internal::ChildOutcome;
-using S2S::rsync_internal::ChildSpec;
 
 // Where the debug log of client runs goes, and the receiver's daemon configuration that a
 // one-shot daemon started over ssh reads (both below $S2S_ROOT when it is set).
@@ -313,18 +313,18 @@ void RsyncWrapper::Impl::ConnectionOptions(std::vector<std::string>* argv) const
     argv->push_back("--rsync-path=rsync --config=" + config);
 }
 
-void RsyncWrapper::Impl::Environment(ChildSpec* spec) const {
-    spec->unset_env = {"RSYNC_PASSWORD", "SSHPASS", "RSYNC_CONNECT_PROG", "RSYNC_RSH",
-                       "RSYNC_PROXY"};
+void RsyncWrapper::Impl::Environment(ChildCommand* job) const {
+    job->unset_env = {"RSYNC_PASSWORD", "SSHPASS", "RSYNC_CONNECT_PROG", "RSYNC_RSH",
+                      "RSYNC_PROXY"};
     if (auth && !password.empty()) {
-        spec->set_env.push_back(std::make_pair("RSYNC_PASSWORD", password));
+        job->set_env.push_back(std::make_pair("RSYNC_PASSWORD", password));
         if (ssh && identity.empty()) {
-            spec->set_env.push_back(std::make_pair("SSHPASS", password));
+            job->set_env.push_back(std::make_pair("SSHPASS", password));
         }
     }
 }
 
-int RsyncWrapper::Impl::Run(ChildSpec& spec, const boost::function<bool()>& cancel,
+int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& cancel,
                             bool commandRun) {
     std::list<std::string> errors;
     bool unknownCommandModule = false;
@@ -354,8 +354,8 @@ int RsyncWrapper::Impl::Run(ChildSpec& spec, const boost::function<bool()>& canc
             errors.pop_front();
         }
     };
-    spec.argv.insert(spec.argv.begin(), rsyncPath);
-    ChildOutcome outcome = S2S::rsync_internal::RunChild(spec, cancel, sink);
+    job.argv.insert(job.argv.begin(), rsyncPath);
+    ChildOutcome outcome = S2S::rsync_internal::RunChild(job, cancel, sink);
     lastError.clear();
     for (const auto& e : errors) {
         lastError += e + "\n";
@@ -413,8 +413,8 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
         return kResultUsage;
     }
 
-    ChildSpec spec;
-    std::vector<std::string>& a = spec.argv;
+    ChildCommand job;
+    std::vector<std::string>& a = job.argv;
     // --hard-links costs nothing measurable where there are no hard links (rsync tracks only files
     // with more than one link) and keeps them where there are: always asked for.
     // rsync's quick check compares whole seconds by default: a file rewritten with the same size
@@ -462,8 +462,8 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     a.push_back("--");
     a.push_back(src);
     a.push_back(Url(target));
-    Environment(&spec);
-    return Run(spec, cancel, false);
+    Environment(&job);
+    return Run(job, cancel, false);
 }
 
 RsyncWrapper::RsyncWrapper() : impl_(new Impl) {}

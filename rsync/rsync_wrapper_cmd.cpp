@@ -22,7 +22,7 @@ namespace Backup {
 namespace {
 
 using S2S::Logger;
-using S2S::rsync_internal::ChildSpec;
+using S2S::rsync_internal::ChildCommand;
 namespace reply = S2S::command_reply;
 
 // A directory private to this run (mode 0700), removed with its content on every path.
@@ -144,16 +144,16 @@ int RsyncWrapper::Impl::ExecuteCommand(const boost::function<bool()>& cancel) {
         return kResultLocalFile;
     }
 
-    ChildSpec spec;
+    ChildCommand job;
     // The reply is pulled whatever the list-only setting says: a command run copies nothing else.
-    spec.argv = {"--recursive", "--max-size=" + std::to_string(reply::kMaxOutput),
-                 "--early-input=" + inputFile};
-    ConnectionOptions(&spec.argv);
-    spec.argv.push_back("--");
-    spec.argv.push_back(Url(commandModule + "/" + token + "/"));
-    spec.argv.push_back(replyDir + "/");
-    Environment(&spec);
-    int rc = Run(spec, cancel, true);
+    job.argv = {"--recursive", "--max-size=" + std::to_string(reply::kMaxOutput),
+                "--early-input=" + inputFile};
+    ConnectionOptions(&job.argv);
+    job.argv.push_back("--");
+    job.argv.push_back(Url(commandModule + "/" + token + "/"));
+    job.argv.push_back(replyDir + "/");
+    Environment(&job);
+    int rc = Run(job, cancel, true);
     if (rc != 0) {
         return rc;
     }

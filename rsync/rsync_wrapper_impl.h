@@ -61,9 +61,9 @@ struct RsyncWrapper::Impl {
     // Options shared by every run: time-outs, the remote shell for ssh.
     void ConnectionOptions(std::vector<std::string>* argv) const;
     // The password and the remote shell's password in the child's environment only.
-    void Environment(S2S::rsync_internal::ChildSpec* spec) const;
+    void Environment(S2S::rsync_internal::ChildCommand* job) const;
     // Runs rsync; keeps the last error lines; maps spawn failures and cancellation.
-    int Run(S2S::rsync_internal::ChildSpec& spec, const boost::function<bool()>& cancel,
+    int Run(S2S::rsync_internal::ChildCommand& job, const boost::function<bool()>& cancel,
             bool commandRun);
 
     int ExecuteTransfer(const boost::function<bool()>& cancel);

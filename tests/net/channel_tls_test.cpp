@@ -75,30 +75,30 @@ void AddExtension(X509* cert, X509* issuer, int nid, const char* value) {
 }
 
 // Signs with `issuer_key`; a null issuer makes the certificate self-signed.
-CertPtr MakeCert(const CertSpec& spec, EVP_PKEY* key, X509* issuer, EVP_PKEY* issuer_key) {
+CertPtr MakeCert(const CertSpec& want, EVP_PKEY* key, X509* issuer, EVP_PKEY* issuer_key) {
     static long serial = 1;
     CertPtr cert(X509_new(), X509_free);
     X509_set_version(cert.get(), 2);
     ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), serial++);
-    X509_gmtime_adj(X509_getm_notBefore(cert.get()), spec.valid_from);
-    X509_gmtime_adj(X509_getm_notAfter(cert.get()), spec.valid_until);
+    X509_gmtime_adj(X509_getm_notBefore(cert.get()), want.valid_from);
+    X509_gmtime_adj(X509_getm_notAfter(cert.get()), want.valid_until);
     X509_set_pubkey(cert.get(), key);
     X509_NAME* name = X509_get_subject_name(cert.get());
     X509_NAME_add_entry_by_txt(name, "O", MBSTRING_UTF8,
                                reinterpret_cast<const unsigned char*>("s2s tests"), -1, -1, 0);
     X509_NAME_add_entry_by_txt(name, "CN", MBSTRING_UTF8,
-                               reinterpret_cast<const unsigned char*>(spec.common_name.data()),
-                               static_cast<int>(spec.common_name.size()), -1, 0);
+                               reinterpret_cast<const unsigned char*>(want.common_name.data()),
+                               static_cast<int>(want.common_name.size()), -1, 0);
     X509* signer = issuer != nullptr ? issuer : cert.get();
     X509_set_issuer_name(cert.get(), X509_get_subject_name(signer));
     AddExtension(cert.get(), signer, NID_basic_constraints,
-                 spec.ca ? "critical,CA:TRUE" : "critical,CA:FALSE");
+                 want.ca ? "critical,CA:TRUE" : "critical,CA:FALSE");
     AddExtension(cert.get(), signer, NID_key_usage,
-                 spec.ca ? "critical,keyCertSign,cRLSign" : "critical,digitalSignature");
+                 want.ca ? "critical,keyCertSign,cRLSign" : "critical,digitalSignature");
     AddExtension(cert.get(), signer, NID_subject_key_identifier, "hash");
-    if (!spec.dns.empty()) {
+    if (!want.dns.empty()) {
         GENERAL_NAMES* names = sk_GENERAL_NAME_new_null();
-        for (const std::string& dns : spec.dns) {
+        for (const std::string& dns : want.dns) {
             ASN1_IA5STRING* value = ASN1_IA5STRING_new();
             ASN1_STRING_set(value, dns.data(), static_cast<int>(dns.size()));
             GENERAL_NAME* entry = GENERAL_NAME_new();
@@ -146,10 +146,10 @@ class Certificates {
         CertPtr ca = MakeCert(ca_spec, ca_key.get(), nullptr, nullptr);
         WritePem(ca_file(), {ca.get()});
 
-        auto issue = [&](const std::string& kind, const CertSpec& spec, bool self_signed) {
+        auto issue = [&](const std::string& kind, const CertSpec& want, bool self_signed) {
             KeyPtr key = NewKey();
-            CertPtr cert = self_signed ? MakeCert(spec, key.get(), nullptr, nullptr)
-                                       : MakeCert(spec, key.get(), ca.get(), ca_key.get());
+            CertPtr cert = self_signed ? MakeCert(want, key.get(), nullptr, nullptr)
+                                       : MakeCert(want, key.get(), ca.get(), ca_key.get());
             if (self_signed) {
                 WritePem(cert_file(kind), {cert.get()});
             } else {
@@ -570,11 +570,11 @@ TEST(TlsHostNameTest, WildcardCoversTheDomainAndOneLabelBelow) {
 TEST(TlsHostNameTest, CertificateNamesCommonNameThenAltNamesAndRejectsEmbeddedNul) {
     using S2S::tls::CertificateMatchesHost;
     KeyPtr key = NewKey();
-    CertSpec spec;
-    spec.common_name = "files.example.org";
-    spec.dns = {std::string("evil.lan\0.example.org", 21), "backup.example.org",
+    CertSpec want;
+    want.common_name = "files.example.org";
+    want.dns = {std::string("evil.lan\0.example.org", 21), "backup.example.org",
                 "*.Store.Example.Org"};
-    CertPtr cert = MakeCert(spec, key.get(), nullptr, nullptr);
+    CertPtr cert = MakeCert(want, key.get(), nullptr, nullptr);
     EXPECT_TRUE(CertificateMatchesHost(cert.get(), "FILES.example.org"));
     EXPECT_TRUE(CertificateMatchesHost(cert.get(), "backup.example.org"));
     EXPECT_TRUE(CertificateMatchesHost(cert.get(), "nas.store.example.org"));

@@ -16,15 +16,15 @@
 
 namespace {
 
+using S2S::rsync_internal::ChildCommand;
 using S2S::rsync_internal::ChildOutcome;
-using S2S::rsync_internal::ChildSpec;
 using S2S::rsync_internal::RunChild;
 
 ChildOutcome Sh(const std::string& script, std::vector<std::string>* lines,
                 const boost::function<bool()>& cancel = boost::function<bool()>()) {
-    ChildSpec spec;
-    spec.argv = {"/bin/sh", "-c", script};
-    return RunChild(spec, cancel, [lines](const std::string& line) { lines->push_back(line); });
+    ChildCommand job;
+    job.argv = {"/bin/sh", "-c", script};
+    return RunChild(job, cancel, [lines](const std::string& line) { lines->push_back(line); });
 }
 
 // Processes (zombies aside) whose command line holds `needle`.
@@ -66,7 +66,7 @@ TEST(ChildProcess, ExitCodeAndMergedLines) {
     EXPECT_EQ(out.exit_code, -1);
     EXPECT_EQ(out.signal, SIGTERM);
 
-    ChildSpec missing;
+    ChildCommand missing;
     missing.argv = {"/nonexistent/program"};
     out = RunChild(missing, boost::function<bool()>(), nullptr);
     EXPECT_FALSE(out.started);

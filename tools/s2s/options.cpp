@@ -7,9 +7,9 @@ namespace s2s_cli {
 namespace {
 
 const OptionSpec* FindSpec(const std::vector<OptionSpec>& specs, const std::string& name) {
-    for (const OptionSpec& spec : specs) {
-        if (spec.name == name) {
-            return &spec;
+    for (const OptionSpec& option : specs) {
+        if (option.name == name) {
+            return &option;
         }
     }
     return nullptr;
@@ -68,25 +68,25 @@ bool Options::Parse(const std::vector<OptionSpec>& specs, const std::vector<std:
             error = "unknown option '" + arg + "'";
             return false;
         }
-        const OptionSpec* spec = FindSpec(specs, name);
-        if (spec == nullptr) {
+        const OptionSpec* option = FindSpec(specs, name);
+        if (option == nullptr) {
             error = "unknown option '--" + name + "'";
             return false;
         }
-        if (spec->value_name.empty()) {
+        if (option->value_name.empty()) {
             if (has_inline_value) {
                 error = "option '--" + name + "' takes no value";
                 return false;
             }
         } else if (!has_inline_value) {
             if (i + 1 >= args.size()) {
-                error = "option '--" + name + "' needs a value (" + spec->value_name + ")";
+                error = "option '--" + name + "' needs a value (" + option->value_name + ")";
                 return false;
             }
             value = args[++i];
         }
         std::vector<std::string>& slot = values_[name];
-        if (!slot.empty() && !spec->repeatable) {
+        if (!slot.empty() && !option->repeatable) {
             error = "option '--" + name + "' given more than once";
             return false;
         }
@@ -128,10 +128,10 @@ std::string FormatHelp(const std::string& usage, const std::string& description,
     if (!specs.empty()) {
         size_t width = 0;
         std::vector<std::string> heads;
-        for (const OptionSpec& spec : specs) {
-            std::string head = "  --" + spec.name;
-            if (!spec.value_name.empty()) {
-                head += " " + spec.value_name;
+        for (const OptionSpec& option : specs) {
+            std::string head = "  --" + option.name;
+            if (!option.value_name.empty()) {
+                head += " " + option.value_name;
             }
             width = std::max(width, head.size());
             heads.push_back(head);

@@ -51,9 +51,9 @@ const KeySpec kKeys[] = {
 };
 
 const KeySpec* FindKey(const std::string& key) {
-    for (const KeySpec& spec : kKeys) {
-        if (key == spec.key) {
-            return &spec;
+    for (const KeySpec& field : kKeys) {
+        if (key == field.key) {
+            return &field;
         }
     }
     return nullptr;
@@ -73,9 +73,9 @@ bool CheckString(const std::string& key, const std::string& value, std::string& 
     return true;
 }
 
-bool ConvertValue(const KeySpec& spec, const json& value, S2S::PObject& out, std::string& error) {
-    const std::string key = spec.key;
-    switch (spec.kind) {
+bool ConvertValue(const KeySpec& field, const json& value, S2S::PObject& out, std::string& error) {
+    const std::string key = field.key;
+    switch (field.kind) {
         case Kind::String:
             if (!value.is_string()) {
                 error = "key \"" + key + "\" must be a string";
@@ -188,13 +188,13 @@ bool ParseTaskJson(const std::string& text, S2S::PObject& map, std::string& erro
     S2S::PObject result;
     result.asMap();
     for (auto it = doc.begin(); it != doc.end(); ++it) {
-        const KeySpec* spec = FindKey(it.key());
-        if (spec == nullptr) {
+        const KeySpec* field = FindKey(it.key());
+        if (field == nullptr) {
             error = "unknown key \"" + it.key() + "\"";
             return false;
         }
         S2S::PObject value;
-        if (!ConvertValue(*spec, it.value(), value, error)) {
+        if (!ConvertValue(*field, it.value(), value, error)) {
             return false;
         }
         result[it.key()] = value;
@@ -244,20 +244,20 @@ bool LoadTask(const std::string& path, S2S::SyncTask& task, bool& has_password,
 std::string TaskMapToJson(const S2S::PObject& map) {
     json doc = json::object();
     for (const auto& entry : map.asMap()) {
-        const KeySpec* spec = FindKey(entry.first);
+        const KeySpec* field = FindKey(entry.first);
         if (entry.first == "pswd") {
             continue;
         }
         const S2S::PObject& value = entry.second;
-        if (spec != nullptr && spec->kind == Kind::StringArray) {
+        if (field != nullptr && field->kind == Kind::StringArray) {
             json items = json::array();
             for (const S2S::PObject& item : value.asArray()) {
                 items.push_back(item.asString());
             }
             doc[entry.first] = items;
-        } else if (spec != nullptr && spec->kind == Kind::Bool) {
+        } else if (field != nullptr && field->kind == Kind::Bool) {
             doc[entry.first] = value.asBool();
-        } else if (spec != nullptr && spec->kind == Kind::Int32) {
+        } else if (field != nullptr && field->kind == Kind::Int32) {
             doc[entry.first] = value.asInt32();
         } else if (value.isInteger()) {
             doc[entry.first] = value.asUInt64();
