@@ -94,9 +94,10 @@ S2S_EXPORT ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldS
 // early exec: reads the command file from `in_fd`, answers into the spool. The process exit
 // status: 0 when a reply was left.
 S2S_EXPORT int ReceiverHookEarly(int in_fd, bool oldServer);
-// pre-xfer exec: 0 when the requested reply belongs to this connection.
+// The pre- and post-transfer hooks of configurations written by earlier versions (a fresh
+// `configure` needs only the early one): pre-xfer exec answers 0 when the requested reply belongs
+// to this connection; post-xfer exec removes this connection's reply.
 S2S_EXPORT int ReceiverHookPre();
-// post-xfer exec: removes this connection's reply.
 S2S_EXPORT int ReceiverHookPost();
 
 // What `s2s-receiver status` shows.
