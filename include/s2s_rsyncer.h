@@ -141,6 +141,8 @@ class S2S_EXPORT Rsyncer {
     // command="name", clientID="...", then key="value" per parameter, appended to `lines`.
     static int GenCommandLines(const std::string& command, const ParamList& params,
                                std::list<std::string>& lines);
+    // Runs command lines as one fresh command task of this server; the run's code in `result`.
+    void RunCommandLines(const std::list<std::string>& lines, bool isTest, int& result) const;
 
     int serverVersion;  // -1 unknown, 0 old server without multi-source support, >0 version
     bool (*cancelChecker)();

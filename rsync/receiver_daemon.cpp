@@ -116,18 +116,7 @@ bool WriteFileAtomic(const std::string& path, const std::string& content, mode_t
     if (fd < 0) {
         return false;
     }
-    bool ok = fchmod(fd, mode) == 0;
-    size_t done = 0;
-    while (ok && done < content.size()) {
-        ssize_t n = write(fd, content.data() + done, content.size() - done);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        ok = n > 0;
-        if (ok) {
-            done += static_cast<size_t>(n);
-        }
-    }
+    bool ok = fchmod(fd, mode) == 0 && receiver_internal::WriteAll(fd, content);
     ok = fsync(fd) == 0 && ok;
     ok = close(fd) == 0 && ok;
     if (!ok || rename(tmp.c_str(), path.c_str()) != 0) {
@@ -407,6 +396,21 @@ bool EndDaemon(pid_t pid, bool leads) {
 }  // namespace
 
 namespace receiver_internal {
+
+bool WriteAll(int fd, const std::string& content) {
+    size_t done = 0;
+    while (done < content.size()) {
+        ssize_t n = write(fd, content.data() + done, content.size() - done);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            return false;
+        }
+        done += static_cast<size_t>(n);
+    }
+    return true;
+}
 
 int ShareEncrypted(const std::string& name, bool* encrypted) {
     VURNShare* raw = nullptr;

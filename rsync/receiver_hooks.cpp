@@ -66,18 +66,7 @@ bool WriteNew(const std::string& path, const std::string& content, mode_t mode) 
     if (fd < 0) {
         return false;
     }
-    bool ok = fchmod(fd, mode) == 0;
-    size_t done = 0;
-    while (ok && done < content.size()) {
-        ssize_t n = write(fd, content.data() + done, content.size() - done);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        ok = n > 0;
-        if (ok) {
-            done += static_cast<size_t>(n);
-        }
-    }
+    bool ok = fchmod(fd, mode) == 0 && receiver_internal::WriteAll(fd, content);
     return close(fd) == 0 && ok;
 }
 

@@ -24,6 +24,9 @@ int ParseCommandFile(const std::string& input, std::string* token,
 // hook does it before it answers, a stop once the daemon's processes are gone.
 void RemoveFinishedReplies();
 
+// Writes all of `content` to `fd` (EINTR retried); false on the first failed write.
+bool WriteAll(int fd, const std::string& content);
+
 // 1 when the share registry has the share (`*encrypted` set), 0 when not, -1 on failure.
 int ShareEncrypted(const std::string& name, bool* encrypted);
 

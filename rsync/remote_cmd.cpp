@@ -166,6 +166,12 @@ void Rsyncer::GetServerVersion() {
     PutTempFile(outfile);
 }
 
+void Rsyncer::RunCommandLines(const std::list<std::string>& lines, bool isTest, int& result) const {
+    RsyncTask task;
+    InitRsyncTask(task, isTest);
+    result = task.ExecuteCmd(lines, cancelChecker);
+}
+
 int Rsyncer::DoSinglePairing(bool dryRun, int& result) const {
     std::list<std::string> lines;
     if (GenSinglePairCmd(dryRun, lines) < 0) {
@@ -174,9 +180,7 @@ int Rsyncer::DoSinglePairing(bool dryRun, int& result) const {
                        __LINE__);
         return -1;
     }
-    RsyncTask task;
-    InitRsyncTask(task, dryRun);
-    result = task.ExecuteCmd(lines, cancelChecker);
+    RunCommandLines(lines, dryRun, result);
     return 0;
 }
 
@@ -312,9 +316,7 @@ int Rsyncer::FinishSync(const std::string& finishType, const std::string& name, 
                        __LINE__);
         return -1;
     }
-    RsyncTask task;
-    InitRsyncTask(task, false);
-    result = task.ExecuteCmd(lines, cancelChecker);
+    RunCommandLines(lines, false, result);
     return 0;
 }
 
@@ -326,9 +328,7 @@ int Rsyncer::SendBeacon(const std::string& taskName, int& result) const {
                        __LINE__);
         return -1;
     }
-    RsyncTask task;
-    InitRsyncTask(task, false);
-    result = task.ExecuteCmd(lines, cancelChecker);
+    RunCommandLines(lines, false, result);
     return 0;
 }
 

@@ -97,9 +97,7 @@ int Rsyncer::StartSyncShare(const std::string& shareName, bool withAttributes, i
                        __LINE__);
         return -1;
     }
-    RsyncTask task;
-    InitRsyncTask(task, false);
-    result = task.ExecuteCmd(lines, cancelChecker);
+    RunCommandLines(lines, false, result);
     return 0;
 }
 
