@@ -119,14 +119,15 @@ int AskService(const S2S::PObject& request, S2S::PObject& reply) {
     if (ControlRequest(request, reply, error) != 0) {
         return ExplainNoReply(SocketPath(), error);
     }
-    if (!reply.isMap() || !reply[Control::kKeyStatus].isInteger()) {
+    const S2S::PObject& answer = reply;
+    if (!answer.isMap() || !answer[Control::kKeyStatus].isInteger()) {
         return Fail(kExitService, "s2sd sent a reply without a status");
     }
-    const unsigned long long status = reply[Control::kKeyStatus].asUInt64();
+    const unsigned long long status = answer[Control::kKeyStatus].asUInt64();
     if (status == Control::kOk) {
         return kExitOK;
     }
-    const std::string message = reply[Control::kKeyMessage].asString();
+    const std::string message = answer[Control::kKeyMessage].asString();
     return Fail(ExitForControlStatus(status),
                 "s2sd: " + ControlStatusName(status) + (message.empty() ? "" : ": " + message));
 }
