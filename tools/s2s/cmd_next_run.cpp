@@ -225,21 +225,9 @@ bool NextRuns(const S2S::Schedule& schedule, long (S2S::Schedule::*next)(long) c
 
 }  // namespace
 
-int RunNextRunCommand(const Args& args) {
+int RunNextRunCommand(const Options& opts) {
     SetupLogging(0);
-    Options opts;
     std::string error;
-    if (!opts.Parse(kNextRunOptions, args, error)) {
-        return Fail(kExitUsage, error);
-    }
-    if (opts.Has("help")) {
-        std::fputs(FormatHelp("s2s next-run (--task FILE | [--mode MODE] [--at HH:MM] ...)",
-                              "Prints when a task runs next, in local time.", kNextRunOptions,
-                              kNextRunEpilogue)
-                       .c_str(),
-                   stdout);
-        return kExitOK;
-    }
     if (!opts.Positional().empty()) {
         return Fail(kExitUsage,
                     "next-run takes no arguments (unexpected '" + opts.Positional()[0] + "')");
@@ -343,6 +331,15 @@ int RunNextRunCommand(const Args& args) {
                     i < times.size() ? LocalTime(times[i]).c_str() : "no run");
     }
     return kExitOK;
+}
+
+Command NextRunCommand() {
+    return {"next-run",
+            "s2s next-run (--task FILE | [--mode MODE] [--at HH:MM] ...)",
+            "Prints when a task runs next, in local time.",
+            kNextRunOptions,
+            kNextRunEpilogue,
+            RunNextRunCommand};
 }
 
 }  // namespace s2s_cli

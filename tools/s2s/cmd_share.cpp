@@ -75,21 +75,8 @@ bool ShareExists(const std::string& name) {
     return rc == 0;
 }
 
-int AddShare(const Args& args) {
-    Options opts;
+int AddShare(const Options& opts) {
     std::string error;
-    if (!opts.Parse(kAddOptions, args, error)) {
-        return Fail(kExitUsage, error);
-    }
-    if (opts.Has("help")) {
-        std::fputs(FormatHelp("s2s share add NAME --path DIR [OPTIONS]",
-                              "Adds a share to the registry. The folder must exist; an encrypted "
-                              "share's\nencrypted directory is created when missing.",
-                              kAddOptions)
-                       .c_str(),
-                   stdout);
-        return kExitOK;
-    }
     if (opts.Positional().size() != 1) {
         return Fail(kExitUsage, "share add needs exactly one share name");
     }
@@ -172,20 +159,7 @@ int AddShare(const Args& args) {
     return kExitOK;
 }
 
-int RemoveShare(const Args& args) {
-    Options opts;
-    std::string error;
-    if (!opts.Parse(kRemoveOptions, args, error)) {
-        return Fail(kExitUsage, error);
-    }
-    if (opts.Has("help")) {
-        std::fputs(FormatHelp("s2s share remove NAME",
-                              "Removes a share from the registry. Its folder and files stay.",
-                              kRemoveOptions)
-                       .c_str(),
-                   stdout);
-        return kExitOK;
-    }
+int RemoveShare(const Options& opts) {
     if (opts.Positional().size() != 1) {
         return Fail(kExitUsage, "share remove needs exactly one share name");
     }
@@ -200,19 +174,7 @@ int RemoveShare(const Args& args) {
     return kExitOK;
 }
 
-int ListShares(const Args& args) {
-    Options opts;
-    std::string error;
-    if (!opts.Parse(kListOptions, args, error)) {
-        return Fail(kExitUsage, error);
-    }
-    if (opts.Has("help")) {
-        std::fputs(
-            FormatHelp("s2s share list [--json]", "Lists the registered shares.", kListOptions)
-                .c_str(),
-            stdout);
-        return kExitOK;
-    }
+int ListShares(const Options& opts) {
     if (!opts.Positional().empty()) {
         return Fail(kExitUsage, "share list takes no arguments");
     }
@@ -280,22 +242,22 @@ int ListShares(const Args& args) {
 
 }  // namespace
 
-int RunShareCommand(const Args& args) {
-    if (args.empty() || args[0] == "--help" || args[0] == "-h") {
-        std::fputs(kShareHelp, args.empty() ? stderr : stdout);
-        return args.empty() ? kExitUsage : kExitOK;
-    }
-    const Args rest(args.begin() + 1, args.end());
-    if (args[0] == "add") {
-        return AddShare(rest);
-    }
-    if (args[0] == "remove") {
-        return RemoveShare(rest);
-    }
-    if (args[0] == "list") {
-        return ListShares(rest);
-    }
-    return Fail(kExitUsage, "unknown share command '" + args[0] + "' (add, remove or list)");
+std::string ShareHelp() {
+    return kShareHelp;
+}
+
+std::vector<Command> ShareCommands() {
+    return {
+        {"add", "s2s share add NAME --path DIR [OPTIONS]",
+         "Adds a share to the registry. The folder must exist; an encrypted share's\n"
+         "encrypted directory is created when missing.",
+         kAddOptions, "", AddShare},
+        {"remove", "s2s share remove NAME",
+         "Removes a share from the registry. Its folder and files stay.", kRemoveOptions, "",
+         RemoveShare},
+        {"list", "s2s share list [--json]", "Lists the registered shares.", kListOptions, "",
+         ListShares},
+    };
 }
 
 }  // namespace s2s_cli

@@ -567,30 +567,9 @@ bool TaskFromOptions(const Options& opts, S2S::SyncTask& task, std::string& erro
 
 }  // namespace
 
-int RunSyncCommand(const Args& args) {
-    Options opts;
+int RunSyncCommand(const Options& opts) {
     std::string error;
     SetupLogging(0);
-    for (const std::string& arg : args) {
-        if (arg == "--password" || arg.rfind("--password=", 0) == 0) {
-            return Fail(kExitUsage,
-                        "passwords are never given on the command line: use --password-file "
-                        "FILE or the environment variable S2S_PASSWORD");
-        }
-    }
-    if (!opts.Parse(kSyncOptions, args, error)) {
-        return Fail(kExitUsage, error);
-    }
-    if (opts.Has("help")) {
-        std::fputs(FormatHelp("s2s sync (--task FILE | --server HOST --user USER --share NAME ...)",
-                              "Runs one sync task once, end to end: pairs the shares with the "
-                              "server, copies\neach one, sends encrypted shares' keys, marks "
-                              "them complete and reports\nthe task's status.",
-                              kSyncOptions, kSyncEpilogue)
-                       .c_str(),
-                   stdout);
-        return kExitOK;
-    }
     if (!opts.Positional().empty()) {
         return Fail(kExitUsage,
                     "sync takes no arguments (unexpected '" + opts.Positional()[0] + "')");
@@ -666,6 +645,17 @@ int RunSyncCommand(const Args& args) {
                     summary["seconds"].get<double>(), ExitCodeName(static_cast<ExitCode>(code)));
     }
     return code;
+}
+
+Command SyncCommand() {
+    return {"sync",
+            "s2s sync (--task FILE | --server HOST --user USER --share NAME ...)",
+            "Runs one sync task once, end to end: pairs the shares with the server, copies\n"
+            "each one, sends encrypted shares' keys, marks them complete and reports\n"
+            "the task's status.",
+            kSyncOptions,
+            kSyncEpilogue,
+            RunSyncCommand};
 }
 
 }  // namespace s2s_cli

@@ -25,6 +25,11 @@ const ExitInfo kExitTable[] = {
     {kExitTransfer, "transfer", "copying a share failed; it is not marked complete"},
     {kExitKeySync, "key-sync", "an encrypted share's key could not be sent"},
     {kExitRegistry, "registry", "the share registry could not be read or changed"},
+    {kExitNoService, "no-service", "the sync service s2sd is not running"},
+    {kExitNoSuchTask, "no-such-task", "the sync service keeps no task with that id"},
+    {kExitBusy, "busy", "the task is running (cancel it first)"},
+    {kExitNotRunning, "not-running", "the task is not running"},
+    {kExitService, "service", "the sync service refused the request or failed"},
     {kExitCancelled, "cancelled", "stopped by a signal; nothing was marked complete"},
 };
 

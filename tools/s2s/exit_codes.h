@@ -20,6 +20,12 @@ enum ExitCode : int {
     kExitTransfer = 9,     // copying a share failed; the share is not marked complete
     kExitKeySync = 10,     // an encrypted share's key could not be sent
     kExitRegistry = 11,    // the share registry could not be read or changed
+    // Asking the sync service s2sd (s2s task ..., s2s pause|resume):
+    kExitNoService = 20,   // s2sd is not running (its control socket is missing or refuses)
+    kExitNoSuchTask = 21,  // the service keeps no task with that id
+    kExitBusy = 22,        // the task is running (cancel it first)
+    kExitNotRunning = 23,  // cancel of a task that is not running
+    kExitService = 24,     // the service refused the request or failed (see the message)
     kExitCancelled = 130,  // stopped by Ctrl-C or SIGTERM; nothing marked complete
 };
 

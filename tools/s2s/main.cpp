@@ -1,9 +1,10 @@
-// s2s: the sending side's command-line tool. It manages the share registry, runs a sync task once
-// end to end against a receiving server, and tells when a task runs next.
+// s2s: the sending side's command-line tool. It manages the share registry, runs a sync task
+// once end to end against a receiving server, tells when a task runs next, and is the front end
+// of the sync service s2sd (the tasks it keeps and runs).
 #include <cstdio>
-#include <cstring>
 #include <string>
 
+#include "tools/s2s/command_line.h"
 #include "tools/s2s/commands.h"
 #include "tools/s2s/exit_codes.h"
 
@@ -11,10 +12,8 @@ namespace s2s_cli {
 
 namespace {
 
-const char kVersion[] = "1.0.0";
-
-void PrintMainHelp() {
-    std::printf(
+std::string MainHelp() {
+    std::string text =
         "Usage: s2s COMMAND [OPTIONS]\n"
         "\n"
         "Keeps the shared folders of this server in sync with a receiving server.\n"
@@ -23,37 +22,27 @@ void PrintMainHelp() {
         "  sync       run one sync task once: pair the shares, copy them, report the status\n"
         "  next-run   print when a task runs next, in local time\n"
         "  share      manage the share registry (add, remove, list)\n"
-        "  task       check a task file, or print it\n"
+        "  task       check a task file; add, change, run and watch the sync service's tasks\n"
+        "  pause      stop the sync service (or one task) from starting scheduled runs\n"
+        "  resume     let it start them again\n"
         "  help       show the help of a command: s2s help sync\n"
         "\n"
         "Every command answers --help. The password is read from --password-file or the\n"
         "environment variable S2S_PASSWORD, never from the command line.\n"
         "\n"
-        "Exit codes:\n");
-    const ExitCode codes[] = {kExitOK,       kExitInternal,    kExitUsage,   kExitInvalidTask,
-                              kExitPassword, kExitUnreachable, kExitAuth,    kExitConflict,
-                              kExitRefused,  kExitTransfer,    kExitKeySync, kExitRegistry,
-                              kExitCancelled};
+        "Exit codes:\n";
+    const ExitCode codes[] = {kExitOK,        kExitInternal,    kExitUsage,   kExitInvalidTask,
+                              kExitPassword,  kExitUnreachable, kExitAuth,    kExitConflict,
+                              kExitRefused,   kExitTransfer,    kExitKeySync, kExitRegistry,
+                              kExitNoService, kExitNoSuchTask,  kExitBusy,    kExitNotRunning,
+                              kExitService,   kExitCancelled};
     for (ExitCode code : codes) {
-        std::printf("  %3d  %-13s %s\n", static_cast<int>(code), ExitCodeName(code),
-                    ExitCodeMeaning(code));
+        char line[160];
+        std::snprintf(line, sizeof(line), "  %3d  %-13s %s\n", static_cast<int>(code),
+                      ExitCodeName(code), ExitCodeMeaning(code));
+        text += line;
     }
-}
-
-int Dispatch(const std::string& command, const Args& rest) {
-    if (command == "sync") {
-        return RunSyncCommand(rest);
-    }
-    if (command == "next-run") {
-        return RunNextRunCommand(rest);
-    }
-    if (command == "share") {
-        return RunShareCommand(rest);
-    }
-    if (command == "task") {
-        return RunTaskCommand(rest);
-    }
-    return Fail(kExitUsage, "unknown command '" + command + "'");
+    return text;
 }
 
 }  // namespace
@@ -62,28 +51,30 @@ int Dispatch(const std::string& command, const Args& rest) {
 
 int main(int argc, char** argv) {
     using namespace s2s_cli;
-    if (argc < 2) {
-        PrintMainHelp();
-        return kExitUsage;
+    CommandLine cli(MainHelp());
+    CLI::App* root = cli.Root();
+    cli.AddCommand(root, SyncCommand());
+    cli.AddCommand(root, NextRunCommand());
+    CLI::App* share = cli.AddGroup(root, "share", ShareHelp());
+    for (const Command& command : ShareCommands()) {
+        cli.AddCommand(share, command);
     }
-    const std::string command = argv[1];
-    Args rest(argv + 2, argv + argc);
-    if (command == "--help" || command == "-h") {
-        PrintMainHelp();
-        return kExitOK;
+    CLI::App* task = cli.AddGroup(root, "task", TaskHelp());
+    for (const Command& command : TaskFileCommands()) {
+        cli.AddCommand(task, command);
     }
-    if (command == "--version") {
-        std::printf("s2s %s\n", kVersion);
-        return kExitOK;
+    for (const Command& command : TaskServiceCommands()) {
+        cli.AddCommand(task, command);
     }
-    if (command == "help") {
-        if (rest.empty()) {
-            PrintMainHelp();
-            return kExitOK;
-        }
-        Args help_args(rest.begin() + 1, rest.end());
-        help_args.push_back("--help");
-        return Dispatch(rest[0], help_args);
+    for (const Command& command : ServiceCommands()) {
+        cli.AddCommand(root, command);
     }
-    return Dispatch(command, rest);
+
+    Args args(argv + 1, argv + argc);
+    // "s2s help COMMAND..." is "s2s COMMAND... --help".
+    if (!args.empty() && args[0] == "help") {
+        args.erase(args.begin());
+        args.push_back("--help");
+    }
+    return cli.Run(args);
 }

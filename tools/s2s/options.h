@@ -1,5 +1,6 @@
-// Command-line options of `s2s`: each command declares its options once, and the same table
-// drives parsing, the strict value checks and the --help text.
+// Command-line options of `s2s`: each command declares its options once, as a table of
+// OptionSpec, and the same table drives parsing (command_line.h), the strict value checks and
+// the --help text. Options is what a command reads back after a successful parse.
 #ifndef S2S_TOOLS_S2S_OPTIONS_H
 #define S2S_TOOLS_S2S_OPTIONS_H
 
@@ -16,14 +17,11 @@ struct OptionSpec {
     std::string help;        // one line
 };
 
-// A command's parsed command line. Unknown options, missing values, values given to flags and
-// repeated single options are errors; "--" ends the options.
+// A command's parsed command line. The parser has already refused unknown options, missing
+// values, values given to flags and repeated single options; numbers are checked here, when the
+// command reads them, so the message can say what the number is for.
 class Options {
   public:
-    // Parses args (the command's own arguments, without the program and command names).
-    bool Parse(const std::vector<OptionSpec>& specs, const std::vector<std::string>& args,
-               std::string& error);
-
     bool Has(const std::string& name) const { return values_.count(name) != 0; }
     // The value of a single option, or `fallback` when it was not given.
     std::string Get(const std::string& name, const std::string& fallback = "") const;
@@ -36,6 +34,11 @@ class Options {
     bool GetUnsigned(const std::string& name, unsigned long long max, unsigned long long& out,
                      std::string& error) const;
 
+    // Filled by the parser: the values of an option that was given, and the arguments that are
+    // not options (everything after "--" included).
+    void Set(const std::string& name, std::vector<std::string> values);
+    void SetPositional(std::vector<std::string> args) { positional_ = std::move(args); }
+
   private:
     std::map<std::string, std::vector<std::string>> values_;
     std::vector<std::string> positional_;
@@ -43,10 +46,6 @@ class Options {
 
 // Strict unsigned decimal: digits only, at most `max`.
 bool ParseUnsigned(const std::string& text, unsigned long long max, unsigned long long& out);
-
-// The --help text: usage line, description, then one line per option.
-std::string FormatHelp(const std::string& usage, const std::string& description,
-                       const std::vector<OptionSpec>& specs, const std::string& epilogue = "");
 
 }  // namespace s2s_cli
 

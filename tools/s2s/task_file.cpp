@@ -241,7 +241,33 @@ bool LoadTask(const std::string& path, S2S::SyncTask& task, bool& has_password,
     return true;
 }
 
-std::string TaskMapToJson(const S2S::PObject& map) {
+json PObjectToJson(const S2S::PObject& value) {
+    if (value.isMap()) {
+        json doc = json::object();
+        for (const auto& entry : value.asMap()) {
+            if (entry.first != "pswd") {
+                doc[entry.first] = PObjectToJson(entry.second);
+            }
+        }
+        return doc;
+    }
+    if (value.isArray()) {
+        json items = json::array();
+        for (const S2S::PObject& item : value.asArray()) {
+            items.push_back(PObjectToJson(item));
+        }
+        return items;
+    }
+    if (value.isInteger()) {
+        return value.asUInt64();
+    }
+    if (value.isString()) {
+        return value.asString();
+    }
+    return nullptr;
+}
+
+json TaskMapToJson(const S2S::PObject& map) {
     json doc = json::object();
     for (const auto& entry : map.asMap()) {
         const KeySpec* field = FindKey(entry.first);
@@ -259,13 +285,11 @@ std::string TaskMapToJson(const S2S::PObject& map) {
             doc[entry.first] = value.asBool();
         } else if (field != nullptr && field->kind == Kind::Int32) {
             doc[entry.first] = value.asInt32();
-        } else if (value.isInteger()) {
-            doc[entry.first] = value.asUInt64();
         } else {
-            doc[entry.first] = value.asString();
+            doc[entry.first] = PObjectToJson(value);
         }
     }
-    return doc.dump(2) + "\n";
+    return doc;
 }
 
 }  // namespace s2s_cli

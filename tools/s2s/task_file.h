@@ -5,6 +5,7 @@
 #ifndef S2S_TOOLS_S2S_TASK_FILE_H
 #define S2S_TOOLS_S2S_TASK_FILE_H
 
+#include <nlohmann/json.hpp>
 #include <string>
 
 #include "s2s_pobject.h"
@@ -23,8 +24,12 @@ bool LoadTaskFile(const std::string& path, S2S::PObject& map, bool& has_password
 // LoadTaskFile, then the map turned into a task by the sync model's own conversion.
 bool LoadTask(const std::string& path, S2S::SyncTask& task, bool& has_password, std::string& error);
 
-// The task map as indented JSON, without the password.
-std::string TaskMapToJson(const S2S::PObject& map);
+// The task map as JSON, without the password: the task's keys with the kinds of a task file
+// (booleans, signed numbers), other keys as PObjectToJson gives them.
+nlohmann::json TaskMapToJson(const S2S::PObject& map);
+// Any value: maps as objects, arrays, integers as unsigned numbers, strings; a "pswd" key is left
+// out at every level.
+nlohmann::json PObjectToJson(const S2S::PObject& value);
 
 }  // namespace s2s_cli
 
