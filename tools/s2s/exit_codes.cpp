@@ -25,6 +25,9 @@ const ExitInfo kExitTable[] = {
     {kExitTransfer, "transfer", "copying a share failed; it is not marked complete"},
     {kExitKeySync, "key-sync", "an encrypted share's key could not be sent"},
     {kExitRegistry, "registry", "the share registry could not be read or changed"},
+    {kExitUnsafeSource, "unsafe-source",
+     "a share's folder is missing, empty or not mounted; it was not synced"},
+    {kExitMaxDelete, "max-delete", "a share's run would have deleted more than allowed"},
     {kExitCancelled, "cancelled", "stopped by a signal; nothing was marked complete"},
 };
 
@@ -134,6 +137,9 @@ ExitCode ClassifyConnectResult(int code) {
 ExitCode ClassifyTransferResult(int code) {
     if (code == 20) {
         return kExitCancelled;
+    }
+    if (code == 25) {
+        return kExitMaxDelete;  // rsync's own deletion limit stopped the deletions
     }
     if (IsAuthFailure(code)) {
         return kExitAuth;

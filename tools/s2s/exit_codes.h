@@ -20,6 +20,10 @@ enum ExitCode : int {
     kExitTransfer = 9,     // copying a share failed; the share is not marked complete
     kExitKeySync = 10,     // an encrypted share's key could not be sent
     kExitRegistry = 11,    // the share registry could not be read or changed
+    // a share's folder was missing, empty or not mounted; it was not synced
+    kExitUnsafeSource = 12,
+    // a share's run would have deleted more than --max-delete allows; nothing was deleted
+    kExitMaxDelete = 13,
     kExitCancelled = 130,  // stopped by Ctrl-C or SIGTERM; nothing marked complete
 };
 

@@ -30,10 +30,10 @@ void PrintMainHelp() {
         "environment variable S2S_PASSWORD, never from the command line.\n"
         "\n"
         "Exit codes:\n");
-    const ExitCode codes[] = {kExitOK,       kExitInternal,    kExitUsage,   kExitInvalidTask,
-                              kExitPassword, kExitUnreachable, kExitAuth,    kExitConflict,
-                              kExitRefused,  kExitTransfer,    kExitKeySync, kExitRegistry,
-                              kExitCancelled};
+    const ExitCode codes[] = {kExitOK,           kExitInternal,    kExitUsage,    kExitInvalidTask,
+                              kExitPassword,     kExitUnreachable, kExitAuth,     kExitConflict,
+                              kExitRefused,      kExitTransfer,    kExitKeySync,  kExitRegistry,
+                              kExitUnsafeSource, kExitMaxDelete,   kExitCancelled};
     for (ExitCode code : codes) {
         std::printf("  %3d  %-13s %s\n", static_cast<int>(code), ExitCodeName(code),
                     ExitCodeMeaning(code));
