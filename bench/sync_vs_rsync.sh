@@ -43,7 +43,7 @@ trap cleanup EXIT
 
 for root in "$sender" "$receiver"; do
   mkdir -p "$root/etc/s2s" "$root/tmp/S2S" "$root/volume1"
-  printf '[host]\n\tserial="SN-BENCH-%s"\n[volumes]\n\t%s="internal"\n' "$(basename "$root")" \
+  printf '[host]\n\tserial="SN-BENCH-%s"\n[volumes]\n\t%s="internal,directory"\n' "$(basename "$root")" \
     "$root/volume1" >"$root/etc/s2s/host.conf"
 done
 mkdir -p "$sender/volume1/data" "$receiver/volume1/data" "$receiver/volume1/plain"

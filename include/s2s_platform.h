@@ -295,7 +295,8 @@ S2S_EXPORT int VURNShareNameIsValid(const char* name);
 /* ---------------------------------------------------------------------------------------------
  * Host facts, from S2SPath(S2S_PATH_HOST_CONF):
  *   [host]     serial=..., ha=yes|no, model_class=... ("portbox" selects the share-bin rule)
- *   [volumes]  <mount path>=internal|external
+ *   [volumes]  <mount path>=internal|external, or internal,directory|external,directory for a
+ *              volume that is a plain directory of a larger file system (not a mount point)
  * A missing host file means no facts (no serial, not HA, ordinary model class, no volume
  * overrides); an unreadable or malformed one is a failure with an ERROR line.
  * ------------------------------------------------------------------------------------------- */
@@ -342,6 +343,11 @@ typedef struct VURNVolumeRecord {
 /* 0 and *volume filled; non-zero on failure (missing path, no mount table, a mount path longer
  * than 127 bytes: VLIB_ERR_BUFFER_TOO_SMALL). */
 S2S_EXPORT int VolumePathParseEx(const char* path, VURNVolumeRecord* volume);
+/* Whether the volume at `volumePath` (a path VolumePathParseEx reported) is there: 1 when it is a
+ * mount point of /proc/self/mountinfo or host.conf lists it as a directory volume; 0 when it is
+ * not mounted (a listed mount path missing from the mount table, or an unlisted path that is no
+ * mount point); negative on failure (unreadable mount table or host file, malformed entry). */
+S2S_EXPORT int VURNVolumeIsMounted(const char* volumePath);
 
 /* ---------------------------------------------------------------------------------------------
  * Usable addresses of a server: `serverIP` first when it is a numeric IPv4/IPv6 address, then

@@ -111,6 +111,16 @@ class S2S_EXPORT RsyncWrapper {
     void setSshIdentityFile(std::string path);
     // Called from execute()'s thread with the overall progress of a transfer, 0 to 100.
     void setProgressCallback(boost::function<void(int)> callback);
+    // A transfer deletes at most `count` extraneous files on the server (rsync --max-delete;
+    // 0 deletes none); beyond it rsync stops deleting and the run ends with 25. Negative: no
+    // limit (the default).
+    void setMaxDelete(long long count);
+    // Makes the next transfer a dry run: nothing changes on either side, and every entry the run
+    // would look at, unchanged ones and deletions included, is reported to `callback` from
+    // execute()'s thread with rsync's change summary ("*deleting", ">f+++++++++" for a new file,
+    // ".d..t......") and its path as rsync prints it. An empty callback makes it a real run again.
+    void setDryRun(
+        boost::function<void(const std::string& change, const std::string& path)> callback);
 
     // Runs rsync with these settings; polls `cancel` (when set) at least every 200 ms and stops
     // the run when it returns true. 0, or rsync's / the server's numeric result code.

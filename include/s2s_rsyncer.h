@@ -58,6 +58,8 @@ class S2S_EXPORT Rsyncer {
         void SetSyncACL(bool on) { setVurnAcl(on); }
         // A test (dry-run) task runs without the wrapper's debug log, every real task with it.
         void SetTestTask(bool on) { setDebugLog(!on); }
+        // At most `count` deletions on the server in a transfer; negative: no limit.
+        void SetMaxDelete(long long count) { setMaxDelete(count); }
 
         // Transfers local `src` to `dst` (under `module`) on the server; 600 s stall limit.
         // 0, or the rsync / server result code.
@@ -86,6 +88,9 @@ class S2S_EXPORT Rsyncer {
     // Receives the overall progress (0 to 100) of RunSync's transfers, on the caller's thread
     // while the run goes on; for progress displays. Commands and key transfers report none.
     void SetProgressCallback(const boost::function<void(int)>& fn) { progressCallback = fn; }
+    // The deletion limit of RunSync's transfers (rsync's own --max-delete; the run ends with 25
+    // when it is reached); negative, the default: no limit.
+    void SetMaxDelete(long long count) { maxDelete = count; }
     // A copy, with the server address TestServer settled on.
     SyncInfo GetSyncInfo() const { return syncInfo; }
 
@@ -154,6 +159,7 @@ class S2S_EXPORT Rsyncer {
     std::map<std::string, ShareInfo> shareInfoCache;
     std::string reserved;  // no operation reads or writes it yet
     boost::function<void(int)> progressCallback;
+    long long maxDelete = -1;
 };
 
 // Splits `text` at every character of `separators`, appending each piece (empty ones included)

@@ -190,6 +190,29 @@ std::string StripSlashes(std::string path) {
     return path;
 }
 
+// A [volumes] value: "internal" or "external", optionally followed by ",directory" for a volume
+// that is a plain directory of a larger file system rather than a mount point of its own.
+bool ParseVolumeValue(const std::string& value, int& type, bool& directory) {
+    std::string word = value;
+    directory = false;
+    const size_t comma = value.find(',');
+    if (comma != std::string::npos) {
+        if (s2s_platform::Trim(value.substr(comma + 1)) != "directory") {
+            return false;
+        }
+        directory = true;
+        word = s2s_platform::Trim(value.substr(0, comma));
+    }
+    if (word == "internal") {
+        type = VURN_VOLUME_TYPE_INTERNAL;
+    } else if (word == "external") {
+        type = VURN_VOLUME_TYPE_EXTERNAL;
+    } else {
+        return false;
+    }
+    return true;
+}
+
 }  // namespace
 
 extern "C" {
@@ -409,12 +432,11 @@ int VolumePathParseEx(const char* path, VURNVolumeRecord* volume) {
             }
         }
         int type = VURN_VOLUME_TYPE_INTERNAL;
-        if (listed_type == "external") {
-            type = VURN_VOLUME_TYPE_EXTERNAL;
-        } else if (listed_type.empty()) {
+        bool directory = false;
+        if (listed_type.empty()) {
             type = !device.empty() && IsExternalDevice(device) ? VURN_VOLUME_TYPE_EXTERNAL
                                                                : VURN_VOLUME_TYPE_INTERNAL;
-        } else if (listed_type != "internal") {
+        } else if (!ParseVolumeValue(listed_type, type, directory)) {
             Logger::LogMsg(
                 Logger::Error,
                 "[ERROR] host_facts.cpp(%d): Invalid volume type '%s' for '%s' in '%s'\n", __LINE__,
@@ -429,6 +451,54 @@ int VolumePathParseEx(const char* path, VURNVolumeRecord* volume) {
         }
         std::memcpy(volume->path, best.c_str(), best.size() + 1);
         volume->type = type;
+    } catch (const std::bad_alloc&) {
+        return Fail(VLIB_ERR_OUT_OF_MEMORY);
+    }
+    return Succeed(0);
+}
+
+int VURNVolumeIsMounted(const char* volumePath) {
+    if (volumePath == nullptr || volumePath[0] != '/') {
+        return Fail(VLIB_ERR_BAD_PARAMETER);
+    }
+    try {
+        std::string volume = StripSlashes(volumePath);
+        char resolved[PATH_MAX];
+        if (realpath(volume.c_str(), resolved) != nullptr) {
+            volume = resolved;
+        }
+        std::vector<Mount> mounts;
+        if (!ReadMounts(mounts)) {
+            Logger::LogMsg(Logger::Error,
+                           "[ERROR] host_facts.cpp(%d): Fail to read the mount table\n", __LINE__);
+            return Fail(VLIB_ERR_IO);
+        }
+        for (const Mount& m : mounts) {
+            if (m.path == volume) {
+                return Succeed(1);
+            }
+        }
+        SectionDoc conf;
+        if (LoadHostConf(conf) != 0) {
+            return -1;
+        }
+        // A listed volume is a mount path unless it says it is a directory; one that is not
+        // listed was found in the mount table and is gone from it now.
+        for (const auto& pair : conf.SectionPairs("volumes")) {
+            if (StripSlashes(pair.first) != StripSlashes(volumePath)) {
+                continue;
+            }
+            int type = 0;
+            bool directory = false;
+            if (!ParseVolumeValue(s2s_platform::Trim(pair.second), type, directory)) {
+                Logger::LogMsg(
+                    Logger::Error,
+                    "[ERROR] host_facts.cpp(%d): Invalid volume type '%s' for '%s' in '%s'\n",
+                    __LINE__, pair.second.c_str(), pair.first.c_str(), S2SPath(S2S_PATH_HOST_CONF));
+                return Fail(VLIB_ERR_BAD_FORMAT);
+            }
+            return Succeed(directory ? 1 : 0);
+        }
     } catch (const std::bad_alloc&) {
         return Fail(VLIB_ERR_OUT_OF_MEMORY);
     }

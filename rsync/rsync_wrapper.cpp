@@ -29,6 +29,8 @@ constexpr const char* kDefaultRemoteConfig = "/usr/vurn/etc/s2s_rsyncd.conf";
 constexpr const char* kKeyModule = "@s2s-key";
 constexpr size_t kKeptErrorLines = 8;
 constexpr int kRsyncVanished = 24;  // rsync: some source files vanished during the run
+// Marks the lines of a dry run's entries in rsync's merged output, apart from its messages.
+constexpr const char kItemPrefix[] = "s2s-item:";
 
 bool HasControl(const std::string& s) {
     for (unsigned char c : s) {
@@ -338,6 +340,16 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
                 line.replace(at, password.size(), "***");
             }
         }
+        if (dryRunItems && line.compare(0, sizeof(kItemPrefix) - 1, kItemPrefix) == 0) {
+            // "<change summary> <path>": the summary is one word ("*deleting" is padded).
+            const std::string item = line.substr(sizeof(kItemPrefix) - 1);
+            const size_t blank = item.find(' ');
+            const size_t path = item.find_first_not_of(' ', blank);
+            if (blank != std::string::npos && path != std::string::npos) {
+                dryRunItems(item.substr(0, blank), item.substr(path));
+            }
+            return;
+        }
         int percent = ProgressPercent(line);
         if (percent >= 0) {
             lastPercent = percent;
@@ -421,7 +433,7 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     // within the second of the last run, and a folder's time, would be taken as unchanged. A
     // negative window compares the nanoseconds too.
     a = {"--recursive", "--links", "--perms", "--times", "--modify-window=-1", "--hard-links"};
-    if (!listOnly && HoldsSparseFile(src)) {
+    if (!listOnly && !dryRunItems && HoldsSparseFile(src)) {
         a.push_back("--sparse");
     }
     if (pseudoRoot) {
@@ -433,6 +445,14 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     }
     if (deleteExtraneous) {
         a.push_back("--delete");
+        if (maxDelete >= 0) {
+            a.push_back("--max-delete=" + std::to_string(maxDelete));
+        }
+    }
+    if (dryRunItems) {
+        // Twice: unchanged entries are listed too, so the receiver's side can be counted.
+        a.insert(a.end(), {"--dry-run", "--itemize-changes", "--itemize-changes",
+                           std::string("--out-format=") + kItemPrefix + "%i %n"});
     }
     if (compress) {
         a.push_back("--compress");
@@ -555,6 +575,13 @@ void RsyncWrapper::setSshIdentityFile(std::string path) {
 }
 void RsyncWrapper::setProgressCallback(boost::function<void(int)> callback) {
     impl_->progress = std::move(callback);
+}
+void RsyncWrapper::setMaxDelete(long long count) {
+    impl_->maxDelete = count;
+}
+void RsyncWrapper::setDryRun(
+    boost::function<void(const std::string& change, const std::string& path)> callback) {
+    impl_->dryRunItems = std::move(callback);
 }
 
 int RsyncWrapper::execute(boost::function<bool()> cancel) {

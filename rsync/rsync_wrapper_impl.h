@@ -47,6 +47,8 @@ struct RsyncWrapper::Impl {
     std::string knownHosts;
     std::string identity;
     boost::function<void(int)> progress;
+    long long maxDelete = -1;
+    boost::function<void(const std::string&, const std::string&)> dryRunItems;
 
     std::string lastError;
 

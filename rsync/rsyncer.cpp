@@ -138,6 +138,7 @@ int Rsyncer::RunSync(unsigned long long /*id*/, const std::string& shareName,
     if (progressCallback) {
         task.setProgressCallback(progressCallback);
     }
+    task.SetMaxDelete(maxDelete);
 
     std::string src;
     if (relPath == "/") {

@@ -65,7 +65,7 @@ trap 'exit 130' INT TERM
 make_host() {  # root serial
   mkdir -p "$1/etc/s2s" "$1/tmp/S2S" "$1/volume1" "$1/usr/vurn/etc/.encrypt"
   chmod 700 "$1/tmp/S2S"
-  printf '[host]\n\tserial="%s"\n[volumes]\n\t%s="internal"\n' "$2" "$1/volume1" \
+  printf '[host]\n\tserial="%s"\n[volumes]\n\t%s="internal,directory"\n' "$2" "$1/volume1" \
     >"$1/etc/s2s/host.conf"
 }
 make_host "$sender" "SN-DEMO-SENDER"

@@ -222,11 +222,22 @@ TEST_F(HostFacts, HostFileNamesVolumesAndTheirType) {
     WriteHostConf("[volumes]\n\t" + volume + "=\"internal\"\n");
     ASSERT_EQ(VolumePathParseEx(share.c_str(), &rec), 0);
     EXPECT_EQ(rec.type, VURN_VOLUME_TYPE_INTERNAL);
+    // A listed volume is a mount path: a plain directory there is a volume that is not mounted.
+    EXPECT_EQ(VURNVolumeIsMounted(volume.c_str()), 0);
+    EXPECT_EQ(VURNVolumeIsMounted("/proc"), 1);
 
-    WriteHostConf("[volumes]\n\t" + volume + "=\"usb\"\n");
-    EXPECT_NE(VolumePathParseEx(share.c_str(), &rec), 0);
-    EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_BAD_FORMAT);
-    EXPECT_TRUE(log.Contains("Invalid volume type 'usb'"));
+    WriteHostConf("[volumes]\n\t" + volume + "=\"external, directory\"\n");
+    ASSERT_EQ(VolumePathParseEx(share.c_str(), &rec), 0);
+    EXPECT_EQ(rec.type, VURN_VOLUME_TYPE_EXTERNAL);
+    EXPECT_EQ(VURNVolumeIsMounted(volume.c_str()), 1);
+
+    for (const char* bad : {"usb", "internal,dir"}) {
+        WriteHostConf("[volumes]\n\t" + volume + "=\"" + bad + "\"\n");
+        EXPECT_NE(VolumePathParseEx(share.c_str(), &rec), 0);
+        EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_BAD_FORMAT);
+        EXPECT_LT(VURNVolumeIsMounted(volume.c_str()), 0);
+        EXPECT_TRUE(log.Contains(std::string("Invalid volume type '") + bad + "'"));
+    }
 }
 
 TEST_F(HostFacts, VolumeFailures) {

@@ -107,7 +107,7 @@ class ClientHost {
         if (!serial.empty()) {
             text += "\tserial=\"" + serial + "\"\n";
         }
-        text += "[volumes]\n\t" + Volume() + "=\"internal\"\n";
+        text += "[volumes]\n\t" + Volume() + "=\"internal,directory\"\n";
         s2s_test::WriteFile(real_ + "/etc/s2s/host.conf", text);
     }
 

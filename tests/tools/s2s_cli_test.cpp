@@ -140,6 +140,7 @@ TEST_F(CliTest, TaskFilesAreCheckedStrictly) {
         {"{\"ssh_port\": 4294967296}", "key \"ssh_port\" must be a whole number"},
         {"{\"schedule_mode\": 2.5}", "key \"schedule_mode\" must be a whole number"},
         {"{\"compress\": 2}", "key \"compress\" must be true, false, 1 or 0"},
+        {"{\"max_delete\": \"20%%\"}", "key \"max_delete\": deletion limit"},
         {"{\"share_list\": [\"a\", 1]}", "every entry must be a string"},
         {"{\"name\": \"a\", \"name\": \"b\"}", "key \"name\" appears more than once"},
         {"[1, 2]", "one JSON object"},

@@ -291,9 +291,9 @@ class Host {
         MakeDirs(root_ + "/tmp/S2S", 0700);
         MakeDirs(Volume());
         MakeDirs(root_ + "/logs");
-        s2s_test::WriteFile(
-            root_ + "/etc/s2s/host.conf",
-            "[host]\n\tserial=\"" + serial + "\"\n[volumes]\n\t" + Volume() + "=\"internal\"\n");
+        s2s_test::WriteFile(root_ + "/etc/s2s/host.conf", "[host]\n\tserial=\"" + serial +
+                                                              "\"\n[volumes]\n\t" + Volume() +
+                                                              "=\"internal,directory\"\n");
     }
 
     const std::string& Root() const { return root_; }

@@ -1,7 +1,9 @@
 // End-to-end scenarios of `s2s sync` against a real receiver (s2s-receiver and its rsync daemon):
-// what arrives on the receiving server after a first sync, an incremental one, deletions, and a
-// receiver restarted in the middle of a transfer.
+// what arrives on the receiving server after a first sync, an incremental one, deletions, a
+// receiver restarted in the middle of a transfer, and the guards that keep an empty or unmounted
+// source and an oversized deletion from wiping the receiver's copy.
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 
 #include "tools/s2s_scenario.h"
 
@@ -145,6 +147,85 @@ TEST_F(SyncScenario, ReceiverRestartedMidTransferThenResyncedToCompletion) {
     ExpectSame("docs");
     EXPECT_FALSE(HasPartialFile(receiver_->SharePath("docs"), 0));
     EXPECT_NE(receiver_->Status().out.find("share: docs completed SN-SENDER-A"), std::string::npos);
+}
+
+// An emptied folder would empty the receiver's copy: the share is refused, the other share still
+// syncs, and only an explicit override lets the emptiness through.
+TEST_F(SyncScenario, EmptiedFolderIsRefusedUnlessAllowed) {
+    GenerateFiles(sender_->SharePath("docs"), 20, 100, 9);
+    GenerateFiles(sender_->SharePath("media"), 2, 100, 10);
+    Result r = sender_->Sync(kUser, {"docs", "media"});
+    ASSERT_EQ(r.status, 0) << r.All();
+    const auto full = Manifest(receiver_->SharePath("docs"));
+
+    s2s_test::RemoveTree(sender_->SharePath("docs"));
+    MakeDirs(sender_->SharePath("docs"));
+    WriteFile(sender_->SharePath("media") + "/new", "new");
+    r = sender_->Sync(kUser, {"docs", "media"}, {"--json"});
+    EXPECT_EQ(r.status, 12) << r.All();
+    EXPECT_NE(r.out.find("\"guard\": \"empty-source\""), std::string::npos) << r.out;
+    EXPECT_NE(r.out.find("\"would_delete\": 20"), std::string::npos) << r.out;
+    EXPECT_NE(r.err.find("--allow-empty-source"), std::string::npos) << r.err;
+    EXPECT_EQ(Manifest(receiver_->SharePath("docs")), full);
+    ExpectSame("media");
+    EXPECT_NE(r.out.find("\"state\": \"refused\""), std::string::npos) << r.out;
+
+    r = sender_->Sync(kUser, {"docs"}, {"--allow-empty-source"});
+    ASSERT_EQ(r.status, 0) << r.All();
+    ExpectSame("docs");
+}
+
+// A cap on deletions stops a run before it deletes anything; a count and a percentage of the
+// receiver's entries, hit and not hit.
+TEST_F(SyncScenario, DeletionCapStopsTheRunBeforeItDeletes) {
+    GenerateFiles(sender_->SharePath("docs"), 10, 100, 11);
+    Result r = sender_->Sync(kUser, {"docs"}, {"--max-delete", "0"});
+    ASSERT_EQ(r.status, 0) << r.All();
+    for (const char* name : {"file1", "file2", "file3"}) {
+        ASSERT_EQ(unlink((sender_->SharePath("docs") + "/" + name).c_str()), 0);
+    }
+    const auto before = Manifest(receiver_->SharePath("docs"));
+    for (const char* cap : {"2", "29%"}) {
+        r = sender_->Sync(kUser, {"docs"}, {"--max-delete", cap});
+        EXPECT_EQ(r.status, 13) << cap << r.All();
+        EXPECT_NE(r.err.find("would delete 3 entries of the receiver's 10"), std::string::npos)
+            << r.err;
+        EXPECT_EQ(Manifest(receiver_->SharePath("docs")), before) << cap;
+    }
+    EXPECT_EQ(sender_->Sync(kUser, {"docs"}, {"--max-delete", "20%%"}).status, 2);
+    r = sender_->Sync(kUser, {"docs"}, {"--max-delete", "30%"});
+    ASSERT_EQ(r.status, 0) << r.All();
+    ExpectSame("docs");
+}
+
+// A volume that is a mount point and is not mounted leaves the bare mount point behind; whatever
+// lies there is not the share and must not be mirrored.
+TEST_F(SyncScenario, UnmountedVolumeIsRefused) {
+    if (unshare(CLONE_NEWNS) != 0 ||
+        mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
+        GTEST_SKIP() << "needs a private mount namespace";
+    }
+    const std::string volume = sender_->Volume();
+    const std::string disk = sender_->Root() + "/disk";
+    MakeDirs(disk + "/docs");
+    ASSERT_EQ(mount(disk.c_str(), volume.c_str(), nullptr, MS_BIND, nullptr), 0);
+    struct Unmount {
+        std::string path;
+        ~Unmount() { umount2(path.c_str(), MNT_DETACH); }
+    } unmount{volume};
+    WriteFile(sender_->Root() + "/etc/s2s/host.conf",
+              "[host]\n\tserial=\"SN-SENDER-A\"\n[volumes]\n\t" + volume + "=\"internal\"\n");
+    GenerateFiles(sender_->SharePath("docs"), 5, 100, 12);
+    Result r = sender_->Sync(kUser, {"docs"});
+    ASSERT_EQ(r.status, 0) << r.All();
+    const auto full = Manifest(receiver_->SharePath("docs"));
+
+    ASSERT_EQ(umount(volume.c_str()), 0);
+    WriteFile(sender_->SharePath("docs") + "/stray", "written while the volume was away");
+    r = sender_->Sync(kUser, {"docs"}, {"--json", "--allow-empty-source"});
+    EXPECT_EQ(r.status, 12) << r.All();
+    EXPECT_NE(r.out.find("\"guard\": \"volume-not-mounted\""), std::string::npos) << r.out;
+    EXPECT_EQ(Manifest(receiver_->SharePath("docs")), full);
 }
 
 }  // namespace

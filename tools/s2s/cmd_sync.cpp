@@ -15,6 +15,7 @@
 
 #include "s2s_host.h"
 #include "s2s_rsyncer.h"
+#include "s2s_source_guard.h"
 #include "s2s_sync_obj.h"
 #include "tools/s2s/commands.h"
 #include "tools/s2s/exit_codes.h"
@@ -48,6 +49,8 @@ const std::vector<OptionSpec> kSyncOptions = {
     {"max-bandwidth", "N", false, "the bandwidth limit handed to rsync (0: none)"},
     {"password-file", "FILE", false, "read the password from FILE (mode 600; - for stdin)"},
     {"exclude", "PATTERN", true, "leave out files matching an rsync exclude pattern"},
+    {"allow-empty-source", "", false, "sync an empty share folder even over a full copy"},
+    {"max-delete", "N|N%", false, "refuse a share's run that would delete more than N (or N%)"},
     {"json", "", false, "print a JSON summary on standard output (messages go to stderr)"},
     {"no-progress", "", false, "no progress display while copying"},
     {"quiet", "", false, "only errors and the summary"},
@@ -157,8 +160,10 @@ struct ShareReport {
     double finish_seconds = 0.0;
     std::string state = "not-run";  // synced, failed, cancelled, refused, not-run
     int result = 0;
-    std::string step;  // the step that failed: start, copy, key, finish
+    std::string step;  // the step that failed: source-check, start, copy, key, finish
     std::string message;
+    std::string guard;            // why the source check refused the share
+    long long would_delete = -1;  // what the refused run would have deleted on the receiver
 };
 
 class SyncRun {
@@ -166,12 +171,14 @@ class SyncRun {
     SyncRun(const Options& opts, FILE* out) : opts_(opts), out_(out) {}
 
     int Run(S2S::SyncTask& task);
+    void SetGuardOptions(const S2S::SourceGuardOptions& guard) { guard_ = guard; }
     nlohmann::json Summary() const;
 
   private:
     int Connect();
     int Pair();
     void SyncShare(ShareReport& share);
+    bool GuardSource(ShareReport& share);
     int Finish(int code, const std::string& message);
     void Say(const char* format, ...) __attribute__((format(printf, 2, 3)));
 
@@ -179,6 +186,7 @@ class SyncRun {
     FILE* out_;
     S2S::SyncTask task_;
     S2S::Rsyncer rsyncer_;
+    S2S::SourceGuardOptions guard_;
     std::vector<ShareReport> shares_;
     Clock::time_point started_ = Clock::now();
     int exit_code_ = kExitOK;
@@ -311,6 +319,9 @@ void SyncRun::SyncShare(ShareReport& share) {
     }
     share.encrypted = info.IsEncrypted();
     share.size = MeasureTree(info.GetModulePath());
+    if (!GuardSource(share)) {
+        return;
+    }
 
     int result = 0;
     Clock::time_point step = Clock::now();
@@ -411,6 +422,43 @@ void SyncRun::SyncShare(ShareReport& share) {
         FormatBytes(share.read_bytes).c_str(), share.seconds);
 }
 
+// Before anything is sent: a share whose folder is missing, not mounted or (against a full copy)
+// empty, or whose run would delete more than allowed, is refused and never marked complete.
+bool SyncRun::GuardSource(ShareReport& share) {
+    const std::vector<std::string> rules = opts_.GetAll("exclude");
+    const S2S::SourceGuardReport guard = S2S::CheckShareSource(
+        rsyncer_, share.name, std::list<std::string>(rules.begin(), rules.end()), guard_,
+        &CancelRequested);
+    if (guard.result == S2S::SourceGuardResult::kSafe) {
+        return true;
+    }
+    share.step = "source-check";
+    share.guard = S2S::SourceGuardResultName(guard.result);
+    if (guard.receiver.known) {
+        share.would_delete = static_cast<long long>(guard.receiver.deletions);
+    }
+    share.message = guard.message;
+    if (g_stop_signal != 0) {
+        share.state = "cancelled";
+    } else if (guard.result == S2S::SourceGuardResult::kCheckFailed) {
+        share.state = "failed";
+        share.result = guard.dryRunResult;
+        Finish(guard.dryRunResult != 0 ? ClassifyTransferResult(guard.dryRunResult) : kExitInternal,
+               share.message + (guard.dryRunResult != 0 ? ": " + ResultName(guard.dryRunResult)
+                                                        : std::string()));
+    } else if (guard.result == S2S::SourceGuardResult::kTooManyDeletions) {
+        share.state = "refused";
+        Finish(kExitMaxDelete, share.message);
+    } else {
+        share.state = "refused";
+        Finish(kExitUnsafeSource,
+               share.message + (guard.result == S2S::SourceGuardResult::kEmptySource
+                                    ? " (--allow-empty-source syncs it anyway)"
+                                    : ""));
+    }
+    return false;
+}
+
 int SyncRun::Run(S2S::SyncTask& task) {
     task_ = task;
     quiet_ = opts_.Has("quiet");
@@ -486,11 +534,19 @@ nlohmann::json SyncRun::Summary() const {
                                 {"bytes", share.size.bytes}, {"seconds", share.seconds}};
         if (!share.step.empty()) {
             entry["failed_step"] = share.step;
+        }
+        if (!share.step.empty() && (share.guard.empty() || share.result != 0)) {
             entry["result"] = share.result;
             entry["result_name"] = ResultName(share.result);
         }
         if (!share.message.empty()) {
             entry["message"] = share.message;
+        }
+        if (!share.guard.empty()) {
+            entry["guard"] = share.guard;
+        }
+        if (share.would_delete >= 0) {
+            entry["would_delete"] = share.would_delete;
         }
         if (share.state == "synced") {
             files += share.size.files;
@@ -583,6 +639,7 @@ int RunSyncCommand(const Options& opts) {
     SetupLogging(verbosity);
 
     S2S::SyncTask task;
+    S2S::SourceGuardOptions guard;
     bool task_has_password = false;
     if (opts.Has("task")) {
         for (const char* option : {"name", "id", "server", "server-ip", "user", "share", "compress",
@@ -592,11 +649,18 @@ int RunSyncCommand(const Options& opts) {
                                             " cannot be used with --task (edit the task file)");
             }
         }
-        if (!LoadTask(opts.Get("task"), task, task_has_password, error)) {
+        if (!LoadTask(opts.Get("task"), task, guard, task_has_password, error)) {
             return Fail(kExitInvalidTask, error);
         }
     } else if (!TaskFromOptions(opts, task, error)) {
         return Fail(kExitUsage, error);
+    }
+
+    // The run's own options win over the task file's.
+    guard.allowEmptySource = guard.allowEmptySource || opts.Has("allow-empty-source");
+    if (opts.Has("max-delete") &&
+        !S2S::DeleteLimit::Parse(opts.Get("max-delete"), guard.maxDelete, error)) {
+        return Fail(kExitUsage, "--max-delete: " + error);
     }
 
     std::string password;
@@ -632,6 +696,7 @@ int RunSyncCommand(const Options& opts) {
 
     const bool json = opts.Has("json");
     SyncRun run(opts, json ? stderr : stdout);
+    run.SetGuardOptions(guard);
     const int code = run.Run(task);
     const nlohmann::json summary = run.Summary();
     if (json) {

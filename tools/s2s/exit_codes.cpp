@@ -25,6 +25,9 @@ const ExitInfo kExitTable[] = {
     {kExitTransfer, "transfer", "copying a share failed; it is not marked complete"},
     {kExitKeySync, "key-sync", "an encrypted share's key could not be sent"},
     {kExitRegistry, "registry", "the share registry could not be read or changed"},
+    {kExitUnsafeSource, "unsafe-source",
+     "a share's folder is missing, empty or not mounted; it was not synced"},
+    {kExitMaxDelete, "max-delete", "a share's run would have deleted more than allowed"},
     {kExitNoService, "no-service", "the sync service s2sd is not running"},
     {kExitNoSuchTask, "no-such-task", "the sync service keeps no task with that id"},
     {kExitBusy, "busy", "the task is running (cancel it first)"},
@@ -139,6 +142,9 @@ ExitCode ClassifyConnectResult(int code) {
 ExitCode ClassifyTransferResult(int code) {
     if (code == 20) {
         return kExitCancelled;
+    }
+    if (code == 25) {
+        return kExitMaxDelete;  // rsync's own deletion limit stopped the deletions
     }
     if (IsAuthFailure(code)) {
         return kExitAuth;

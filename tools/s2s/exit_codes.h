@@ -26,6 +26,10 @@ enum ExitCode : int {
     kExitBusy = 22,        // the task is running (cancel it first)
     kExitNotRunning = 23,  // cancel of a task that is not running
     kExitService = 24,     // the service refused the request or failed (see the message)
+    // a share's folder was missing, empty or not mounted; it was not synced
+    kExitUnsafeSource = 12,
+    // a share's run would have deleted more than --max-delete allows; nothing was deleted
+    kExitMaxDelete = 13,
     kExitCancelled = 130,  // stopped by Ctrl-C or SIGTERM; nothing marked complete
 };
 

@@ -31,11 +31,11 @@ std::string MainHelp() {
         "environment variable S2S_PASSWORD, never from the command line.\n"
         "\n"
         "Exit codes:\n";
-    const ExitCode codes[] = {kExitOK,        kExitInternal,    kExitUsage,   kExitInvalidTask,
-                              kExitPassword,  kExitUnreachable, kExitAuth,    kExitConflict,
-                              kExitRefused,   kExitTransfer,    kExitKeySync, kExitRegistry,
-                              kExitNoService, kExitNoSuchTask,  kExitBusy,    kExitNotRunning,
-                              kExitService,   kExitCancelled};
+    const ExitCode codes[] = {kExitOK,           kExitInternal,    kExitUsage,     kExitInvalidTask,
+                              kExitPassword,     kExitUnreachable, kExitAuth,      kExitConflict,
+                              kExitRefused,      kExitTransfer,    kExitKeySync,   kExitRegistry,
+                              kExitUnsafeSource, kExitMaxDelete,   kExitNoService, kExitNoSuchTask,
+                              kExitBusy,         kExitNotRunning,  kExitService,   kExitCancelled};
     for (ExitCode code : codes) {
         char line[160];
         std::snprintf(line, sizeof(line), "  %3d  %-13s %s\n", static_cast<int>(code),

@@ -48,6 +48,8 @@ const KeySpec kKeys[] = {
     {"repeat_times_in_day", Kind::Int32},
     {"status", Kind::Int32},
     {"sync_result", Kind::Int32},
+    {"allow_empty_source", Kind::Bool},
+    {"max_delete", Kind::String},
 };
 
 const KeySpec* FindKey(const std::string& key) {
@@ -199,7 +201,24 @@ bool ParseTaskJson(const std::string& text, S2S::PObject& map, std::string& erro
         }
         result[it.key()] = value;
     }
+    S2S::SourceGuardOptions guard;
+    if (!GuardOptionsFromMap(result, guard, error)) {
+        return false;
+    }
     map = result;
+    return true;
+}
+
+bool GuardOptionsFromMap(const S2S::PObject& map, S2S::SourceGuardOptions& options,
+                         std::string& error) {
+    if (map.hasMember("allow_empty_source")) {
+        options.allowEmptySource = map["allow_empty_source"].asBool();
+    }
+    if (map.hasMember("max_delete") &&
+        !S2S::DeleteLimit::Parse(map["max_delete"].asString(), options.maxDelete, error)) {
+        error = "key \"max_delete\": " + error;
+        return false;
+    }
     return true;
 }
 
@@ -240,6 +259,21 @@ bool LoadTask(const std::string& path, S2S::SyncTask& task, bool& has_password,
     S2S::PObj2SyncTask(map, task);
     return true;
 }
+
+bool LoadTask(const std::string& path, S2S::SyncTask& task, S2S::SourceGuardOptions& guard,
+              bool& has_password, std::string& error) {
+    S2S::PObject map;
+    if (!LoadTaskFile(path, map, has_password, error)) {
+        return false;
+    }
+    if (!GuardOptionsFromMap(map, guard, error)) {
+        error = "task file '" + path + "': " + error;
+        return false;
+    }
+    S2S::PObj2SyncTask(map, task);
+    return true;
+}
+
 
 json PObjectToJson(const S2S::PObject& value) {
     if (value.isMap()) {

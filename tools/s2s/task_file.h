@@ -9,6 +9,7 @@
 #include <string>
 
 #include "s2s_pobject.h"
+#include "s2s_source_guard.h"
 #include "s2s_sync_obj.h"
 
 namespace s2s_cli {
@@ -23,6 +24,15 @@ bool LoadTaskFile(const std::string& path, S2S::PObject& map, bool& has_password
 
 // LoadTaskFile, then the map turned into a task by the sync model's own conversion.
 bool LoadTask(const std::string& path, S2S::SyncTask& task, bool& has_password, std::string& error);
+// The same, also giving the run options the file carries (GuardOptionsFromMap).
+bool LoadTask(const std::string& path, S2S::SyncTask& task, S2S::SourceGuardOptions& guard,
+              bool& has_password, std::string& error);
+
+// The run options a task file may carry beside the task map: "allow_empty_source" (a share's
+// empty folder may empty the receiver's copy) and "max_delete" ("N" or "N%", the deletion limit
+// of each share's run).
+bool GuardOptionsFromMap(const S2S::PObject& map, S2S::SourceGuardOptions& options,
+                         std::string& error);
 
 // The task map as JSON, without the password: the task's keys with the kinds of a task file
 // (booleans, signed numbers), other keys as PObjectToJson gives them.

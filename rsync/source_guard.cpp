@@ -1,0 +1,267 @@
+// The check in front of a share's data run: the source's folder and volume, an empty folder
+// against a full copy on the receiver, and the deletion limit (see s2s_source_guard.h).
+#include "s2s_source_guard.h"
+
+#include <dirent.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstring>
+#include <string>
+
+#include "s2s_logger.h"
+#include "s2s_platform.h"
+
+namespace S2S {
+
+namespace {
+
+// Well above any real tree; keeps the arithmetic of a percentage clear of overflow.
+constexpr unsigned long long kMaxDeleteCount = 1000000000000ULL;
+constexpr int kRsyncVanished = 24;
+
+std::string Entries(unsigned long long n) {
+    return std::to_string(n) + (n == 1 ? " entry" : " entries");
+}
+
+// 1 when the directory holds nothing, 0 when it holds something, -1 when it cannot be read.
+int IsEmptyDir(const std::string& path) {
+    DIR* dir = opendir(path.c_str());
+    if (dir == nullptr) {
+        return -1;
+    }
+    int empty = 1;
+    errno = 0;
+    while (struct dirent* entry = readdir(dir)) {
+        if (std::strcmp(entry->d_name, ".") != 0 && std::strcmp(entry->d_name, "..") != 0) {
+            empty = 0;
+            break;
+        }
+    }
+    if (empty == 1 && errno != 0) {
+        empty = -1;
+    }
+    closedir(dir);
+    return empty;
+}
+
+SourceGuardReport Refuse(SourceGuardResult result, const std::string& message) {
+    SourceGuardReport report;
+    report.result = result;
+    report.message = message;
+    return report;
+}
+
+}  // namespace
+
+const char* SourceGuardResultName(SourceGuardResult result) {
+    switch (result) {
+        case SourceGuardResult::kSafe:
+            return "safe";
+        case SourceGuardResult::kFolderMissing:
+            return "folder-missing";
+        case SourceGuardResult::kVolumeNotMounted:
+            return "volume-not-mounted";
+        case SourceGuardResult::kEmptySource:
+            return "empty-source";
+        case SourceGuardResult::kTooManyDeletions:
+            return "max-delete";
+        case SourceGuardResult::kCheckFailed:
+            return "check-failed";
+    }
+    return "unknown";
+}
+
+bool DeleteLimit::Parse(const std::string& text, DeleteLimit& limit, std::string& error) {
+    std::string digits = text;
+    const bool percent = !digits.empty() && digits.back() == '%';
+    if (percent) {
+        digits.pop_back();
+    }
+    if (digits.empty() || digits.size() > 13 ||
+        digits.find_first_not_of("0123456789") != std::string::npos) {
+        error = "deletion limit '" + text + "' is not a number of files (N) or a percentage (N%)";
+        return false;
+    }
+    const unsigned long long value = std::stoull(digits);
+    if ((percent && value > 100) || value > kMaxDeleteCount) {
+        error = "deletion limit '" + text + "' is out of range" +
+                (percent ? " (a percentage is at most 100%)" : "");
+        return false;
+    }
+    limit.set = true;
+    limit.percent = percent;
+    limit.value = value;
+    return true;
+}
+
+unsigned long long DeleteLimit::Allowed(unsigned long long entries) const {
+    if (!percent) {
+        return value;
+    }
+    // entries / 100 * value + the remainder's share: exact and free of overflow.
+    return entries / 100 * value + entries % 100 * value / 100;
+}
+
+std::string DeleteLimit::ToString() const {
+    if (!set) {
+        return std::string();
+    }
+    return std::to_string(value) + (percent ? "%" : "");
+}
+
+int InspectShareSource(const std::string& shareName, const ShareInfo& info, SourceState& state) {
+    state = SourceState();
+    state.folder = info.GetModulePath();
+    struct stat st;
+    state.folderExists =
+        !state.folder.empty() && stat(state.folder.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+    if (!state.folderExists) {
+        return 0;
+    }
+    VolumeInfo volume;
+    if (GetVolumeInfo(shareName, volume) < 0) {
+        Logger::LogMsg(Logger::Error,
+                       "[ERROR] source_guard.cpp(%d): Fail to get the volume of share '%s'\n",
+                       __LINE__, shareName.c_str());
+        return -1;
+    }
+    state.volume = volume.GetPath();
+    const int mounted = VURNVolumeIsMounted(state.volume.c_str());
+    if (mounted < 0) {
+        Logger::LogMsg(Logger::Error,
+                       "[ERROR] source_guard.cpp(%d): Fail to tell whether volume '%s' is "
+                       "mounted\n",
+                       __LINE__, state.volume.c_str());
+        return -1;
+    }
+    state.volumeMounted = mounted == 1;
+    const int empty = IsEmptyDir(state.folder);
+    if (empty < 0) {
+        const int saved = errno;
+        Logger::LogMsg(Logger::Error, "[ERROR] source_guard.cpp(%d): Fail to read '%s': %s\n",
+                       __LINE__, state.folder.c_str(), std::strerror(saved));
+        return -1;
+    }
+    state.folderEmpty = empty == 1;
+    return 0;
+}
+
+bool NeedsReceiverCopy(const SourceState& source, const SourceGuardOptions& options) {
+    if (!source.folderExists || !source.volumeMounted) {
+        return false;
+    }
+    return (source.folderEmpty && !options.allowEmptySource) || options.maxDelete.set;
+}
+
+SourceGuardReport JudgeShareSource(const std::string& shareName, const SourceState& source,
+                                   const SourceGuardOptions& options,
+                                   const ReceiverCopy& receiver) {
+    const std::string share = "share '" + shareName + "'";
+    const std::string kept = "; nothing was copied or deleted";
+    SourceGuardReport report;
+    if (!source.folderExists) {
+        report = Refuse(SourceGuardResult::kFolderMissing,
+                        share + ": its folder " + source.folder +
+                            " does not exist (is its volume mounted?)" + kept);
+    } else if (!source.volumeMounted) {
+        report = Refuse(SourceGuardResult::kVolumeNotMounted,
+                        share + ": its volume " + source.volume +
+                            " is not mounted (a volume that is a plain directory is listed as "
+                            "\"internal,directory\" in " +
+                            S2SPath(S2S_PATH_HOST_CONF) + ")" + kept);
+    } else if (NeedsReceiverCopy(source, options) && !receiver.known) {
+        report = Refuse(SourceGuardResult::kCheckFailed,
+                        share + ": what the receiver holds could not be learnt" + kept);
+    } else if (source.folderEmpty && !options.allowEmptySource && receiver.deletions > 0) {
+        report = Refuse(SourceGuardResult::kEmptySource,
+                        share + ": its folder " + source.folder +
+                            " is empty while the receiver's copy holds " +
+                            Entries(receiver.deletions) + ", which the run would delete" + kept);
+    } else if (options.maxDelete.set &&
+               receiver.deletions > options.maxDelete.Allowed(receiver.entries)) {
+        report = Refuse(SourceGuardResult::kTooManyDeletions,
+                        share + ": the run would delete " + Entries(receiver.deletions) +
+                            " of the receiver's " + std::to_string(receiver.entries) +
+                            ", more than the limit of " +
+                            std::to_string(options.maxDelete.Allowed(receiver.entries)) +
+                            (options.maxDelete.percent ? " (" + options.maxDelete.ToString() + ")"
+                                                       : std::string()) +
+                            kept);
+    }
+    if (report.result == SourceGuardResult::kSafe && options.maxDelete.set) {
+        report.allowedDeletions =
+            static_cast<long long>(options.maxDelete.Allowed(receiver.entries));
+    }
+    report.source = source;
+    report.receiver = receiver;
+    return report;
+}
+
+int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
+                    const std::list<std::string>& excludes, bool (*cancel)(), ReceiverCopy& copy,
+                    int& result) {
+    copy = ReceiverCopy();
+    ShareInfo info;
+    if (rsyncer.GetShareInfo(shareName, info) < 0) {
+        Logger::LogMsg(Logger::Error, "[ERROR] source_guard.cpp(%d): Fail to get share info\n",
+                       __LINE__);
+        return -1;
+    }
+    // The same transfer as the data run (RunSync), without its debug log.
+    Rsyncer::RsyncTask task;
+    rsyncer.InitRsyncTask(task, true);
+    task.SetSyncACL(true);
+    unsigned long long entries = 0;
+    unsigned long long deletions = 0;
+    task.setDryRun([&](const std::string& change, const std::string& path) {
+        if (change == "*deleting") {
+            ++deletions;
+            ++entries;
+        } else if (path != "./" && change.find("+++++++++") == std::string::npos) {
+            ++entries;  // there on both sides
+        }
+    });
+    result = task.Execute(info.GetModulePath() + "/", info.GetModuleName(), cancel, "", excludes);
+    if (result == 0 || result == kRsyncVanished) {
+        copy.known = true;
+        copy.entries = entries;
+        copy.deletions = deletions;
+    }
+    return 0;
+}
+
+SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::string& shareName,
+                                   const std::list<std::string>& excludes,
+                                   const SourceGuardOptions& options, bool (*cancel)()) {
+    SourceGuardReport report;
+    ShareInfo info;
+    SourceState source;
+    if (rsyncer.GetShareInfo(shareName, info) < 0 ||
+        InspectShareSource(shareName, info, source) < 0) {
+        report = Refuse(SourceGuardResult::kCheckFailed,
+                        "share '" + shareName + "': its folder or volume could not be examined");
+    } else {
+        ReceiverCopy receiver;
+        int result = 0;
+        if (NeedsReceiverCopy(source, options) &&
+            (DryRunShareSync(rsyncer, shareName, excludes, cancel, receiver, result) < 0 ||
+             !receiver.known)) {
+            report = Refuse(
+                SourceGuardResult::kCheckFailed,
+                "share '" + shareName + "': the dry run that counts the receiver's files failed");
+            report.source = source;
+            report.dryRunResult = result;
+        } else {
+            report = JudgeShareSource(shareName, source, options, receiver);
+        }
+    }
+    rsyncer.SetMaxDelete(report.result == SourceGuardResult::kSafe ? report.allowedDeletions : 0);
+    if (report.result != SourceGuardResult::kSafe) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] source_guard.cpp(%d): %s\n", __LINE__,
+                       report.message.c_str());
+    }
+    return report;
+}
+
+}  // namespace S2S
