@@ -60,6 +60,13 @@ int ControlServer::Listen(const std::string& path, std::string& error) {
         return -1;
     }
     chmod(path.c_str(), 0600);
+    // Accepting drains the backlog until it would block, so the loop never waits in accept.
+    const int flags = fcntl(listener_.getFD(), F_GETFL);
+    if (flags < 0 || fcntl(listener_.getFD(), F_SETFL, flags | O_NONBLOCK) != 0) {
+        error = "cannot make the control socket non-blocking";
+        listener_.close();
+        return -1;
+    }
     path_ = path;
     return 0;
 }
