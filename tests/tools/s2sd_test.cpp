@@ -9,6 +9,7 @@
 #include "s2s_control.h"
 #include "s2s_control_client.h"
 #include "s2s_ipc.h"
+#include "s2s_task_run.h"
 #include "tools/s2s_scenario.h"
 
 namespace {
@@ -180,8 +181,7 @@ TEST_F(ControlSocket, HostileRequestsGetAClearErrorAndTheDaemonGoesOnServing) {
     PObject told;
     ASSERT_EQ(silent.recv(told), 0);
     EXPECT_EQ(StatusOf(told), Control::kBadRequest);
-    EXPECT_NE(told[Control::kKeyMessage].asString().find("no complete request"),
-              std::string::npos);
+    EXPECT_NE(told[Control::kKeyMessage].asString().find("no complete request"), std::string::npos);
 
     const PObject added = daemon_.Call(TaskRequest(Control::kAdd, {"docs"}, 0));
     ASSERT_EQ(StatusOf(added), Control::kOk) << added.toString();
@@ -259,7 +259,7 @@ TEST_F(DaemonScenario, RealTimeTaskFollowsChangesIncludingNewDirectories) {
     EXPECT_TRUE(WaitFor([&] { return s2s_test::ReadFile(arrived) == "written later"; }));
 }
 
-TEST_F(DaemonScenario, KilledDuringARunTheTaskAndHistorySurviveAndTheNextRunCompletes) {
+TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNextRunCompletes) {
     WriteRandomFile(sender_->SharePath("docs") + "/big", 300u << 20);
     PObject request = TaskRequest(Control::kAdd, {"docs"}, 0);
     request[Control::kKeyTask]["compress"] = 1ULL;
@@ -269,8 +269,29 @@ TEST_F(DaemonScenario, KilledDuringARunTheTaskAndHistorySurviveAndTheNextRunComp
     PObject run = Command(Control::kRun);
     run[Control::kKeyTaskId] = id;
     ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
-    ASSERT_TRUE(WaitFor([&] { return HasPartialFile(receiver_->SharePath("docs")); },
-                        std::chrono::seconds(60)))
+    const auto copying = [&] {
+        return WaitFor([&] { return HasPartialFile(receiver_->SharePath("docs")); },
+                       std::chrono::seconds(60));
+    };
+    ASSERT_TRUE(copying()) << daemon_->Log();
+
+    // SIGTERM: the transfer is cancelled, no rsync is left behind, the share is not complete.
+    EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
+    EXPECT_TRUE(ProcessesMentioning(sender_->SharePath("docs")).empty());
+    EXPECT_EQ(receiver_->Status().out.find("share: docs completed"), std::string::npos);
+    daemon_->Start();
+    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
+    // The copy is under way again (its progress shows in the status).
+    PObject status = Command(Control::kStatus);
+    status[Control::kKeyTaskId] = id;
+    ASSERT_TRUE(WaitFor(
+        [&] {
+            const PObject reply = daemon_->Call(status);
+            const PObject::Array& tasks = reply[Control::kKeyTasks].asArray();
+            return tasks.size() == 1 && tasks[0][Control::kKeyShare].asString() == "docs" &&
+                   tasks[0][Control::kKeyBytesDone].asUInt64() > 0;
+        },
+        std::chrono::seconds(60)))
         << daemon_->Log();
 
     EXPECT_EQ(daemon_->Stop(SIGKILL), 128 + SIGKILL);
@@ -284,13 +305,15 @@ TEST_F(DaemonScenario, KilledDuringARunTheTaskAndHistorySurviveAndTheNextRunComp
     show[Control::kKeyTaskId] = id;
     EXPECT_EQ(daemon_->Call(show)[Control::kKeyTask]["name"].asString(), "nightly");
     PObject::Array runs = Runs(id);
-    ASSERT_EQ(runs.size(), 1u);
-    EXPECT_EQ(runs[0][Control::kKeyResult].asUInt64(), 99u);
+    ASSERT_EQ(runs.size(), 2u);
+    EXPECT_EQ(runs[0][Control::kKeyResult].asUInt64(), 99u);  // interrupted
     EXPECT_NE(runs[0][Control::kKeyEnd].asUInt64(), 0u);
+    EXPECT_EQ(runs[1][Control::kKeyResult].asUInt64(),
+              static_cast<unsigned long long>(S2S::RunFailure::kCancelled));
     EXPECT_EQ(receiver_->Status().out.find("share: docs completed"), std::string::npos);
 
     ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
-    ASSERT_TRUE(WaitForRuns(id, 2, std::chrono::seconds(300))) << daemon_->Log();
+    ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(300))) << daemon_->Log();
     runs = Runs(id);
     EXPECT_EQ(runs[0][Control::kKeyResult].asUInt64(), 0u) << runs[0].toString();
     EXPECT_EQ(Manifest(sender_->SharePath("docs")), Manifest(receiver_->SharePath("docs")));
