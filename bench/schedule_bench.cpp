@@ -1,12 +1,13 @@
-// Cost of Schedule::GetNextScheduledSeconds, and its worst case.
+// Cost of Schedule::NextRunAfter and of the compatible GetNextScheduledSeconds, and their worst
+// cases.
 //
 // The next run is found by a day-by-day walk without an iteration limit. For a valid schedule the
 // walk is short: today, then the next allowed day, month or year. The cases below are the longest
 // walks that can be built (a yearly 29 February asked right after the common-year run on 1 March,
 // a once-a-week task asked at its own run time, a 31st-of-the-month task asked at a month end,
-// the last of 96 runs in a day), plus runs asked on a clock-change day, where each wall-clock
-// time is read both ways. BM_WorstFound searches a year of hourly moments over those schedules
-// in the chosen zone, times every call, and then measures the slowest pair it found.
+// the last of 96 runs in a day), plus runs asked on a clock-change day, where NextRunAfter reads
+// each wall-clock time both ways. BM_WorstFound searches a year of hourly moments over those
+// schedules in the chosen zone, times every call, and then measures the slowest pair it found.
 #include <benchmark/benchmark.h>
 
 #include <chrono>
@@ -21,6 +22,15 @@
 namespace {
 
 using S2S::Schedule;
+using NextFn = long (Schedule::*)(long) const;
+
+struct Function {
+    const char* name;
+    NextFn next;
+};
+
+const Function kFunctions[] = {{"NextRunAfter", &Schedule::NextRunAfter},
+                               {"GetNextScheduledSeconds", &Schedule::GetNextScheduledSeconds}};
 
 void UseZone(const char* zone) {
     setenv("TZ", zone, 1);
@@ -79,12 +89,12 @@ std::vector<Case> Cases() {
     };
 }
 
-void BM_NextRun(benchmark::State& state, const char* zone, size_t index) {
+void BM_NextRun(benchmark::State& state, NextFn next, const char* zone, size_t index) {
     UseZone(zone);
     const Case c = Cases()[index];
     long result = 0;
     for (auto _ : state) {
-        result = c.schedule.GetNextScheduledSeconds(c.now);
+        result = (c.schedule.*next)(c.now);
         benchmark::DoNotOptimize(result);
     }
     if (result < 0) {
@@ -93,7 +103,7 @@ void BM_NextRun(benchmark::State& state, const char* zone, size_t index) {
     state.SetLabel(c.name);
 }
 
-void BM_WorstFound(benchmark::State& state, const char* zone) {
+void BM_WorstFound(benchmark::State& state, NextFn next, const char* zone) {
     UseZone(zone);
     const std::vector<Case> cases = Cases();
     // Every hour of 2024 (and the minute before each), over every schedule above.
@@ -108,7 +118,7 @@ void BM_WorstFound(benchmark::State& state, const char* zone) {
                 double ns = 1e18;
                 for (int repeat = 0; repeat < 3; ++repeat) {
                     auto t0 = std::chrono::steady_clock::now();
-                    long r = cases[i].schedule.GetNextScheduledSeconds(at);
+                    long r = (cases[i].schedule.*next)(at);
                     auto t1 = std::chrono::steady_clock::now();
                     benchmark::DoNotOptimize(r);
                     double took = std::chrono::duration<double, std::nano>(t1 - t0).count();
@@ -124,7 +134,7 @@ void BM_WorstFound(benchmark::State& state, const char* zone) {
     }
     const Schedule& s = cases[worst_case].schedule;
     for (auto _ : state) {
-        benchmark::DoNotOptimize(s.GetNextScheduledSeconds(worst_now));
+        benchmark::DoNotOptimize((s.*next)(worst_now));
     }
     state.SetLabel(std::string(cases[worst_case].name) + " at " + std::to_string(worst_now));
 }
@@ -134,15 +144,19 @@ void BM_WorstFound(benchmark::State& state, const char* zone) {
 int main(int argc, char** argv) {
     const char* zones[] = {"UTC", "Europe/Berlin", "Australia/Lord_Howe"};
     const size_t count = Cases().size();
-    for (const char* zone : zones) {
-        for (size_t i = 0; i < count; ++i) {
+    for (const Function& f : kFunctions) {
+        const NextFn next = f.next;
+        for (const char* zone : zones) {
+            const std::string prefix = std::string("/") + f.name + "/" + zone;
+            for (size_t i = 0; i < count; ++i) {
+                benchmark::RegisterBenchmark(
+                    ("BM_NextRun" + prefix + "/" + Cases()[i].name).c_str(),
+                    [next, zone, i](benchmark::State& state) { BM_NextRun(state, next, zone, i); });
+            }
             benchmark::RegisterBenchmark(
-                (std::string("BM_NextRun/") + zone + "/" + Cases()[i].name).c_str(),
-                [zone, i](benchmark::State& state) { BM_NextRun(state, zone, i); });
+                ("BM_WorstFound" + prefix).c_str(),
+                [next, zone](benchmark::State& state) { BM_WorstFound(state, next, zone); });
         }
-        benchmark::RegisterBenchmark(
-            (std::string("BM_WorstFound/") + zone).c_str(),
-            [zone](benchmark::State& state) { BM_WorstFound(state, zone); });
     }
     benchmark::Initialize(&argc, argv);
     if (benchmark::ReportUnrecognizedArguments(argc, argv)) {

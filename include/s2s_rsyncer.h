@@ -97,8 +97,10 @@ class S2S_EXPORT Rsyncer {
     int InitRsyncTask(RsyncTask& task, bool isTest) const;
 
     // --- command files (0, or -1 with one ERROR line) ------------------------------------------
-    int GenServerVersionCmd(const std::string& outfile, std::list<std::string>& lines) const;
-    int GenSinglePairCmd(bool dryRun, std::list<std::string>& lines) const;
+    // These two are not const, as they have always been declared (programs link against them);
+    // the const DoSinglePairing builds its lines through SinglePairLines.
+    int GenServerVersionCmd(const std::string& outfile, std::list<std::string>& lines);
+    int GenSinglePairCmd(bool dryRun, std::list<std::string>& lines);
     int GenPairMultiSrcCmd(bool dryRun, const std::list<std::string>& shares,
                            const std::string& outfile, std::list<std::string>& lines) const;
     int GenFinishSyncCmd(const std::string& finishType, const std::string& name,
@@ -141,6 +143,8 @@ class S2S_EXPORT Rsyncer {
     // command="name", clientID="...", then key="value" per parameter, appended to `lines`.
     static int GenCommandLines(const std::string& command, const ParamList& params,
                                std::list<std::string>& lines);
+    // The lines of GenSinglePairCmd.
+    static int SinglePairLines(bool dryRun, std::list<std::string>& lines);
     // Runs command lines as one fresh command task of this server; the run's code in `result`.
     void RunCommandLines(const std::list<std::string>& lines, bool isTest, int& result) const;
 

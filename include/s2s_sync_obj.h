@@ -156,17 +156,33 @@ class S2S_EXPORT Schedule {
 
     bool Validate() const;
 
-    // Seconds since the epoch of the first run strictly after `now`; 0 when there is no next run
-    // (manual, or a "once" task whose run is past); -1 on error (logged). Realtime gives now + 1.
+    // The compatible arithmetic, as front ends compute it: near clock changes a run may be off by
+    // the change or a day, and yearly 29 February can slip to 1 March. Ours use NextRunAfter.
+    long GetNextScheduledSeconds(long now) const;
+
+    // Seconds since the epoch of the first run strictly after `now`, by the local wall clock; 0
+    // when there is no next run (manual, or a "once" task whose run is past); -1 on error (logged,
+    // with the same lines as GetNextScheduledSeconds). Realtime gives now + 1.
     // Run days: weekly on the chosen weekdays; monthly on begin_day of the current month and on,
     // a day the month lacks rolling over into the next (the 31st after April is 1 May); yearly on
-    // begin month and day of the current year and on (29 February is 1 March in common years);
-    // once on the begin date. A day's runs keep their wall-clock start time across clock
-    // changes; a start inside the repeated hour runs at its first occurrence only, one inside the
-    // skipped hour just after the jump; repeats follow in plain seconds.
-    // REQUIRES: a schedule that passes Validate(). The search walks day by day without a limit,
-    // so an invalid one (a negative repeat count, for example) may never find a run.
-    long GetNextScheduledSeconds(long now) const;
+    // begin month and day of the current year and on; once on the begin date. A day's first run
+    // is at its start time on the local clock; repeats follow in plain seconds.
+    // How it differs from GetNextScheduledSeconds (everything else is the same):
+    //   situation                          GetNextScheduledSeconds        NextRunAfter
+    //   a day after a clock change,        the flag of the day it was     the start time on
+    //   computed on a day before it        computed on is kept: the run   the local clock
+    //                                      is off by the change (1 h,
+    //                                      30 min) or on the day next to
+    //                                      it when aligned late at night
+    //   start inside the repeated hour,    runs again at the second       runs once, at the
+    //   asked after its first occurrence   occurrence                     first occurrence
+    //   start inside the skipped hour      moved on by the change         the first instant
+    //                                      (02:30 runs at 03:30)          after it: the jump
+    //   yearly on 29 February, the year    1 March of the leap year       29 February
+    //   after a common year
+    // REQUIRES (both): a schedule that passes Validate(). The search walks day by day without a
+    // limit, so an invalid one (a negative repeat count, for example) may never find a run.
+    long NextRunAfter(long now) const;
 
   private:
     SCHD_MODE mode_ = SCHD_MANUAL;

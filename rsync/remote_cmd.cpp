@@ -65,13 +65,17 @@ int Rsyncer::GenCommandLines(const std::string& command, const ParamList& params
     return 0;
 }
 
-int Rsyncer::GenServerVersionCmd(const std::string& outfile, std::list<std::string>& lines) const {
+int Rsyncer::GenServerVersionCmd(const std::string& outfile, std::list<std::string>& lines) {
     ParamList params;
     params.emplace_back("outfile", outfile);
     return GenCommandLines("S2S_GetProtocolVer", params, lines);
 }
 
-int Rsyncer::GenSinglePairCmd(bool dryRun, std::list<std::string>& lines) const {
+int Rsyncer::GenSinglePairCmd(bool dryRun, std::list<std::string>& lines) {
+    return SinglePairLines(dryRun, lines);
+}
+
+int Rsyncer::SinglePairLines(bool dryRun, std::list<std::string>& lines) {
     ParamList params;
     params.emplace_back("dryRun", YesNo(dryRun));
     params.emplace_back("serverName", GetHostName(kServerNameSkip));
@@ -174,7 +178,7 @@ void Rsyncer::RunCommandLines(const std::list<std::string>& lines, bool isTest, 
 
 int Rsyncer::DoSinglePairing(bool dryRun, int& result) const {
     std::list<std::string> lines;
-    if (GenSinglePairCmd(dryRun, lines) < 0) {
+    if (SinglePairLines(dryRun, lines) < 0) {
         Logger::LogMsg(Logger::Error,
                        "[ERROR] s2s_rsyncer.cpp(%d): SinglePairing: Fail to write command file\n",
                        __LINE__);

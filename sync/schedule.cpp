@@ -3,7 +3,9 @@
 // The next run is found by walking local calendar days from `now`: align to the next day the mode
 // allows, try that day's runs (the start time, then `repeat_times_in_day` more, `period` plain
 // seconds apart), else move to the following day. Day lengths, month lengths and clock changes
-// all come from the system's time-zone rules through mktime/localtime_r.
+// all come from the system's time-zone rules through mktime/localtime_r. One walk serves both
+// answers: the compatible arithmetic (mktime as it stands) and the wall-clock one.
+#include <climits>
 #include <cstring>
 #include <ctime>
 
@@ -63,15 +65,24 @@ bool NearOffsetChange(time_t when) {
     return at_before.tm_gmtoff != at_after.tm_gmtoff || at_before.tm_isdst != at_after.tm_isdst;
 }
 
-// mktime for broken-down times built by date arithmetic. Their daylight-saving flag is left over
-// from another day or another time of day, and mktime trusts it: a stale flag moves the result by
-// the size of the clock change (09:00 on the day the clocks go back becomes 08:00; 23:30 on the
-// day before they go forward becomes 00:30 of the next day, so a monthly run lands on the wrong
-// date). So the flag is ignored and the wall-clock time decides:
+// The local wall-clock time of `t` counted as if it were UTC, for ordering wall-clock readings.
+long WallSeconds(time_t t) {
+    struct tm local;
+    if (localtime_r(&t, &local) == nullptr) {
+        return LONG_MIN;
+    }
+    return static_cast<long>(t) + local.tm_gmtoff;
+}
+
+// mktime for broken-down times built by date arithmetic, by wall-clock time. Their daylight-saving
+// flag is left over from another day or another time of day, and mktime trusts it: a stale flag
+// moves the result by the size of the clock change (09:00 on the day the clocks go back becomes
+// 08:00; 23:30 on the day before they go forward becomes 00:30 of the next day, so a weekly run
+// lands on the wrong day). So the flag is ignored and the wall-clock time decides:
 // - a time that occurs once is that moment;
 // - a time inside the repeated hour is its first occurrence, so a run happens once, not twice;
-// - a time inside the skipped hour is read with the offset in force before the change, which puts
-//   it just after the jump (02:30 becomes 03:30), so the day still gets its run.
+// - a time inside the skipped hour is the first instant after it, the moment the clocks jump
+//   (02:30 on a 02:00 -> 03:00 night becomes 03:00), so the day still gets its run.
 // With keep_date (date arithmetic, where only the day matters) a reading on the asked-for day is
 // preferred, which matters only where the clocks jump across midnight.
 // The result, like mktime's, is -1 when the time cannot be represented; `tm` is then left as
@@ -80,7 +91,8 @@ time_t ResolveLocal(struct tm& tm, bool keep_date) {
     // The wall-clock time asked for, with the calendar overflow resolved (31 April is 1 May).
     struct tm wanted = tm;
     wanted.tm_isdst = 0;
-    const bool calendar_ok = timegm(&wanted) != -1;
+    const time_t wanted_wall = timegm(&wanted);
+    const bool calendar_ok = wanted_wall != -1;
 
     // Away from any change of UTC offset a wall-clock time occurs exactly once, and mktime finds
     // it without a flag. That is nearly always the case, and it is cheap: mktime given a definite
@@ -107,21 +119,35 @@ time_t ResolveLocal(struct tm& tm, bool keep_date) {
         return guess_secs;
     }
     const bool exact[2] = {SameWallClock(readings[0], wanted), SameWallClock(readings[1], wanted)};
-    int pick;
-    if (exact[0] && exact[1]) {
-        pick = secs[0] <= secs[1] ? 0 : 1;  // the first occurrence
-    } else if (exact[0] || exact[1]) {
-        pick = exact[0] ? 0 : 1;
-    } else {
-        // Skipped: the later of the two readings is the one with the earlier (smaller) offset.
-        pick = secs[0] >= secs[1] ? 0 : 1;
-        if (keep_date && !SameDate(readings[pick], wanted) &&
-            SameDate(readings[1 - pick], wanted)) {
-            pick = 1 - pick;
-        }
+    if (exact[0] || exact[1]) {
+        // Both exact inside the repeated hour: the first occurrence.
+        const int pick = exact[0] && exact[1] ? (secs[0] <= secs[1] ? 0 : 1) : (exact[0] ? 0 : 1);
+        tm = readings[pick];
+        return secs[pick];
     }
-    tm = readings[pick];
-    return secs[pick];
+    // Skipped. The two readings lie on either side of the jump: one shows an earlier wall-clock
+    // time than asked for, the other a later one. The jump is the first moment whose wall clock
+    // has passed the time asked for.
+    const int early = secs[0] <= secs[1] ? 0 : 1;
+    time_t lo = secs[early];
+    time_t hi = secs[1 - early];
+    if (WallSeconds(lo) >= static_cast<long>(wanted_wall)) {
+        tm = readings[early];
+        return secs[early];
+    }
+    while (hi - lo > 1) {
+        const time_t mid = lo + (hi - lo) / 2;
+        (WallSeconds(mid) >= static_cast<long>(wanted_wall) ? hi : lo) = mid;
+    }
+    if (localtime_r(&hi, &tm) == nullptr) {
+        tm = readings[1 - early];
+        return secs[1 - early];
+    }
+    if (keep_date && !SameDate(tm, wanted) && SameDate(readings[early], wanted)) {
+        tm = readings[early];
+        return secs[early];
+    }
+    return hi;
 }
 
 void LogTimeFields(int line, const char* what, const struct tm& tm) {
@@ -295,7 +321,25 @@ bool Schedule::Validate() const {
     return true;
 }
 
-long Schedule::GetNextScheduledSeconds(long now) const {
+namespace {
+
+// How the day walk turns a broken-down local time into seconds.
+enum class Clock {
+    // mktime as it stands. The daylight-saving flag is the one the time got from the last mktime,
+    // possibly of another day, and an aligned date that a common year lacks stays rolled over.
+    kCompatible,
+    // By the wall clock (ResolveLocal), the flag ignored; the next month or year is counted from
+    // the aligned date as asked for.
+    kWallClock,
+};
+
+time_t ToSeconds(struct tm& tm, Clock clock, bool keep_date) {
+    return clock == Clock::kWallClock ? ResolveLocal(tm, keep_date) : mktime(&tm);
+}
+
+// The next run after `now`, walking local calendar days: align to the next day the mode allows,
+// try that day's runs, else move on to the following day.
+long NextRun(const Schedule& schedule, long now, Clock clock) {
     if (now < 0) {
         return -1;
     }
@@ -309,29 +353,33 @@ long Schedule::GetNextScheduledSeconds(long now) const {
         std::memset(&now_tm, 0, sizeof(now_tm));
     }
 
-    if (mode_ == SCHD_MANUAL) {
+    const SCHD_MODE mode = schedule.GetMode();
+    if (mode == SCHD_MANUAL) {
         return 0;
     }
-    if (mode_ == SCHD_REALTIME) {
+    if (mode == SCHD_REALTIME) {
         return now + 1;
     }
+    const std::string week = schedule.GetWeekSchedule();
+    const int repeats = schedule.GetRepeatTimesInDay();
+    const long period = schedule.GetPeriodSeconds();
 
     // Each pass either returns or moves now_tm on by one day. A valid schedule has a run on every
-    // day (weekly), month (monthly) or year (yearly), so the walk is a few passes at most.
+    // chosen weekday, every month or every year, so the walk is a few passes at most.
     for (;;) {
-        const struct tm begin = GetScheduleBegin();
+        const struct tm begin = schedule.GetScheduleBegin();
         // The current day at the current time of day, with its weekday.
         struct tm ref = now_tm;
-        ResolveLocal(ref, true);
+        ToSeconds(ref, clock, true);
 
-        switch (mode_) {
+        switch (mode) {
             case SCHD_WEEKLY: {
-                int days = GetDaysToNextSync(static_cast<unsigned>(ref.tm_wday), week_schedule_);
+                int days = GetDaysToNextSync(static_cast<unsigned>(ref.tm_wday), week);
                 if (days < 0) {
                     Logger::LogMsg(Logger::Error,
                                    "[ERROR] s2s_sync_obj.cpp(%d): No chosen week day for sync "
                                    "'%s'\n",
-                                   kLineNoWeekday, week_schedule_.c_str());
+                                   kLineNoWeekday, week.c_str());
                     Logger::LogMsg(Logger::Error,
                                    "[ERROR] s2s_sync_obj.cpp(%d): Fail to align to scheduled day\n",
                                    kLineAlignFailed);
@@ -355,7 +403,7 @@ long Schedule::GetNextScheduledSeconds(long now) const {
             default:
                 Logger::LogMsg(Logger::Error,
                                "[ERROR] s2s_sync_obj.cpp(%d): Unknown schedule mode [%d]\n",
-                               kLineUnknownMode, static_cast<int>(mode_));
+                               kLineUnknownMode, static_cast<int>(mode));
                 Logger::LogMsg(Logger::Error,
                                "[ERROR] s2s_sync_obj.cpp(%d): Fail to align to scheduled day\n",
                                kLineAlignFailed);
@@ -363,7 +411,7 @@ long Schedule::GetNextScheduledSeconds(long now) const {
         }
 
         struct tm now_copy = now_tm;
-        long now_secs = static_cast<long>(ResolveLocal(now_copy, true));
+        long now_secs = static_cast<long>(ToSeconds(now_copy, clock, true));
         if (now_secs < 0) {
             LogTimeFields(kLineReferenceSeconds, "reference", now_copy);
             return -1;
@@ -371,7 +419,7 @@ long Schedule::GetNextScheduledSeconds(long now) const {
         // Normalising rolls an overflowing day into the next month: a monthly task on the 31st
         // runs on the 1st after a 30-day month.
         const struct tm aligned = ref;
-        long ref_secs = static_cast<long>(ResolveLocal(ref, true));
+        long ref_secs = static_cast<long>(ToSeconds(ref, clock, true));
 
         // Both carry the same time of day, so this says the aligned day lies before today.
         if (now_secs > ref_secs) {
@@ -379,16 +427,18 @@ long Schedule::GetNextScheduledSeconds(long now) const {
                 LogTimeFields(kLinePastScheduled, "scheduled", ref);
                 return -1;
             }
-            // The next month or year is counted from the aligned date as asked for, not as
-            // normalised: 29 February of a common year reads as 1 March, and one year on from
-            // there would miss the leap year's 29 February.
-            switch (mode_) {
+            // By the wall clock the next month or year is counted from the aligned date as asked
+            // for: 29 February of a common year reads as 1 March, and one year on from there
+            // would miss the leap year's 29 February. The compatible arithmetic counts from the
+            // normalised date. The next mktime normalises the sum.
+            if (clock == Clock::kWallClock && (mode == SCHD_MONTHLY || mode == SCHD_YEARLY)) {
+                ref = aligned;
+            }
+            switch (mode) {
                 case SCHD_MONTHLY:
-                    ref = aligned;
-                    ref.tm_mon += 1;  // the next mktime normalises
+                    ref.tm_mon += 1;
                     break;
                 case SCHD_YEARLY:
-                    ref = aligned;
                     ref.tm_year += 1;
                     break;
                 case SCHD_ONCE:
@@ -403,32 +453,32 @@ long Schedule::GetNextScheduledSeconds(long now) const {
                     Logger::LogMsg(Logger::Error,
                                    "[ERROR] s2s_sync_obj.cpp(%d): Unsupported schedule mode "
                                    "[%d]\n",
-                                   kLinePastUnsupported, static_cast<int>(mode_));
+                                   kLinePastUnsupported, static_cast<int>(mode));
                     return -1;
             }
         }
 
-        // The day's first run, at its wall-clock start time (see ResolveLocal for the repeated and
-        // the skipped hour).
+        // The day's first run at its start time. The compatible arithmetic keeps the flag `ref`
+        // got from its last mktime.
         struct tm day = ref;
-        day.tm_hour = start_hour_;
-        day.tm_min = start_minute_;
+        day.tm_hour = schedule.GetStartHour();
+        day.tm_min = schedule.GetStartMinute();
         day.tm_sec = 0;
-        long first = static_cast<long>(ResolveLocal(day, false));
+        long first = static_cast<long>(ToSeconds(day, clock, false));
         if (first < 0) {
             // This day cannot be expressed; try the next one.
             LogTimeFields(kLineDaySeconds, "scheduled", day);
-        } else if (repeat_times_in_day_ >= 0 && first > 0) {
+        } else if (repeats >= 0 && first > 0) {
             // Repeats are plain seconds apart, so after a clock change within the day they keep
             // their distance rather than their wall-clock times. The first one strictly after
             // `now` is the answer; with a period of 0 or less none after the first can be.
             if (first > now) {
                 return first;
             }
-            if (period_ > 0) {
-                long k = (now - first) / period_ + 1;
-                if (k <= repeat_times_in_day_) {
-                    return first + k * static_cast<long>(period_);
+            if (period > 0) {
+                long k = (now - first) / period + 1;
+                if (k <= repeats) {
+                    return first + k * period;
                 }
             }
         }
@@ -440,6 +490,16 @@ long Schedule::GetNextScheduledSeconds(long now) const {
         now_tm.tm_sec = 0;
         now_tm.tm_mday += 1;
     }
+}
+
+}  // namespace
+
+long Schedule::GetNextScheduledSeconds(long now) const {
+    return NextRun(*this, now, Clock::kCompatible);
+}
+
+long Schedule::NextRunAfter(long now) const {
+    return NextRun(*this, now, Clock::kWallClock);
 }
 
 }  // namespace S2S

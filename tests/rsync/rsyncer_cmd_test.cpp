@@ -7,6 +7,7 @@
 #include <filesystem>
 #include <list>
 #include <string>
+#include <type_traits>
 #include <vector>
 
 #include "gtest/gtest.h"
@@ -20,6 +21,12 @@ using rsyncer_test::ClientHost;
 using rsyncer_test::LogCapture;
 using rsyncer_test::ShareAttrs;
 using Lines = std::list<std::string>;
+
+// Programs built against the published interface link against these two as non-const members.
+static_assert(std::is_same<decltype(&S2S::Rsyncer::GenServerVersionCmd),
+                           int (S2S::Rsyncer::*)(const std::string&, Lines&)>::value);
+static_assert(std::is_same<decltype(&S2S::Rsyncer::GenSinglePairCmd),
+                           int (S2S::Rsyncer::*)(bool, Lines&)>::value);
 
 std::string Host35() {
     return S2S::GetHostName(35);

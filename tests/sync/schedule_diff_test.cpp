@@ -1,13 +1,15 @@
-// Differential check of Schedule::GetNextScheduledSeconds against a second computation written
-// here from the rules a user is promised, not from the library's day walk:
+// Differential check of Schedule::NextRunAfter against a second computation written here from
+// the rules a user is promised, not from the library's day walk:
 // - the days a schedule runs on come from civil-calendar arithmetic (weekday formula, month
 //   lengths, leap years; a begin day the month lacks rolls over into the next month);
 // - monthly and yearly runs are counted from the current month or year on;
 // - a day's first run is the moment the local clock shows the start time, found through
-//   localtime_r alone (first occurrence in a repeated hour, just after the jump in a skipped one);
+//   localtime_r alone (first occurrence in a repeated hour, the jump itself in a skipped one);
 // - the repeats follow in plain seconds; the answer is the first run strictly after `now`.
 // Thousands of generated schedules and moments per time zone, biased towards clock changes, month
-// ends and the run times themselves (asked at, just before and just after each answer).
+// ends and the run times themselves (asked at, just before and just after each answer). Where
+// the zone never changes its clocks, GetNextScheduledSeconds must agree too, but for a yearly 29
+// February (which it counts on from 1 March).
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -239,8 +241,12 @@ TEST_P(ScheduleDifferential, AgreesWithCalendarArithmetic) {
         }
         for (long at : moments) {
             const long expected = ExpectedNextRun(s, at);
-            const long actual = s.GetNextScheduledSeconds(at);
+            const long actual = s.NextRunAfter(at);
             ++checked;
+            if (changes.empty() && !(s.GetMode() == S2S::SCHD_YEARLY && s.GetBeginDay() == 29 &&
+                                     s.GetBeginMonth() == 2)) {
+                EXPECT_EQ(actual, s.GetNextScheduledSeconds(at)) << Describe(s, at);
+            }
             if (actual != expected) {
                 ++failures;
                 ADD_FAILURE() << GetParam() << ": expected " << expected << ", got " << actual

@@ -121,8 +121,8 @@ inline bool LocalWallClockIs(long t, long days, long second_of_day) {
 
 // The moment the local clock shows `second_of_day` on day `days` (days since 1970-01-01), found
 // by trying the offsets in force a day before and a day after: the first of two moments inside a
-// repeated hour; inside a skipped hour, the reading with the offset from before the change (just
-// after the jump). Works from localtime_r alone, independently of mktime.
+// repeated hour; inside a skipped hour, the first moment after it (the jump), found by bisection
+// between the two readings. Works from localtime_r alone, independently of mktime.
 inline long LocalMoment(long days, long second_of_day) {
     const long wall = days * 86400 + second_of_day;
     const long before = wall - GmtOffsetAt(wall - 86400);
@@ -132,10 +132,16 @@ inline long LocalMoment(long days, long second_of_day) {
     if (before_ok && after_ok) {
         return before < after ? before : after;
     }
-    if (after_ok) {
-        return after;
+    if (before_ok || after_ok) {
+        return before_ok ? before : after;
     }
-    return before;
+    long lo = before < after ? before : after;  // its clock shows less than `wall`
+    long hi = before < after ? after : before;
+    while (hi - lo > 1) {
+        const long mid = lo + (hi - lo) / 2;
+        (mid + GmtOffsetAt(mid) >= wall ? hi : lo) = mid;
+    }
+    return hi;
 }
 
 inline long Local(long y, long m, long d, long hour, long minute, long second = 0) {

@@ -208,6 +208,19 @@ TEST_F(CliTest, NextRunFollowsTheScheduleInLocalTime) {
              "--now", "2026-11-21 10:00"},
             utc);
     EXPECT_EQ(r.out, "task \"t\": Tue 2026-12-01 02:00:00 UTC (in 9d16h)\n") << r.All();
+    // The evening before the clocks go back: 09:00 by the wall clock; other front ends show 08:00.
+    const std::map<std::string, std::string> berlin = {{"TZ", "Europe/Berlin"}};
+    const std::vector<std::string> daily9 = {"next-run", "--at", "09:00", "--now",
+                                             "2024-10-26 23:00"};
+    r = S2s(daily9, berlin);
+    EXPECT_EQ(r.out,
+              "Sun 2024-10-27 09:00:00 CET (in 11h00m)\n"
+              "note: other front ends (--compatible) show Sun 2024-10-27 08:00:00 CET instead of "
+              "Sun 2024-10-27 09:00:00 CET\n")
+        << r.All();
+    std::vector<std::string> args = daily9;
+    args.push_back("--compatible");
+    EXPECT_EQ(S2s(args, berlin).out, "Sun 2024-10-27 08:00:00 CET (in 10h00m)\n");
 }
 
 }  // namespace

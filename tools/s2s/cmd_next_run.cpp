@@ -1,4 +1,5 @@
-// s2s next-run: when a task runs next, by the schedule's own arithmetic, printed in local time.
+// s2s next-run: when a task runs next, by the local wall clock (or, with --compatible, by the
+// arithmetic other front ends share), printed in local time.
 #include <ctime>
 #include <nlohmann/json.hpp>
 
@@ -23,6 +24,8 @@ const std::vector<OptionSpec> kNextRunOptions = {
     {"repeat", "N", false, "the number of repeats after the first run of a day (0 to 95)"},
     {"now", "TIME", false, "compute from this time: YYYY-MM-DD HH:MM[:SS] (local) or @SECONDS"},
     {"count", "N", false, "print the next N runs (1 to 1000, default 1)"},
+    {"compatible", "", false,
+     "use the arithmetic other front ends show (differs near clock changes)"},
     {"json", "", false, "print the result as JSON"},
     {"help", "", false, "show this help"},
 };
@@ -203,6 +206,23 @@ bool ScheduleFromOptions(const Options& opts, S2S::Schedule& schedule, std::stri
     return true;
 }
 
+// The next `count` runs after `now` by `next`; fewer when the schedule has no further run, one for
+// realtime. False when the computation fails.
+bool NextRuns(const S2S::Schedule& schedule, long (S2S::Schedule::*next)(long) const, long now,
+              unsigned long long count, std::vector<long>& runs) {
+    for (long from = now; runs.size() < count; from = runs.back()) {
+        const long run = (schedule.*next)(from);
+        if (run <= 0) {
+            return run == 0;
+        }
+        runs.push_back(run);
+        if (schedule.GetMode() == S2S::SCHD_REALTIME) {
+            break;
+        }
+    }
+    return true;
+}
+
 }  // namespace
 
 int RunNextRunCommand(const Args& args) {
@@ -259,26 +279,30 @@ int RunNextRunCommand(const Args& args) {
         return Fail(kExitInvalidTask, "the schedule is invalid (see the note above)");
     }
 
-    nlohmann::json runs = nlohmann::json::array();
-    std::string state = "scheduled";
-    long from = now;
-    for (unsigned long long i = 0; i < count; ++i) {
-        const long next = schedule.GetNextScheduledSeconds(from);
-        if (next < 0) {
-            return Fail(kExitInvalidTask, "the next run cannot be computed (see the error above)");
-        }
-        if (next == 0) {
-            state = runs.empty() ? (schedule.GetMode() == S2S::SCHD_MANUAL ? "manual" : "past")
-                                 : "scheduled";
-            break;
-        }
-        runs.push_back({{"time", LocalTime(next)}, {"epoch", next}, {"in_seconds", next - now}});
-        if (schedule.GetMode() == S2S::SCHD_REALTIME) {
-            state = "realtime";
-            break;
-        }
-        from = next;
+    const bool compatible = opts.Has("compatible");
+    std::vector<long> times;
+    if (!NextRuns(
+            schedule,
+            compatible ? &S2S::Schedule::GetNextScheduledSeconds : &S2S::Schedule::NextRunAfter,
+            now, count, times)) {
+        return Fail(kExitInvalidTask, "the next run cannot be computed (see the error above)");
     }
+    // Where the compatible arithmetic disagrees on the runs shown, say so: other front ends show
+    // its times.
+    std::vector<long> other;
+    const bool differs =
+        !compatible &&
+        NextRuns(schedule, &S2S::Schedule::GetNextScheduledSeconds, now, count, other) &&
+        other != times;
+    nlohmann::json runs = nlohmann::json::array();
+    for (const long next : times) {
+        runs.push_back({{"time", LocalTime(next)}, {"epoch", next}, {"in_seconds", next - now}});
+    }
+    const S2S::SCHD_MODE mode = schedule.GetMode();
+    const std::string state = mode == S2S::SCHD_MANUAL     ? "manual"
+                              : mode == S2S::SCHD_REALTIME ? "realtime"
+                              : times.empty()              ? "past"
+                                                           : "scheduled";
 
     if (opts.Has("json")) {
         nlohmann::json doc = {{"mode", schedule.GetModeStr()},
@@ -287,6 +311,9 @@ int RunNextRunCommand(const Args& args) {
                               {"runs", runs}};
         if (!task_name.empty()) {
             doc["task"] = task_name;
+        }
+        if (!compatible) {
+            doc["compatible_differs"] = differs;
         }
         std::printf("%s\n", doc.dump(2).c_str());
         return kExitOK;
@@ -305,6 +332,15 @@ int RunNextRunCommand(const Args& args) {
             std::printf("%s%s (in %s)\n", prefix.c_str(), run["time"].get<std::string>().c_str(),
                         FormatDuration(static_cast<double>(run["in_seconds"].get<long>())).c_str());
         }
+    }
+    if (differs) {
+        size_t i = 0;
+        while (i < times.size() && i < other.size() && times[i] == other[i]) {
+            ++i;
+        }
+        std::printf("note: other front ends (--compatible) show %s instead of %s\n",
+                    i < other.size() ? LocalTime(other[i]).c_str() : "no run",
+                    i < times.size() ? LocalTime(times[i]).c_str() : "no run");
     }
     return kExitOK;
 }
