@@ -32,7 +32,7 @@ Scheduler::Scheduler(const WallClock& clock)
     : clock_(clock), last_wall_(clock.Now()), last_mono_(clock.Monotonic()), zone_(clock.Zone()) {}
 
 long Scheduler::NextRunAfter(const S2S::Schedule& schedule, long after) {
-    const long next = schedule.GetNextScheduledSeconds(after);
+    const long next = schedule.NextRunAfter(after);
     return next > after ? next : 0;
 }
 

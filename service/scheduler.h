@@ -36,7 +36,8 @@ class Scheduler {
 
     explicit Scheduler(const WallClock& clock);
 
-    // The next run of `schedule` strictly after `after`; 0 when there is none.
+    // The next run of `schedule` strictly after `after` by the local wall clock; 0 when there is
+    // none (or the schedule cannot give one).
     static long NextRunAfter(const S2S::Schedule& schedule, long after);
 
     // Adds or replaces a task. `last_scheduled` is when its last scheduled run was due (or when
