@@ -474,11 +474,13 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, std::set<std::string> s
     }
     record.result = static_cast<int>(failure);
     record.end = clock_.Now();
-    Logger::LogMsg(failure == S2S::RunFailure::kNone ? Logger::Note : Logger::Warning,
-                   "[NOTE] service.cpp(%d): task %llu: run %s%s%s\n", __LINE__,
-                   static_cast<unsigned long long>(id),
-                   failure == S2S::RunFailure::kNone ? "done" : "failed",
-                   record.message.empty() ? "" : ": ", record.message.c_str());
+    if (failure == S2S::RunFailure::kNone) {
+        Logger::LogMsg(Logger::Note, "[NOTE] service.cpp(%d): task %llu: run done\n", __LINE__,
+                       static_cast<unsigned long long>(id));
+    } else {
+        Logger::LogMsg(Logger::Warning, "[WARNING] service.cpp(%d): task %llu: run failed: %s\n",
+                       __LINE__, static_cast<unsigned long long>(id), record.message.c_str());
+    }
     if (record.id != 0 && store_.EndRun(record, error) != 0) {
         Logger::LogMsg(Logger::Error, "[ERROR] service.cpp(%d): task %llu: %s\n", __LINE__,
                        static_cast<unsigned long long>(id), error.c_str());
