@@ -12,6 +12,17 @@ libdir=$(dirname "$(find "$prefix" -name 's2s.pc' | head -n 1)")/..
 export PKG_CONFIG_PATH=$libdir/pkgconfig
 export LD_LIBRARY_PATH=$libdir
 
+# The service units are installed and, where systemd's analyzer exists, pass its check (pointed at
+# the programs of this scratch prefix).
+for unit in s2sd.service s2s-receiver.service; do
+  test -f "$prefix/lib/systemd/system/$unit"
+  sed -E "s#=(/[^ ]*)/(s2sd|s2s-receiver)( |\$)#=$prefix/bin/\2\3#" \
+    "$prefix/lib/systemd/system/$unit" >"$scratch/$unit"
+done
+if command -v systemd-analyze >/dev/null; then
+  systemd-analyze verify "$scratch/s2sd.service" "$scratch/s2s-receiver.service"
+fi
+
 # Every public header compiles on its own; the C headers also compile as C.
 for header in "$prefix"/include/*.h; do
   name=$(basename "$header")

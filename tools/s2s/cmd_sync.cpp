@@ -1,38 +1,29 @@
-// s2s sync: runs one task once, end to end, in the order the sync service's daemon uses: find a
-// reachable address and the server's protocol version, pair the shares, then per share announce
-// it, copy it, send an encrypted share's key and finish it, and last report the task's status.
-// A share that failed, or a run stopped by Ctrl-C, is never finished: the server keeps it
-// marked as not complete.
+// s2s sync: runs one task once, end to end, through the library's TaskRun (the same sequence the
+// sync service's daemon uses). This file holds the presentation: options, the lines and progress
+// bar, the JSON summary and the exit codes. A share that failed, or a run stopped by Ctrl-C, is
+// never finished: the server keeps it marked as not complete.
 #include <signal.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <chrono>
-#include <cstdarg>
 #include <cstdio>
 #include <list>
 #include <nlohmann/json.hpp>
 
 #include "s2s_host.h"
-#include "s2s_rsyncer.h"
 #include "s2s_source_guard.h"
 #include "s2s_sync_obj.h"
+#include "s2s_task_run.h"
 #include "tools/s2s/commands.h"
 #include "tools/s2s/exit_codes.h"
 #include "tools/s2s/options.h"
 #include "tools/s2s/password.h"
 #include "tools/s2s/progress.h"
 #include "tools/s2s/task_file.h"
-#include "tools/s2s/transfer_meter.h"
 
 namespace s2s_cli {
 
 namespace {
-
-using Clock = std::chrono::steady_clock;
-
-// The finish type that tells the server a share's copy is complete (docs/protocol.md).
-const char kFinishComplete[] = "complete";
 
 const std::vector<OptionSpec> kSyncOptions = {
     {"task", "FILE", false, "the task file (JSON task map); replaces the task options below"},
@@ -65,40 +56,11 @@ const char kSyncEpilogue[] =
     "Ctrl-C stops the copy cleanly: no rsync is left running and the share is not marked\n"
     "complete on the server. Exit codes: see 's2s --help' and docs/cli.md.";
 
-// Set by the signal handler, read by the cancel checker that rsync runs poll.
+// Set by the signal handler, read by the run's cancel poll.
 volatile sig_atomic_t g_stop_signal = 0;
-
-// The cancel checker is a plain function (the library's interface), so the progress display it
-// drives is reached through this pointer while a copy runs.
-struct CopyWatch {
-    TransferMeter meter;
-    ProgressBar* bar = nullptr;
-    uint64_t total = 0;
-    int percent = -1;  // rsync's own overall progress, once it reports one
-};
-CopyWatch* g_watch = nullptr;
 
 void OnStopSignal(int signo) {
     g_stop_signal = signo;
-}
-
-void OnProgress(int percent) {
-    if (g_watch != nullptr && percent >= 0 && percent <= 100) {
-        g_watch->percent = percent;
-    }
-}
-
-bool CancelRequested() {
-    if (g_watch != nullptr && g_watch->bar != nullptr) {
-        g_watch->meter.Poll();
-        // rsync's percentage counts the files it skips as unchanged; the bytes read only what it
-        // sends. The percentage is the better measure of how far the share is, when there is one.
-        const uint64_t done = g_watch->percent >= 0
-                                  ? g_watch->total / 100 * static_cast<uint64_t>(g_watch->percent)
-                                  : g_watch->meter.Bytes();
-        g_watch->bar->Update(done);
-    }
-    return g_stop_signal != 0;
 }
 
 // Installs the stop handlers for the life of a sync and restores the old ones afterwards.
@@ -127,411 +89,99 @@ class StopSignals {
     struct sigaction old_hup_ = {};
 };
 
-double SecondsSince(Clock::time_point start) {
-    return std::chrono::duration<double>(Clock::now() - start).count();
-}
-
-// The exit class of a remote command that did not answer 0.
-ExitCode ClassifyCommandResult(int code) {
-    switch (code) {
-        case 5:
-            return kExitAuth;
-        case 10:
-        case 30:
-        case 35:
+ExitCode ExitCodeFor(S2S::RunFailure failure) {
+    switch (failure) {
+        case S2S::RunFailure::kNone:
+            return kExitOK;
+        case S2S::RunFailure::kLocal:
+            return kExitInternal;
+        case S2S::RunFailure::kUnreachable:
             return kExitUnreachable;
-        case 20:
-            return kExitCancelled;
-        default:
+        case S2S::RunFailure::kAuth:
+            return kExitAuth;
+        case S2S::RunFailure::kConflict:
+            return kExitConflict;
+        case S2S::RunFailure::kRefused:
             return kExitRefused;
+        case S2S::RunFailure::kTransfer:
+            return kExitTransfer;
+        case S2S::RunFailure::kKeySync:
+            return kExitKeySync;
+        case S2S::RunFailure::kCancelled:
+            return kExitCancelled;
+        case S2S::RunFailure::kUnsafeSource:
+            return kExitUnsafeSource;
+        case S2S::RunFailure::kMaxDelete:
+            return kExitMaxDelete;
     }
+    return kExitInternal;
 }
 
-// What happened to one share, for the lines printed and the JSON summary.
-struct ShareReport {
-    std::string name;
-    bool encrypted = false;
-    TreeSize size;
-    uint64_t read_bytes = 0;  // what rsync read to send it (unchanged files are not read)
-    double seconds = 0.0;
-    double start_seconds = 0.0;
-    double copy_seconds = 0.0;
-    double key_seconds = 0.0;
-    double finish_seconds = 0.0;
-    std::string state = "not-run";  // synced, failed, cancelled, refused, not-run
-    int result = 0;
-    std::string step;  // the step that failed: source-check, start, copy, key, finish
-    std::string message;
-    std::string guard;            // why the source check refused the share
-    long long would_delete = -1;  // what the refused run would have deleted on the receiver
-};
-
-class SyncRun {
+// The run's lines and progress on the terminal (or standard error when the summary is JSON).
+class CliObserver : public S2S::TaskRunObserver {
   public:
-    SyncRun(const Options& opts, FILE* out) : opts_(opts), out_(out) {}
+    CliObserver(FILE* out, bool quiet, bool progress)
+        : out_(out),
+          quiet_(quiet),
+          progress_(progress),
+          bar_(out, isatty(fileno(out)) != 0, !quiet && progress) {}
 
-    int Run(S2S::SyncTask& task);
-    void SetGuardOptions(const S2S::SourceGuardOptions& guard) { guard_ = guard; }
-    nlohmann::json Summary() const;
-
-  private:
-    int Connect();
-    int Pair();
-    void SyncShare(ShareReport& share);
-    bool GuardSource(ShareReport& share);
-    int Finish(int code, const std::string& message);
-    void Say(const char* format, ...) __attribute__((format(printf, 2, 3)));
-
-    const Options& opts_;
-    FILE* out_;
-    S2S::SyncTask task_;
-    S2S::Rsyncer rsyncer_;
-    S2S::SourceGuardOptions guard_;
-    std::vector<ShareReport> shares_;
-    Clock::time_point started_ = Clock::now();
-    int exit_code_ = kExitOK;
-    std::string message_;
-    int beacon_result_ = -1;
-    bool quiet_ = false;
-    double connect_seconds_ = 0.0;
-    double pair_seconds_ = 0.0;
-    double beacon_seconds_ = 0.0;
-};
-
-void SyncRun::Say(const char* format, ...) {
-    if (quiet_) {
-        return;
-    }
-    va_list args;
-    va_start(args, format);
-    std::vfprintf(out_, format, args);
-    va_end(args);
-    std::fflush(out_);
-}
-
-int SyncRun::Finish(int code, const std::string& message) {
-    if (exit_code_ == kExitOK) {
-        exit_code_ = code;
-        message_ = message;
-    }
-    if (code != kExitOK) {
+    void OnMessage(const std::string& line) override { Say(line); }
+    void OnError(const std::string& message) override {
         std::fprintf(stderr, "s2s: %s\n", message.c_str());
     }
-    return code;
-}
-
-int SyncRun::Connect() {
-    const S2S::SyncInfo& info = task_.GetInfo().GetSyncInfo();
-    const std::string target =
-        info.GetServerIP().empty()
-            ? info.GetServerName()
-            : info.GetServerIP() +
-                  (info.GetServerName().empty() ? "" : " (" + info.GetServerName() + ")");
-    Say("connecting to %s as %s\n", target.c_str(), info.GetUser().c_str());
-    const int rc = rsyncer_.Initialize(info);
-    if (g_stop_signal != 0) {
-        return Finish(kExitCancelled, "stopped before the server answered");
+    void OnCopyStart(const S2S::ShareOutcome& share) override {
+        Say("share " + share.name + (share.encrypted ? " (encrypted)" : "") + ": copying (" +
+            std::to_string(share.files) + " files, " + FormatBytes(share.bytes) + ")");
+        bar_.Start(share.name, share.bytes);
     }
-    if (rc == S2S::kRsyncResultNoAddress) {
-        return Finish(kExitUnreachable, "no address found for server " + target);
-    }
-    if (rc != 0) {
-        const ExitCode code = ClassifyConnectResult(rc);
-        std::string why = code == kExitAuth
-                              ? "the server refused user '" + info.GetUser() + "' or its password"
-                              : "the server did not answer";
-        return Finish(code, why + ": " + ResultName(rc) + ", " + ResultMeaning(rc));
-    }
-    const int version = rsyncer_.GetServerVersionValue();
-    Say("server %s answers: %s\n", rsyncer_.GetSyncInfo().GetServerIP().c_str(),
-        version > 0 ? ("protocol version " + std::to_string(version)).c_str()
-                    : "an old server (one client per server, no share attributes)");
-    return kExitOK;
-}
-
-int SyncRun::Pair() {
-    const std::list<std::string>& shares = task_.GetInfo().GetShareList();
-    std::list<std::string> conflicts;
-    int result = 0;
-    if (rsyncer_.DoPairing(false, shares, conflicts, result) != 0) {
-        if (g_stop_signal != 0) {
-            return Finish(kExitCancelled, "stopped while pairing");
-        }
-        if (result != 0 && result != S2S::kRsyncResultConflict) {
-            if (result == S2S::kRsyncResultDryRunOK) {
-                // An old server pairs one client as a whole.
-                return Finish(kExitConflict, "the server is paired with another client: " +
-                                                 ResultName(result) + "; nothing was synced");
-            }
-            return Finish(ClassifyCommandResult(result),
-                          "the server refused the pairing: " + ResultName(result));
-        }
-        return Finish(kExitInternal, "the pairing request could not be sent (see the log above)");
-    }
-    if (result == S2S::kRsyncResultConflict || !conflicts.empty()) {
-        std::string names;
-        for (const std::string& name : conflicts) {
-            names += (names.empty() ? "'" : ", '") + name + "'";
-        }
-        if (names.empty()) {
-            names = "(not named by the server)";
-        }
-        for (ShareReport& share : shares_) {
-            share.state = "refused";
-            share.step = "pairing";
-            share.result = result;
-        }
-        return Finish(kExitConflict, std::string(conflicts.size() == 1 ? "share " : "shares ") +
-                                         names + (conflicts.size() == 1 ? " is" : " are") +
-                                         " already paired with another client; nothing was "
-                                         "synced");
-    }
-    if (result != 0) {
-        if (g_stop_signal != 0) {
-            return Finish(kExitCancelled, "stopped while pairing");
-        }
-        if (result == S2S::kRsyncResultDryRunOK) {
-            return Finish(kExitConflict, "the server is paired with another client: " +
-                                             ResultName(result) + "; nothing was synced");
-        }
-        for (ShareReport& share : shares_) {
-            share.state = "refused";
-            share.step = "pairing";
-            share.result = result;
-        }
-        return Finish(
-            ClassifyCommandResult(result),
-            "the server refused the pairing: " + ResultName(result) + ", " + ResultMeaning(result));
-    }
-    Say("paired %zu share%s\n", shares.size(), shares.size() == 1 ? "" : "s");
-    return kExitOK;
-}
-
-void SyncRun::SyncShare(ShareReport& share) {
-    const Clock::time_point start = Clock::now();
-    S2S::ShareInfo info;
-    if (rsyncer_.GetShareInfo(share.name, info) != 0) {
-        share.state = "failed";
-        share.step = "start";
-        share.message = "share '" + share.name + "' is not registered or unreadable";
-        Finish(kExitInternal, share.message);
-        return;
-    }
-    share.encrypted = info.IsEncrypted();
-    share.size = MeasureTree(info.GetModulePath());
-    if (!GuardSource(share)) {
-        return;
-    }
-
-    int result = 0;
-    Clock::time_point step = Clock::now();
-    const int started = rsyncer_.StartSyncShare(share.name, result);
-    share.start_seconds = SecondsSince(step);
-    if (started != 0 || result != 0) {
-        share.step = "start";
-        share.result = result;
-        share.state = g_stop_signal != 0 ? "cancelled" : "refused";
-        share.message = "the server refused to start share '" + share.name +
-                        "': " + ResultName(result) + ", " + ResultMeaning(result);
-        if (g_stop_signal == 0) {
-            Finish(result == 0 ? kExitInternal : ClassifyCommandResult(result), share.message);
-        }
-        return;
-    }
-
-    Say("share %s%s: copying (%s files, %s)\n", share.name.c_str(),
-        share.encrypted ? " (encrypted)" : "", std::to_string(share.size.files).c_str(),
-        FormatBytes(share.size.bytes).c_str());
-    const bool terminal = isatty(fileno(out_)) != 0;
-    ProgressBar bar(out_, terminal, !quiet_ && !opts_.Has("no-progress"));
-    CopyWatch watch;
-    watch.bar = &bar;
-    watch.total = share.size.bytes;
-    bar.Start(share.name, share.size.bytes);
-    g_watch = &watch;
-    const std::vector<std::string> excludes_vec = opts_.GetAll("exclude");
-    const std::list<std::string> excludes(excludes_vec.begin(), excludes_vec.end());
-    step = Clock::now();
-    const int rc = rsyncer_.RunSync(task_.GetID(), share.name, "/", excludes, result);
-    share.copy_seconds = SecondsSince(step);
-    watch.meter.Poll();
-    share.read_bytes = watch.meter.Bytes();
-    g_watch = nullptr;
-    bar.Finish();
-    share.seconds = SecondsSince(start);
-    if (g_stop_signal != 0) {
-        share.state = "cancelled";
-        share.step = "copy";
-        share.result = result;
-        return;
-    }
-    // Files that vanish while they are being sent are normal on a live share; the next run takes
-    // the share as it is then.
-    if (rc != 0 || (result != 0 && result != 24)) {
-        share.state = "failed";
-        share.step = "copy";
-        share.result = result;
-        share.message = "copying share '" + share.name + "' failed: " + ResultName(result) + ", " +
-                        ResultMeaning(result) + "; it is not marked complete";
-        Finish(rc != 0 ? kExitInternal : ClassifyTransferResult(result), share.message);
-        return;
-    }
-    if (result == 24) {
-        Say("share %s: some files vanished while they were copied\n", share.name.c_str());
-    }
-
-    if (share.encrypted) {
-        step = Clock::now();
-        const int key = rsyncer_.SyncEncryptKey(share.name);
-        share.key_seconds = SecondsSince(step);
-        if (g_stop_signal != 0) {
-            share.state = "cancelled";
-            share.step = "key";
+    void OnCopyProgress(const S2S::ShareOutcome&, uint64_t done) override { bar_.Update(done); }
+    void OnCopyEnd(const S2S::ShareOutcome&) override { bar_.Finish(); }
+    void OnShareEnd(const S2S::ShareOutcome& share) override {
+        if (share.state != S2S::ShareState::kSynced) {
             return;
         }
-        if (key != 0) {
-            share.state = "failed";
-            share.step = "key";
-            share.result = key;
-            share.message = "sending the key of share '" + share.name +
-                            "' failed: " + ResultName(key) + ", " + ResultMeaning(key);
-            Finish(kExitKeySync, share.message);
+        char seconds[32];
+        std::snprintf(seconds, sizeof(seconds), "%.2fs", share.seconds);
+        Say("share " + share.name + ": complete, " + std::to_string(share.files) + " files, " +
+            FormatBytes(share.bytes) + " (rsync read " + FormatBytes(share.read_bytes) + ") in " +
+            seconds);
+    }
+    bool IsCancelled() override { return g_stop_signal != 0; }
+    std::string CancelReason() const override {
+        return g_stop_signal == SIGINT ? "Ctrl-C" : "a signal";
+    }
+    bool WantsProgress() const override { return !quiet_ && progress_; }
+
+  private:
+    void Say(const std::string& line) {
+        if (quiet_) {
             return;
         }
-        Say("share %s: key sent\n", share.name.c_str());
+        std::fprintf(out_, "%s\n", line.c_str());
+        std::fflush(out_);
     }
 
-    step = Clock::now();
-    const int finished = rsyncer_.FinishSync(kFinishComplete, share.name, result);
-    share.finish_seconds = SecondsSince(step);
-    if (finished != 0 || result != 0) {
-        share.state = g_stop_signal != 0 ? "cancelled" : "failed";
-        share.step = "finish";
-        share.result = result;
-        share.message = "the server did not accept the end of share '" + share.name +
-                        "': " + ResultName(result);
-        if (g_stop_signal == 0) {
-            Finish(result == 0 ? kExitInternal : ClassifyCommandResult(result), share.message);
-        }
-        return;
-    }
-    share.seconds = SecondsSince(start);
-    share.state = "synced";
-    Say("share %s: complete, %s files, %s (rsync read %s) in %.2fs\n", share.name.c_str(),
-        std::to_string(share.size.files).c_str(), FormatBytes(share.size.bytes).c_str(),
-        FormatBytes(share.read_bytes).c_str(), share.seconds);
-}
+    FILE* out_;
+    bool quiet_;
+    bool progress_;
+    ProgressBar bar_;
+};
 
-// Before anything is sent: a share whose folder is missing, not mounted or (against a full copy)
-// empty, or whose run would delete more than allowed, is refused and never marked complete.
-bool SyncRun::GuardSource(ShareReport& share) {
-    const std::vector<std::string> rules = opts_.GetAll("exclude");
-    const S2S::SourceGuardReport guard = S2S::CheckShareSource(
-        rsyncer_, share.name, std::list<std::string>(rules.begin(), rules.end()), guard_,
-        &CancelRequested);
-    if (guard.result == S2S::SourceGuardResult::kSafe) {
-        return true;
-    }
-    share.step = "source-check";
-    share.guard = S2S::SourceGuardResultName(guard.result);
-    if (guard.receiver.known) {
-        share.would_delete = static_cast<long long>(guard.receiver.deletions);
-    }
-    share.message = guard.message;
-    if (g_stop_signal != 0) {
-        share.state = "cancelled";
-    } else if (guard.result == S2S::SourceGuardResult::kCheckFailed) {
-        share.state = "failed";
-        share.result = guard.dryRunResult;
-        Finish(guard.dryRunResult != 0 ? ClassifyTransferResult(guard.dryRunResult) : kExitInternal,
-               share.message + (guard.dryRunResult != 0 ? ": " + ResultName(guard.dryRunResult)
-                                                        : std::string()));
-    } else if (guard.result == S2S::SourceGuardResult::kTooManyDeletions) {
-        share.state = "refused";
-        Finish(kExitMaxDelete, share.message);
-    } else {
-        share.state = "refused";
-        Finish(kExitUnsafeSource,
-               share.message + (guard.result == S2S::SourceGuardResult::kEmptySource
-                                    ? " (--allow-empty-source syncs it anyway)"
-                                    : ""));
-    }
-    return false;
-}
-
-int SyncRun::Run(S2S::SyncTask& task) {
-    task_ = task;
-    quiet_ = opts_.Has("quiet");
-    for (const std::string& name : task_.GetInfo().GetShareList()) {
-        ShareReport share;
-        share.name = name;
-        shares_.push_back(share);
-    }
-    Say("task \"%s\": %zu share%s\n", task_.GetInfo().GetName().c_str(), shares_.size(),
-        shares_.size() == 1 ? "" : "s");
-
-    StopSignals signals;
-    rsyncer_.SetCancelChecker(&CancelRequested);
-    // rsync reports its progress only when asked to; a run without a display does not ask.
-    if (!quiet_ && !opts_.Has("no-progress")) {
-        rsyncer_.SetProgressCallback(&OnProgress);
-    }
-    Clock::time_point step = Clock::now();
-    const int connected = Connect();
-    connect_seconds_ = SecondsSince(step);
-    if (connected != kExitOK) {
-        return exit_code_;
-    }
-    step = Clock::now();
-    const int paired = Pair();
-    pair_seconds_ = SecondsSince(step);
-    if (paired != kExitOK) {
-        return exit_code_;
-    }
-    for (ShareReport& share : shares_) {
-        if (g_stop_signal != 0) {
-            break;
-        }
-        SyncShare(share);
-        // Without the server or the credentials the remaining shares cannot fare better.
-        if (exit_code_ == kExitAuth || exit_code_ == kExitUnreachable) {
-            break;
-        }
-    }
-    if (g_stop_signal != 0) {
-        return Finish(kExitCancelled, std::string("stopped by ") +
-                                          (g_stop_signal == SIGINT ? "Ctrl-C" : "a signal") +
-                                          "; no unfinished share was marked complete");
-    }
-    int result = 0;
-    step = Clock::now();
-    const int beacon = rsyncer_.SendBeacon(task_.GetInfo().GetName(), result);
-    beacon_seconds_ = SecondsSince(step);
-    if (beacon == 0) {
-        beacon_result_ = result;
-        if (result != 0 && g_stop_signal == 0) {
-            Finish(ClassifyCommandResult(result),
-                   "the server did not take the task's status: " + ResultName(result));
-        }
-    } else if (g_stop_signal == 0) {
-        Finish(kExitInternal, "the task's status could not be sent (see the log above)");
-    }
-    if (g_stop_signal != 0) {
-        return Finish(kExitCancelled, "stopped while reporting the task's status");
-    }
-    return exit_code_;
-}
-
-nlohmann::json SyncRun::Summary() const {
+nlohmann::json Summary(const S2S::TaskRun& run) {
+    const ExitCode exit_code = ExitCodeFor(run.Failure());
     nlohmann::json shares = nlohmann::json::array();
     uint64_t files = 0;
     uint64_t bytes = 0;
     uint64_t read_bytes = 0;
     double copy_seconds = 0.0;
-    for (const ShareReport& share : shares_) {
-        nlohmann::json entry = {{"name", share.name},        {"encrypted", share.encrypted},
-                                {"state", share.state},      {"files", share.size.files},
-                                {"bytes", share.size.bytes}, {"seconds", share.seconds}};
+    for (const S2S::ShareOutcome& share : run.Shares()) {
+        nlohmann::json entry = {{"name", share.name},
+                                {"encrypted", share.encrypted},
+                                {"state", S2S::ShareStateName(share.state)},
+                                {"files", share.files},
+                                {"bytes", share.bytes},
+                                {"seconds", share.seconds}};
         if (!share.step.empty()) {
             entry["failed_step"] = share.step;
         }
@@ -548,38 +198,39 @@ nlohmann::json SyncRun::Summary() const {
         if (share.would_delete >= 0) {
             entry["would_delete"] = share.would_delete;
         }
-        if (share.state == "synced") {
-            files += share.size.files;
-            bytes += share.size.bytes;
+        if (share.state == S2S::ShareState::kSynced) {
+            files += share.files;
+            bytes += share.bytes;
         }
         read_bytes += share.read_bytes;
         copy_seconds += share.copy_seconds;
         shares.push_back(entry);
     }
-    const S2S::SyncInfo info = rsyncer_.GetSyncInfo();
     nlohmann::json doc = {
-        {"task", task_.GetInfo().GetName()},
-        {"task_id", task_.GetID()},
+        {"task", run.Task().GetInfo().GetName()},
+        {"task_id", run.Task().GetID()},
         {"server",
-         {{"address", info.GetServerIP()},
-          {"name", task_.GetInfo().GetSyncInfo().GetServerName()},
-          {"protocol_version", rsyncer_.GetServerVersionValue()}}},
-        {"result", ExitCodeName(static_cast<ExitCode>(exit_code_))},
-        {"exit_code", exit_code_},
+         {{"address", run.SettledAddress()},
+          {"name", run.Task().GetInfo().GetSyncInfo().GetServerName()},
+          {"protocol_version", run.ServerVersion()}}},
+        {"result", ExitCodeName(exit_code)},
+        {"exit_code", static_cast<int>(exit_code)},
         {"shares", shares},
         {"files", files},
         {"bytes", bytes},
         {"read_bytes", read_bytes},
-        {"seconds", SecondsSince(started_)},
+        {"seconds", run.Seconds()},
         {"copy_seconds", copy_seconds},
         {"steps",
-         {{"connect", connect_seconds_}, {"pair", pair_seconds_}, {"beacon", beacon_seconds_}}},
+         {{"connect", run.ConnectSeconds()},
+          {"pair", run.PairSeconds()},
+          {"beacon", run.BeaconSeconds()}}},
     };
-    if (!message_.empty()) {
-        doc["message"] = message_;
+    if (!run.Message().empty()) {
+        doc["message"] = run.Message();
     }
-    if (beacon_result_ >= 0) {
-        doc["beacon_result"] = beacon_result_;
+    if (run.BeaconResult() >= 0) {
+        doc["beacon_result"] = run.BeaconResult();
     }
     return doc;
 }
@@ -695,10 +346,17 @@ int RunSyncCommand(const Options& opts) {
     }
 
     const bool json = opts.Has("json");
-    SyncRun run(opts, json ? stderr : stdout);
+    CliObserver observer(json ? stderr : stdout, opts.Has("quiet"), !opts.Has("no-progress"));
+    S2S::TaskRun run(&observer);
+    const std::vector<std::string> excludes = opts.GetAll("exclude");
+    run.SetExcludes(std::list<std::string>(excludes.begin(), excludes.end()));
     run.SetGuardOptions(guard);
-    const int code = run.Run(task);
-    const nlohmann::json summary = run.Summary();
+    int code = kExitOK;
+    {
+        StopSignals signals;
+        code = ExitCodeFor(run.Run(task));
+    }
+    const nlohmann::json summary = Summary(run);
     if (json) {
         std::printf("%s\n", summary.dump(2).c_str());
     } else if (!opts.Has("quiet") || code != kExitOK) {

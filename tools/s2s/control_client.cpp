@@ -9,7 +9,7 @@
 #include <cstring>
 
 #include "s2s_control.h"
-#include "s2s_ipc.h"
+#include "s2s_control_client.h"
 #include "s2s_platform.h"
 #include "tools/s2s/commands.h"
 
@@ -82,17 +82,7 @@ int ExplainNoReply(const std::string& path, const std::string& error) {
 }  // namespace
 
 int ControlRequest(const S2S::PObject& request, S2S::PObject& reply, std::string& error) {
-    const std::string path = SocketPath();
-    S2S::IPCSender sender;
-    if (sender.connect(path) != 0) {
-        error = "cannot connect to " + path;
-        return -1;
-    }
-    if (sender.send(request, true, reply) != 0) {
-        error = "the exchange on " + path + " failed (no reply, or an unreadable one)";
-        return -1;
-    }
-    return 0;
+    return S2S::Control::Request(request, reply, error);
 }
 
 ExitCode ExitForControlStatus(unsigned long long status) {

@@ -44,13 +44,6 @@ std::string ResultName(int code);
 // The short description of a result code, or "" when none is known.
 const char* ResultMeaning(int code);
 
-// The exit class for a failed server test (Rsyncer::Initialize's result).
-ExitCode ClassifyConnectResult(int code);
-// The exit class for a failed data transfer (RunSync's result).
-ExitCode ClassifyTransferResult(int code);
-// True when the code says the server rejected the credentials.
-bool IsAuthFailure(int code);
-
 }  // namespace s2s_cli
 
 #endif  // S2S_TOOLS_S2S_EXIT_CODES_H

@@ -1,4 +1,7 @@
-#include "tools/s2s/transfer_meter.h"
+// The transfer meter and the tree measure of a share's copy.
+#include "rsync/transfer_meter.h"
+
+#include <sys/syscall.h>
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -12,7 +15,7 @@
 #include <sstream>
 #include <vector>
 
-namespace s2s_cli {
+namespace S2S {
 
 namespace {
 
@@ -52,11 +55,12 @@ void MeasureDir(int dir_fd, TreeSize& size, int depth) {
     }
 }
 
-std::vector<pid_t> ChildrenOf(pid_t pid) {
+// The children that thread `tid` of process `pid` started.
+std::vector<pid_t> ChildrenOf(pid_t pid, pid_t tid) {
     std::vector<pid_t> children;
     char path[64];
     std::snprintf(path, sizeof(path), "/proc/%d/task/%d/children", static_cast<int>(pid),
-                  static_cast<int>(pid));
+                  static_cast<int>(tid));
     std::ifstream in(path);
     long child = 0;
     while (in >> child) {
@@ -96,14 +100,14 @@ void TransferMeter::Reset() {
 }
 
 void TransferMeter::Poll() {
-    Visit(getpid(), 0);
+    Visit(getpid(), static_cast<pid_t>(syscall(SYS_gettid)), 0);
 }
 
-void TransferMeter::Visit(pid_t pid, int depth) {
+void TransferMeter::Visit(pid_t pid, pid_t tid, int depth) {
     if (depth >= kMaxDepth) {
         return;
     }
-    for (pid_t child : ChildrenOf(pid)) {
+    for (pid_t child : ChildrenOf(pid, tid)) {
         uint64_t rchar = 0;
         if (ReadChars(child, rchar)) {
             uint64_t& seen = read_by_pid_[child];
@@ -111,7 +115,7 @@ void TransferMeter::Visit(pid_t pid, int depth) {
                 seen = rchar;
             }
         }
-        Visit(child, depth + 1);
+        Visit(child, child, depth + 1);
     }
 }
 
@@ -123,4 +127,4 @@ uint64_t TransferMeter::Bytes() const {
     return total;
 }
 
-}  // namespace s2s_cli
+}  // namespace S2S

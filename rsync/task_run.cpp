@@ -1,0 +1,491 @@
+// TaskRun: the sequence that syncs one task once. The first failure decides the run's class and
+// message; later failures are still reported to the observer. A share is finished on the server
+// only after its copy (and its key, when it is encrypted) succeeded and no cancel was seen.
+#include "s2s_task_run.h"
+
+#include <utility>
+
+#include "rsync/transfer_meter.h"
+
+namespace S2S {
+
+namespace {
+
+// The finish type that tells the server a share's copy is complete (docs/protocol.md).
+const char kFinishComplete[] = "complete";
+
+// rsync's exit code for a run stopped by a signal, and for files that vanished while being sent.
+constexpr int kResultInterrupted = 20;
+constexpr int kResultMaxDelete = 25;  // rsync stopped deleting at --max-delete
+constexpr int kResultVanished = 24;
+
+// The run on this thread; the rsync driver's cancel checker is a plain function.
+thread_local TaskRun* t_current = nullptr;
+
+double SecondsSince(TaskRun::Clock::time_point start) {
+    return std::chrono::duration<double>(TaskRun::Clock::now() - start).count();
+}
+
+bool IsAuthFailure(int code) {
+    return code == 5;
+}
+
+// The class of a remote command that did not answer 0.
+RunFailure ClassifyCommandResult(int code) {
+    switch (code) {
+        case 5:
+            return RunFailure::kAuth;
+        case 10:
+        case 30:
+        case 35:
+            return RunFailure::kUnreachable;
+        case kResultInterrupted:
+            return RunFailure::kCancelled;
+        default:
+            return RunFailure::kRefused;
+    }
+}
+
+// The class of a failed server test (Rsyncer::Initialize's result).
+RunFailure ClassifyConnectResult(int code) {
+    return IsAuthFailure(code) ? RunFailure::kAuth : RunFailure::kUnreachable;
+}
+
+// The class of a failed data transfer (RunSync's result).
+RunFailure ClassifyTransferResult(int code) {
+    if (code == kResultInterrupted) {
+        return RunFailure::kCancelled;
+    }
+    if (code == kResultMaxDelete) {
+        return RunFailure::kMaxDelete;  // rsync's own deletion limit stopped the deletions
+    }
+    return IsAuthFailure(code) ? RunFailure::kAuth : RunFailure::kTransfer;
+}
+
+std::string NameAndMeaning(int code) {
+    return RsyncResultName(code) + ", " + RsyncResultMeaning(code);
+}
+
+// Sets the run of this thread for the life of Run.
+class CurrentRun {
+  public:
+    explicit CurrentRun(TaskRun* run) : previous_(t_current) { t_current = run; }
+    ~CurrentRun() { t_current = previous_; }
+    CurrentRun(const CurrentRun&) = delete;
+    CurrentRun& operator=(const CurrentRun&) = delete;
+
+  private:
+    TaskRun* previous_;
+};
+
+}  // namespace
+
+const char* ShareStateName(ShareState state) {
+    switch (state) {
+        case ShareState::kSynced:
+            return "synced";
+        case ShareState::kFailed:
+            return "failed";
+        case ShareState::kCancelled:
+            return "cancelled";
+        case ShareState::kRefused:
+            return "refused";
+        case ShareState::kNotRun:
+            break;
+    }
+    return "not-run";
+}
+
+TaskRunObserver::~TaskRunObserver() = default;
+void TaskRunObserver::OnMessage(const std::string&) {}
+void TaskRunObserver::OnError(const std::string&) {}
+void TaskRunObserver::OnCopyStart(const ShareOutcome&) {}
+void TaskRunObserver::OnCopyProgress(const ShareOutcome&, uint64_t) {}
+void TaskRunObserver::OnCopyEnd(const ShareOutcome&) {}
+void TaskRunObserver::OnShareEnd(const ShareOutcome&) {}
+bool TaskRunObserver::IsCancelled() {
+    return false;
+}
+std::string TaskRunObserver::CancelReason() const {
+    return "a request";
+}
+bool TaskRunObserver::WantsProgress() const {
+    return false;
+}
+
+// The copy in progress: the share, what rsync has read, and rsync's own percentage once it
+// reports one.
+struct TaskRun::CopyWatch {
+    ShareOutcome* share = nullptr;
+    TransferMeter meter;
+    int percent = -1;
+};
+
+TaskRun::TaskRun(TaskRunObserver* observer)
+    : observer_(observer != nullptr ? observer : &silent_) {}
+
+TaskRun::~TaskRun() = default;
+
+double TaskRun::Seconds() const {
+    return SecondsSince(started_);
+}
+
+void TaskRun::Say(const std::string& line) {
+    observer_->OnMessage(line);
+}
+
+void TaskRun::Fail(RunFailure failure, const std::string& message) {
+    if (failure_ == RunFailure::kNone) {
+        failure_ = failure;
+        message_ = message;
+    }
+    if (failure != RunFailure::kNone) {
+        observer_->OnError(message);
+    }
+}
+
+bool TaskRun::Cancelled() {
+    if (!cancelled_ && observer_->IsCancelled()) {
+        cancelled_ = true;
+    }
+    return cancelled_;
+}
+
+bool TaskRun::PollCurrent() {
+    TaskRun* run = t_current;
+    if (run == nullptr) {
+        return false;
+    }
+    run->PollCopy();
+    return run->Cancelled();
+}
+
+void TaskRun::PollCopy() {
+    if (watch_ == nullptr) {
+        return;
+    }
+    watch_->meter.Poll();
+    // rsync's percentage counts the files it skips as unchanged; the bytes read only what it
+    // sends. The percentage is the better measure of how far the share is, when there is one.
+    const uint64_t total = watch_->share->bytes;
+    const uint64_t done = watch_->percent >= 0
+                              ? total / 100 * static_cast<uint64_t>(watch_->percent)
+                              : watch_->meter.Bytes();
+    observer_->OnCopyProgress(*watch_->share, done);
+}
+
+bool TaskRun::Connect() {
+    const SyncInfo& info = task_.GetInfo().GetSyncInfo();
+    const std::string target =
+        info.GetServerIP().empty()
+            ? info.GetServerName()
+            : info.GetServerIP() +
+                  (info.GetServerName().empty() ? "" : " (" + info.GetServerName() + ")");
+    Say("connecting to " + target + " as " + info.GetUser());
+    const int rc = rsyncer_.Initialize(info);
+    server_version_ = rsyncer_.GetServerVersionValue();
+    if (Cancelled()) {
+        Fail(RunFailure::kCancelled, "stopped before the server answered");
+        return false;
+    }
+    if (rc == kRsyncResultNoAddress) {
+        Fail(RunFailure::kUnreachable, "no address found for server " + target);
+        return false;
+    }
+    if (rc != 0) {
+        const RunFailure failure = ClassifyConnectResult(rc);
+        const std::string why =
+            failure == RunFailure::kAuth
+                ? "the server refused user '" + info.GetUser() + "' or its password"
+                : "the server did not answer";
+        Fail(failure, why + ": " + NameAndMeaning(rc));
+        return false;
+    }
+    settled_address_ = rsyncer_.GetSyncInfo().GetServerIP();
+    Say("server " + settled_address_ + " answers: " +
+        (server_version_ > 0 ? "protocol version " + std::to_string(server_version_)
+                             : std::string("an old server (one client per server, no share "
+                                           "attributes)")));
+    return true;
+}
+
+bool TaskRun::Pair() {
+    const std::list<std::string>& shares = task_.GetInfo().GetShareList();
+    std::list<std::string> conflicts;
+    int result = 0;
+    const auto refuseAll = [this, &result]() {
+        for (ShareOutcome& share : shares_) {
+            share.state = ShareState::kRefused;
+            share.step = "pairing";
+            share.result = result;
+        }
+    };
+    const std::string pairedOther = "the server is paired with another client: ";
+    if (rsyncer_.DoPairing(false, shares, conflicts, result) != 0) {
+        if (Cancelled()) {
+            Fail(RunFailure::kCancelled, "stopped while pairing");
+            return false;
+        }
+        if (result != 0 && result != kRsyncResultConflict) {
+            if (result == kRsyncResultDryRunOK) {
+                // An old server pairs one client as a whole.
+                Fail(RunFailure::kConflict,
+                     pairedOther + RsyncResultName(result) + "; nothing was synced");
+                return false;
+            }
+            Fail(ClassifyCommandResult(result),
+                 "the server refused the pairing: " + RsyncResultName(result));
+            return false;
+        }
+        Fail(RunFailure::kLocal, "the pairing request could not be sent (see the log above)");
+        return false;
+    }
+    if (result == kRsyncResultConflict || !conflicts.empty()) {
+        std::string names;
+        for (const std::string& name : conflicts) {
+            names += (names.empty() ? "'" : ", '") + name + "'";
+        }
+        if (names.empty()) {
+            names = "(not named by the server)";
+        }
+        refuseAll();
+        Fail(RunFailure::kConflict, std::string(conflicts.size() == 1 ? "share " : "shares ") +
+                                        names + (conflicts.size() == 1 ? " is" : " are") +
+                                        " already paired with another client; nothing was "
+                                        "synced");
+        return false;
+    }
+    if (result != 0) {
+        if (Cancelled()) {
+            Fail(RunFailure::kCancelled, "stopped while pairing");
+            return false;
+        }
+        if (result == kRsyncResultDryRunOK) {
+            Fail(RunFailure::kConflict,
+                 pairedOther + RsyncResultName(result) + "; nothing was synced");
+            return false;
+        }
+        refuseAll();
+        Fail(ClassifyCommandResult(result),
+             "the server refused the pairing: " + NameAndMeaning(result));
+        return false;
+    }
+    Say("paired " + std::to_string(shares.size()) + " share" + (shares.size() == 1 ? "" : "s"));
+    return true;
+}
+
+// Before anything is sent: a share whose folder is missing, not mounted or (against a full copy)
+// empty, or whose run would delete more than allowed, is refused and never marked complete.
+bool TaskRun::GuardSource(ShareOutcome& share) {
+    const SourceGuardReport guard =
+        CheckShareSource(rsyncer_, share.name, excludes_, guard_, &TaskRun::PollCurrent);
+    if (guard.result == SourceGuardResult::kSafe) {
+        return true;
+    }
+    share.step = "source-check";
+    share.guard = SourceGuardResultName(guard.result);
+    if (guard.receiver.known) {
+        share.would_delete = static_cast<long long>(guard.receiver.deletions);
+    }
+    share.message = guard.message;
+    if (Cancelled()) {
+        share.state = ShareState::kCancelled;
+    } else if (guard.result == SourceGuardResult::kCheckFailed) {
+        share.state = ShareState::kFailed;
+        share.result = guard.dryRunResult;
+        Fail(guard.dryRunResult != 0 ? ClassifyTransferResult(guard.dryRunResult)
+                                     : RunFailure::kLocal,
+             share.message +
+                 (guard.dryRunResult != 0 ? ": " + NameAndMeaning(guard.dryRunResult) : ""));
+    } else if (guard.result == SourceGuardResult::kTooManyDeletions) {
+        share.state = ShareState::kRefused;
+        Fail(RunFailure::kMaxDelete, share.message);
+    } else {
+        share.state = ShareState::kRefused;
+        Fail(RunFailure::kUnsafeSource,
+             share.message + (guard.result == SourceGuardResult::kEmptySource
+                                  ? " (--allow-empty-source syncs it anyway)"
+                                  : ""));
+    }
+    return false;
+}
+
+void TaskRun::SyncShare(ShareOutcome& share) {
+    const Clock::time_point start = Clock::now();
+    ShareInfo info;
+    if (rsyncer_.GetShareInfo(share.name, info) != 0) {
+        share.state = ShareState::kFailed;
+        share.step = "start";
+        share.message = "share '" + share.name + "' is not registered or unreadable";
+        Fail(RunFailure::kLocal, share.message);
+        return;
+    }
+    share.encrypted = info.IsEncrypted();
+    const TreeSize size = MeasureTree(info.GetModulePath());
+    share.files = size.files;
+    share.bytes = size.bytes;
+    if (!GuardSource(share)) {
+        share.seconds = SecondsSince(start);
+        return;
+    }
+
+    int result = 0;
+    Clock::time_point step = Clock::now();
+    const int started = rsyncer_.StartSyncShare(share.name, result);
+    share.start_seconds = SecondsSince(step);
+    if (started != 0 || result != 0) {
+        share.step = "start";
+        share.result = result;
+        share.state = Cancelled() ? ShareState::kCancelled : ShareState::kRefused;
+        share.message =
+            "the server refused to start share '" + share.name + "': " + NameAndMeaning(result);
+        if (!Cancelled()) {
+            Fail(result == 0 ? RunFailure::kLocal : ClassifyCommandResult(result), share.message);
+        }
+        return;
+    }
+
+    CopyWatch watch;
+    watch.share = &share;
+    observer_->OnCopyStart(share);
+    watch_ = &watch;
+    step = Clock::now();
+    const int rc = rsyncer_.RunSync(task_.GetID(), share.name, "/", excludes_, result);
+    share.copy_seconds = SecondsSince(step);
+    watch.meter.Poll();
+    share.read_bytes = watch.meter.Bytes();
+    watch_ = nullptr;
+    observer_->OnCopyEnd(share);
+    share.seconds = SecondsSince(start);
+    if (Cancelled()) {
+        share.state = ShareState::kCancelled;
+        share.step = "copy";
+        share.result = result;
+        return;
+    }
+    // Files that vanish while they are being sent are normal on a live share; the next run takes
+    // the share as it is then.
+    if (rc != 0 || (result != 0 && result != kResultVanished)) {
+        share.state = ShareState::kFailed;
+        share.step = "copy";
+        share.result = result;
+        share.message = "copying share '" + share.name + "' failed: " + NameAndMeaning(result) +
+                        "; it is not marked complete";
+        Fail(rc != 0 ? RunFailure::kLocal : ClassifyTransferResult(result), share.message);
+        return;
+    }
+    if (result == kResultVanished) {
+        Say("share " + share.name + ": some files vanished while they were copied");
+    }
+
+    if (share.encrypted) {
+        step = Clock::now();
+        const int key = rsyncer_.SyncEncryptKey(share.name);
+        share.key_seconds = SecondsSince(step);
+        if (Cancelled()) {
+            share.state = ShareState::kCancelled;
+            share.step = "key";
+            return;
+        }
+        if (key != 0) {
+            share.state = ShareState::kFailed;
+            share.step = "key";
+            share.result = key;
+            share.message =
+                "sending the key of share '" + share.name + "' failed: " + NameAndMeaning(key);
+            Fail(RunFailure::kKeySync, share.message);
+            return;
+        }
+        Say("share " + share.name + ": key sent");
+    }
+
+    step = Clock::now();
+    const int finished = rsyncer_.FinishSync(kFinishComplete, share.name, result);
+    share.finish_seconds = SecondsSince(step);
+    if (finished != 0 || result != 0) {
+        share.state = Cancelled() ? ShareState::kCancelled : ShareState::kFailed;
+        share.step = "finish";
+        share.result = result;
+        share.message = "the server did not accept the end of share '" + share.name +
+                        "': " + RsyncResultName(result);
+        if (!Cancelled()) {
+            Fail(result == 0 ? RunFailure::kLocal : ClassifyCommandResult(result), share.message);
+        }
+        return;
+    }
+    share.seconds = SecondsSince(start);
+    share.state = ShareState::kSynced;
+}
+
+RunFailure TaskRun::Run(const SyncTask& task) {
+    task_ = task;
+    started_ = Clock::now();
+    const SyncInfo& info = task_.GetInfo().GetSyncInfo();
+    given_address_ = info.GetServerIP().empty() ? info.GetServerName() : info.GetServerIP();
+    shares_.clear();
+    for (const std::string& name : task_.GetInfo().GetShareList()) {
+        ShareOutcome share;
+        share.name = name;
+        shares_.push_back(share);
+    }
+    Say("task \"" + task_.GetInfo().GetName() + "\": " + std::to_string(shares_.size()) + " share" +
+        (shares_.size() == 1 ? "" : "s"));
+
+    CurrentRun current(this);
+    rsyncer_.SetCancelChecker(&TaskRun::PollCurrent);
+    // rsync reports its progress only when asked to; a run without a display does not ask.
+    if (observer_->WantsProgress()) {
+        rsyncer_.SetProgressCallback([this](int percent) {
+            if (watch_ != nullptr && percent >= 0 && percent <= 100) {
+                watch_->percent = percent;
+            }
+        });
+    }
+    Clock::time_point step = Clock::now();
+    const bool connected = Connect();
+    connect_seconds_ = SecondsSince(step);
+    if (!connected) {
+        return failure_;
+    }
+    step = Clock::now();
+    const bool paired = Pair();
+    pair_seconds_ = SecondsSince(step);
+    if (!paired) {
+        return failure_;
+    }
+    for (ShareOutcome& share : shares_) {
+        if (Cancelled()) {
+            break;
+        }
+        SyncShare(share);
+        observer_->OnShareEnd(share);
+        // Without the server or the credentials the remaining shares cannot fare better.
+        if (failure_ == RunFailure::kAuth || failure_ == RunFailure::kUnreachable) {
+            break;
+        }
+    }
+    if (Cancelled()) {
+        Fail(RunFailure::kCancelled, "stopped by " + observer_->CancelReason() +
+                                         "; no unfinished share was marked complete");
+        return failure_;
+    }
+    int result = 0;
+    step = Clock::now();
+    const int beacon = rsyncer_.SendBeacon(task_.GetInfo().GetName(), result);
+    beacon_seconds_ = SecondsSince(step);
+    if (beacon == 0) {
+        beacon_result_ = result;
+        if (result != 0 && !Cancelled()) {
+            Fail(ClassifyCommandResult(result),
+                 "the server did not take the task's status: " + RsyncResultName(result));
+        }
+    } else if (!Cancelled()) {
+        Fail(RunFailure::kLocal, "the task's status could not be sent (see the log above)");
+    }
+    if (Cancelled()) {
+        Fail(RunFailure::kCancelled, "stopped while reporting the task's status");
+    }
+    return failure_;
+}
+
+}  // namespace S2S

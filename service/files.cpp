@@ -1,0 +1,103 @@
+// Directory creation and whole-file replacement for the daemon's files.
+#include "service/files.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace s2sd {
+
+namespace {
+
+std::string Why(const std::string& what, const std::string& path) {
+    return what + " " + path + ": " + std::strerror(errno);
+}
+
+}  // namespace
+
+int MakeDirs(const std::string& dir, mode_t mode, std::string& error) {
+    for (size_t pos = 1; pos <= dir.size(); ++pos) {
+        if (pos != dir.size() && dir[pos] != '/') {
+            continue;
+        }
+        const std::string part = dir.substr(0, pos);
+        if (mkdir(part.c_str(), mode) != 0 && errno != EEXIST) {
+            error = Why("cannot create", part);
+            return -1;
+        }
+    }
+    struct stat st;
+    if (stat(dir.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
+        error = "not a directory: " + dir;
+        return -1;
+    }
+    return 0;
+}
+
+int ReplaceFile(const std::string& path, const std::string& content, mode_t mode,
+                std::string& error) {
+    const std::string temp = path + ".new";
+    const int fd = open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, mode);
+    if (fd < 0) {
+        error = Why("cannot create", temp);
+        return -1;
+    }
+    bool ok = fchmod(fd, mode) == 0;
+    size_t done = 0;
+    while (ok && done < content.size()) {
+        const ssize_t n = write(fd, content.data() + done, content.size() - done);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        ok = n > 0;
+        done += n > 0 ? static_cast<size_t>(n) : 0;
+    }
+    ok = ok && fsync(fd) == 0;
+    if (!ok) {
+        error = Why("cannot write", temp);
+    }
+    if (close(fd) != 0 && ok) {
+        error = Why("cannot write", temp);
+        ok = false;
+    }
+    if (ok && rename(temp.c_str(), path.c_str()) != 0) {
+        error = Why("cannot rename to", path);
+        ok = false;
+    }
+    if (!ok) {
+        unlink(temp.c_str());
+        return -1;
+    }
+    const std::string dir = path.substr(0, path.rfind('/') + 1);
+    const int dfd = open(dir.empty() ? "." : dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (dfd >= 0) {
+        fsync(dfd);
+        close(dfd);
+    }
+    return 0;
+}
+
+bool ReadFile(const std::string& path, std::string& content) {
+    const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+    if (fd < 0) {
+        return false;
+    }
+    content.clear();
+    char buffer[4096];
+    for (;;) {
+        const ssize_t n = read(fd, buffer, sizeof(buffer));
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            close(fd);
+            return n == 0;
+        }
+        content.append(buffer, static_cast<size_t>(n));
+    }
+}
+
+}  // namespace s2sd

@@ -1,0 +1,62 @@
+// RealtimeWatch: a recursive inotify watch over the folders of real-time tasks' shares. It tells
+// which share of which task changed; directories created later are watched as they appear. When
+// the kernel's queue overflows, or a watch cannot be added (the max_user_watches limit), changes
+// may go unseen: the affected shares are reported with `full` set, so the caller syncs them whole
+// and logs why.
+#ifndef S2S_SERVICE_REALTIME_WATCH_H
+#define S2S_SERVICE_REALTIME_WATCH_H
+
+#include <cstdint>
+#include <map>
+#include <string>
+#include <vector>
+
+namespace s2sd {
+
+struct WatchedShare {
+    uint64_t task = 0;
+    std::string share;
+    std::string root;  // the share's folder
+};
+
+struct ShareChange {
+    uint64_t task = 0;
+    std::string share;
+    bool full = false;   // events may have been lost: sync the whole share
+    std::string reason;  // why, for the log, when `full`
+};
+
+class RealtimeWatch {
+  public:
+    RealtimeWatch();
+    ~RealtimeWatch();
+    RealtimeWatch(const RealtimeWatch&) = delete;
+    RealtimeWatch& operator=(const RealtimeWatch&) = delete;
+
+    // The descriptor to poll for readability; -1 when inotify is unavailable.
+    int Fd() const { return fd_; }
+    // Replaces everything watched with `shares`. Shares that could not be watched whole are
+    // returned as changes with `full` set.
+    std::vector<ShareChange> Watch(const std::vector<WatchedShare>& shares);
+    // Reads the pending events (never blocks) and returns the shares they touched, each once.
+    std::vector<ShareChange> Read();
+    // Directories watched now.
+    size_t Count() const { return dirs_.size(); }
+
+  private:
+    // Watches `dir` and every directory below it for `share`; false when a watch failed.
+    bool AddTree(const std::string& dir, size_t share, std::string& reason);
+    void Reset();
+
+    int fd_ = -1;
+    std::vector<WatchedShare> shares_;
+    struct Dir {
+        std::string path;
+        std::vector<size_t> shares;  // indexes into shares_
+    };
+    std::map<int, Dir> dirs_;
+};
+
+}  // namespace s2sd
+
+#endif  // S2S_SERVICE_REALTIME_WATCH_H
