@@ -12,6 +12,14 @@ libdir=$(dirname "$(find "$prefix" -name 's2s.pc' | head -n 1)")/..
 export PKG_CONFIG_PATH=$libdir/pkgconfig
 export LD_LIBRARY_PATH=$libdir
 
+# The installed programs find the installed library by themselves (the receiver's hooks run
+# from a daemon without any library search path), and the receiver's help is not an error.
+env -u LD_LIBRARY_PATH "$prefix/bin/s2s-receiver" --help | grep -q '^usage: s2s-receiver'
+if env -u LD_LIBRARY_PATH ldd "$prefix/bin/s2s-receiver" | grep -q 'not found'; then
+  echo "check_install.sh: an installed program cannot find its libraries" >&2
+  exit 1
+fi
+
 # Every public header compiles on its own; the C headers also compile as C.
 for header in "$prefix"/include/*.h; do
   name=$(basename "$header")
