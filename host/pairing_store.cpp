@@ -459,6 +459,7 @@ int S2SServerGetShare(const char* share, const char* key, char* buf, int size) {
 int S2SUpdateServerInfo(const char* section, VLIBSzHash* values) {
     const char* file = StorePath();
     bool ok = false;
+    int error = VLIB_ERR_BAD_PARAMETER;
     if (section != nullptr && values != nullptr && file != nullptr) {
         EnsureFile();
         WriterLock lock;
@@ -467,10 +468,14 @@ int S2SUpdateServerInfo(const char* section, VLIBSzHash* values) {
             return -1;
         }
         ok = UpdateSection(file, section, values);
+        error = VLIBCErrGet();
     }
     if (!ok) {
         Message("Set section [%s ] value into [%s] error.", section != nullptr ? section : "",
                 file != nullptr ? file : "");
+        // The reason stays readable after the lock's release (VLIB_ERR_TOO_LARGE: the store
+        // would grow past what its reader takes, and nothing was written).
+        VLIBCErrSet(error);
         return -1;
     }
     return 0;

@@ -62,6 +62,8 @@ S2S_EXPORT const char* S2SPath(const char* fixedPath);
 #define VLIB_ERR_SEMAPHORE 0x0800        /* a System V semaphore call failed */
 #define VLIB_ERR_NOT_FOUND 0x2200        /* the section, key or share record is absent */
 #define VLIB_ERR_BAD_FORMAT 0x2201       /* a file holds a line or value it cannot parse */
+#define VLIB_ERR_NAME_TAKEN 0x2202       /* another share's name differs only in case/blanks */
+#define VLIB_ERR_TOO_LARGE 0x2203        /* the file would outgrow what its readers take */
 #define VLIB_ERR_SERVICE_ALREADY 0xEB00  /* the service is already in the wanted state */
 #define VLIB_ERR_SERVICE_UNKNOWN 0xEB01  /* no such service (no executable / unit) */
 #define VLIB_ERR_SERVICE_FAILED 0xEB02   /* the service manager could not do it */
@@ -127,12 +129,13 @@ S2S_EXPORT const char* VLIBCSzListGet(const VLIBSzList* list, int index);
  *
  * Sections and pairs keep their order; comment lines (# or ;) and blank lines are kept on
  * rewrite. Reading a file with a line that is none of these fails with VLIB_ERR_BAD_FORMAT and
- * no write ever touches such a file. Every write replaces the whole file atomically (temporary
- * file in the same directory, fsync, rename, fsync of the directory): a reader or a crash sees
- * the old or the new file, never a torn one, and a failed write leaves the old file as it was.
- * Writers of one file are serialised among themselves (an flock on the file being replaced), so
- * two concurrent writes never lose each other's change. A new file is created with mode 0644; a
- * rewritten file keeps its mode (and owner when permitted).
+ * no write ever touches such a file. A file is read up to VLIB_SECTION_FILE_MAX bytes; a write
+ * whose result would be larger is refused with VLIB_ERR_TOO_LARGE before anything is written. Every
+ * write replaces the whole file atomically (temporary file in the same directory, fsync, rename,
+ * fsync of the directory): a reader or a crash sees the old or the new file, never a torn one, and
+ * a failed write leaves the old file as it was. Writers of one file are serialised among themselves
+ * (an flock on the file being replaced), so two concurrent writes never lose each other's change. A
+ * new file is created with mode 0644; a rewritten file keeps its mode (and owner when permitted).
  *
  * Keys: non-empty, no '=', no CR/LF, no leading/trailing blanks. Section names: non-empty, no
  * CR/LF, no leading/trailing blanks. Values: any bytes but CR/LF (a double quote is fine: the
@@ -144,6 +147,7 @@ S2S_EXPORT const char* VLIBCSzListGet(const VLIBSzList* list, int index);
  * ------------------------------------------------------------------------------------------- */
 #define VLIB_SECTION_LINE_FORMAT "\t%s=\"%s\"\n"
 #define VLIB_SECTION_VALUE_MAX 8192
+#define VLIB_SECTION_FILE_MAX (16 * 1024 * 1024)
 
 /* Adds the pairs of section `section` to `*table` (equal keys replaced; the table is not cleared
  * first). 1 when the section exists (even with no pairs), 0 when it is absent (error
@@ -239,18 +243,23 @@ S2S_EXPORT int VLIBServiceIsRunning(const char* name);
  *   win_share      yes/no
  *   key_len        decimal encryption key length
  *   key_file       stored key file; default S2SPath(S2S_PATH_KEY_DIR)/<name>.key
- *   auto_key_file  key file for automatic mounting; default
- * S2SPath(S2S_PATH_KEY_DIR)/<name>.auto.key in_sharebin    yes/no Absent keys read as empty / "no"
- * / 0. Share names: valid UTF-8, 1..VURN_SHARE_NAME_MAX bytes, no control characters, none of / \ [
- * ], not "." or "..", no leading/trailing blanks. A missing or unreadable registry is a failure
- * (VLIB_ERR_FILE_NOT_FOUND / VLIB_ERR_ACCESS, with an ERROR line); a malformed value is
- * VLIB_ERR_BAD_FORMAT.
+ *   auto_key_file  key file for automatic mounting;
+ *                  default S2SPath(S2S_PATH_KEY_DIR)/<name>.auto.key
+ *   in_sharebin    yes/no
+ *   special_files  yes/no: the receiving daemon keeps setuid/setgid bits of files it receives
+ *                  into this share, and may create device files (off: it strips the bits and,
+ *                  unless some other share asks, cannot create device files at all)
+ * Absent keys read as empty / "no" / 0. Share names: valid UTF-8, 1..VURN_SHARE_NAME_MAX bytes, no
+ * control characters, none of / \ [ ], not "." or "..", no leading/trailing blanks. A missing or
+ * unreadable registry is a failure (VLIB_ERR_FILE_NOT_FOUND / VLIB_ERR_ACCESS, with an ERROR line);
+ * a malformed value is VLIB_ERR_BAD_FORMAT.
  * ------------------------------------------------------------------------------------------- */
 #define VURN_SHARE_NAME_MAX 255
 #define VURN_SHARE_STATUS_ENCRYPTED 0x2
 #define VURN_SHARE_STATUS_AUTO_MOUNT 0x4
 #define VURN_SHARE_STATUS_ACL 0x80
 #define VURN_SHARE_STATUS_WIN_SHARE 0x800
+#define VURN_SHARE_STATUS_SPECIAL_FILES 0x1000
 
 typedef struct VURNShare {
     char* name;          /* the share name */
@@ -291,6 +300,23 @@ S2S_EXPORT int VURNShareRemove(const char* name);
 S2S_EXPORT int VURNShareEnum(VLIBSzList** names);
 /* 1 when `name` is acceptable as a share name, else 0. */
 S2S_EXPORT int VURNShareNameIsValid(const char* name);
+
+/* Share names on the wire. The receiving rsync daemon serves each share as a module of the
+ * share's name, and its configuration reader folds module names: ASCII letter case and blanks
+ * do not count ("docs", "DOCS" and "d ocs" are one module, the last path given wins), and a run
+ * of blanks in a name becomes one blank (a share "a  b" would be served as "a b"). Both ends
+ * use these two rules:
+ * - VURNShareNameIsSyncable: 1 when `name` can be synced at all: a valid share name without
+ *   quotes, backquotes, '%' or "..", not starting with '@' (reserved for the service's own modules
+ *   and for encrypted shares' "@name@"), without a run of blanks, and not "global" in any case.
+ * - VURNShareModuleKey: the folded form (ASCII lower case, blanks removed) into buf; two shares
+ *   with one key would be one module. Its length, or negative (VLIB_ERR_BUFFER_TOO_SMALL).
+ * VURNShareSet refuses a name whose key equals another registered share's (VLIB_ERR_NAME_TAKEN);
+ * VURNShareNameCollision finds that share: 1 with its name in buf, 0 when there is none,
+ * negative on failure. */
+S2S_EXPORT int VURNShareNameIsSyncable(const char* name);
+S2S_EXPORT int VURNShareModuleKey(const char* name, char* buf, int size);
+S2S_EXPORT int VURNShareNameCollision(const char* name, char* buf, int size);
 
 /* ---------------------------------------------------------------------------------------------
  * Host facts, from S2SPath(S2S_PATH_HOST_CONF):

@@ -24,6 +24,7 @@ namespace S2S {
 #define S2S_PATH_RSYNCD_SECRETS "/usr/vurn/etc/s2s_rsyncd.secrets"  // user:password, mode 0600
 #define S2S_PATH_RSYNCD_LOG "/var/log/s2s_rsyncd.log"               // the daemon's log
 #define S2S_PATH_RSYNCD_LOCK "/var/run/s2s_rsyncd.lock"             // the daemon's lock file
+#define S2S_PATH_RECEIVER_LOCK "/var/run/s2s_receiver.lock"         // configure/start/stop lock
 #define S2S_PATH_COMMAND_SPOOL "/var/spool/s2s"                     // replies of commands
 
 // Daemon module names. Share names starting with '@' are not served: that prefix is reserved
@@ -52,6 +53,7 @@ enum ReceiverResult : int {
     kReceiverBadFinishType = 211,  // an unknown "finishType"
     kReceiverShareConflict = 214,  // shares bound to another client
     kReceiverInternal = 215,       // the receiver failed (out of memory, file system)
+    kReceiverStoreFull = 216,      // the pairing store takes no more (size, clients, tasks)
 };
 
 struct S2S_EXPORT ReceiverSettings {
@@ -64,17 +66,28 @@ struct S2S_EXPORT ReceiverSettings {
     bool oldServer = false;
     // The program the daemon runs for commands (this program: s2s-receiver).
     std::string handlerPath;
+    // Connections each module serves at once; more are told to try later.
+    int maxConnections = 16;
 };
 
-// Writes the daemon configuration and the secrets file from `settings` and the share registry.
-// 0, or -1 with an ERROR line (and `*error` set when given).
-S2S_EXPORT int ReceiverConfigure(const ReceiverSettings& settings, std::string* error);
+// Configure, start, stop and the refresh of the share modules take one lock
+// (S2S_PATH_RECEIVER_LOCK) for their whole run: they never overlap.
 
-// Starts the rsync daemon with the written configuration and waits until it accepts
-// connections; marks the service switched on in the pairing store. 0, or -1 (`*error`).
+// Writes the daemon configuration and the secrets file from `settings` and the share registry.
+// Refuses a registry with two shares the daemon would serve as one module (VURNShareModuleKey).
+// Shares that cannot be modules are skipped, each with a line in `*notes` (when given). The key
+// directory is made private again (0700, files 0600). 0, or -1 with an ERROR line (and `*error`
+// set when given).
+S2S_EXPORT int ReceiverConfigure(const ReceiverSettings& settings, std::string* error,
+                                 std::vector<std::string>* notes = nullptr);
+
+// Marks the service switched on in the pairing store, then starts the rsync daemon with the
+// written configuration and waits until it accepts connections. 0, or -1 (`*error`) with no
+// daemon left running: also when the pairing store cannot be written.
 S2S_EXPORT int ReceiverStart(std::string* error);
 // Stops the daemon (and the transfers it runs) and marks the service switched off. 0, also when
-// it was not running; -1 when it would not stop.
+// it was not running; 1 when it stopped but the pairing store could not record that (`*error`
+// says so); -1 when it would not stop.
 S2S_EXPORT int ReceiverStop(std::string* error);
 // True while the daemon of the pid file is alive.
 S2S_EXPORT bool ReceiverRunning();
@@ -99,6 +112,10 @@ S2S_EXPORT int ReceiverHookEarly(int in_fd, bool oldServer);
 // to this connection; post-xfer exec removes this connection's reply.
 S2S_EXPORT int ReceiverHookPre();
 S2S_EXPORT int ReceiverHookPost();
+// pre-xfer exec of the key module: 0 when the connection writes into the key directory of one
+// registered encrypted share ("@s2s-key/<share>"), else 1 with the reason on standard output
+// (shown to the client).
+S2S_EXPORT int ReceiverHookKey();
 
 // What `s2s-receiver status` shows.
 struct S2S_EXPORT ReceiverShareState {
@@ -106,20 +123,25 @@ struct S2S_EXPORT ReceiverShareState {
     std::string state;  // "free", "running" or "completed"
     std::string owner;  // the bound client ("" when free)
     std::string completeID;
+    long lastStart = 0;      // when a client last started a sync of it (seconds; 0: never)
+    std::string lastResult;  // how the last finished sync ended: "complete", "abort", "unpair"
+    long lastTime = 0;       // when it ended (0: no sync has finished)
 };
 struct S2S_EXPORT ReceiverClient {
     std::string clientID;
     std::string serverName;
 };
 struct S2S_EXPORT ReceiverStatus {
-    bool running = false;
-    bool busy = false;
+    bool running = false;        // the daemon is alive (read from the process, not from the store)
+    int transfers = 0;           // connections inside a share or key module right now
+    bool busy = false;           // some task sent a heartbeat in the last 120 seconds
+    std::string storeError;      // why the pairing store could not be read ("" when it could)
     std::string pairedClientID;  // "PairedClientInfo" (single client, or the multi marker)
     std::string pairedServerName;
     std::vector<ReceiverClient> clients;
     std::vector<ReceiverShareState> shares;
 };
-// 0, or -1 when the pairing store cannot be read.
+// 0, or -1 when the pairing store cannot be read (`running` and `transfers` are still true).
 S2S_EXPORT int ReceiverGetStatus(ReceiverStatus* status);
 
 }  // namespace S2S

@@ -53,7 +53,9 @@ S2S_EXPORT int S2SGetServerInfo(const char* section, VLIBSzHash** out);
 S2S_EXPORT int S2SServerGetShare(const char* share, const char* key, char* buf, int size);
 
 /* Sets the pairs of `values` in `section`, keeping the section's other keys; the section is
- * appended when it does not exist yet. One locked read-modify-write. 0, or -1 on any failure. */
+ * appended when it does not exist yet. One locked read-modify-write. 0, or -1 on any failure,
+ * with the platform error set; VLIB_ERR_TOO_LARGE when the store would grow past the size its
+ * reader accepts (VLIB_SECTION_FILE_MAX): such a write is refused before anything is written. */
 S2S_EXPORT int S2SUpdateServerInfo(const char* section, VLIBSzHash* values);
 
 /* S2SUpdateServerInfo on "TASK_<task>" (a task's "status": "idle" or its heartbeat time). */

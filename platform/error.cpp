@@ -161,6 +161,10 @@ const char* VLIBCErrStr(int err) {
             return "No such section, key or share";
         case VLIB_ERR_BAD_FORMAT:
             return "Malformed file content";
+        case VLIB_ERR_NAME_TAKEN:
+            return "Another share's name differs from it only in letter case or blanks";
+        case VLIB_ERR_TOO_LARGE:
+            return "The file would grow past the size its readers accept";
         case VLIB_ERR_SERVICE_ALREADY:
             return "Service already in the wanted state";
         case VLIB_ERR_SERVICE_UNKNOWN:

@@ -715,7 +715,16 @@ int UpdateSectionFile(const std::string& path, bool create,
         try {
             result = edit(doc);
             if (result == 1) {
-                if (ReplaceFile(target, held, doc.Serialize()) != 0) {
+                // A file its own readers would refuse must never be written: checked on the
+                // whole new content, before the old file is touched.
+                std::string content = doc.Serialize();
+                if (content.size() > kSectionFileMax) {
+                    Logger::LogMsg(Logger::Error,
+                                   "[ERROR] section_file.cpp(%d): Section file '%s' would grow "
+                                   "to %zu bytes (at most %zu): not written\n",
+                                   __LINE__, target.c_str(), content.size(), kSectionFileMax);
+                    result = Fail(VLIB_ERR_TOO_LARGE);
+                } else if (ReplaceFile(target, held, content) != 0) {
                     result = -1;
                 }
                 // The replacement has a new inode, which readers notice by themselves; dropping

@@ -12,6 +12,8 @@
 #include <utility>
 #include <vector>
 
+#include "s2s_platform.h"
+
 namespace s2s_platform {
 
 typedef std::vector<std::pair<std::string, std::string>> Pairs;
@@ -76,7 +78,7 @@ class SectionDoc {
 };
 
 // Largest section file read (bytes) and longest line accepted.
-constexpr size_t kSectionFileMax = 16u << 20;
+constexpr size_t kSectionFileMax = VLIB_SECTION_FILE_MAX;
 constexpr size_t kSectionLineMax = 65536;
 
 // Reads and parses `path` without locking (writers replace the file atomically, so a reader sees

@@ -19,7 +19,8 @@ using s2s_platform::Succeed;
 
 namespace {
 
-const char* const kBoolKeys[] = {"encrypted", "auto_mount", "acl", "win_share", "in_sharebin"};
+const char* const kBoolKeys[] = {"encrypted", "auto_mount",  "acl",
+                                 "win_share", "in_sharebin", "special_files"};
 const char* const kPathKeys[] = {"path", "encrypted_path", "key_file", "auto_key_file"};
 
 std::string RegistryPath() {
@@ -81,6 +82,39 @@ bool ValidShareName(const char* name) {
         p += step;
     }
     return true;
+}
+
+// The module name the receiving daemon's configuration reader makes of `name`: it ignores ASCII
+// letter case and every blank when it matches a section header against the ones before it.
+std::string ModuleKey(const std::string& name) {
+    std::string key;
+    for (char c : name) {
+        if (c != ' ' && c != '\t') {
+            key += static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
+        }
+    }
+    return key;
+}
+
+bool SyncableShareName(const char* name) {
+    if (!ValidShareName(name)) {
+        return false;
+    }
+    std::string text = name;
+    return text[0] != '@' && text.find_first_of("\"'`%") == std::string::npos &&
+           text.find("..") == std::string::npos && text.find("  ") == std::string::npos &&
+           ModuleKey(text) != "global";
+}
+
+// The registered share, other than `name` itself, that would be served as the same module.
+std::string CollidingShare(const SectionDoc& doc, const std::string& name) {
+    const std::string key = ModuleKey(name);
+    for (const std::string& other : doc.SectionNames()) {
+        if (other != name && ModuleKey(other) == key) {
+            return other;
+        }
+    }
+    return std::string();
 }
 
 bool ParseBool(const std::string& text, bool& value) {
@@ -173,7 +207,8 @@ int DecodeRecord(const std::string& name, const Pairs& pairs, Record& rec) {
     } kBits[] = {{"encrypted", VURN_SHARE_STATUS_ENCRYPTED},
                  {"auto_mount", VURN_SHARE_STATUS_AUTO_MOUNT},
                  {"acl", VURN_SHARE_STATUS_ACL},
-                 {"win_share", VURN_SHARE_STATUS_WIN_SHARE}};
+                 {"win_share", VURN_SHARE_STATUS_WIN_SHARE},
+                 {"special_files", VURN_SHARE_STATUS_SPECIAL_FILES}};
     for (const auto& bit : kBits) {
         bool on = false;
         std::string value = Lookup(pairs, bit.key);
@@ -240,6 +275,45 @@ extern "C" {
 
 int VURNShareNameIsValid(const char* name) {
     return ValidShareName(name) ? 1 : 0;
+}
+
+int VURNShareNameIsSyncable(const char* name) {
+    try {
+        return SyncableShareName(name) ? 1 : 0;
+    } catch (const std::bad_alloc&) {
+        return 0;
+    }
+}
+
+int VURNShareModuleKey(const char* name, char* buf, int size) {
+    if (name == nullptr || buf == nullptr || size <= 0) {
+        return Fail(VLIB_ERR_BAD_PARAMETER);
+    }
+    try {
+        return s2s_platform::CopyOut(ModuleKey(name), buf, size);
+    } catch (const std::bad_alloc&) {
+        return Fail(VLIB_ERR_OUT_OF_MEMORY);
+    }
+}
+
+int VURNShareNameCollision(const char* name, char* buf, int size) {
+    if (name == nullptr || buf == nullptr || size <= 0) {
+        return Fail(VLIB_ERR_BAD_PARAMETER);
+    }
+    try {
+        SectionDoc doc;
+        if (LoadRegistry(doc) != 0) {
+            return VLIBCErrGet() == VLIB_ERR_FILE_NOT_FOUND ? Succeed(0) : -1;
+        }
+        std::string other = CollidingShare(doc, name);
+        if (other.empty()) {
+            buf[0] = '\0';
+            return Succeed(0);
+        }
+        return s2s_platform::CopyOut(other, buf, size) < 0 ? -1 : Succeed(1);
+    } catch (const std::bad_alloc&) {
+        return Fail(VLIB_ERR_OUT_OF_MEMORY);
+    }
 }
 
 int VURNShareGet(const char* name, VURNShare** share) {
@@ -422,6 +496,15 @@ int VURNShareSet(const char* name, const VLIBSzHash* attrs) {
             return Fail(s2s_platform::ErrorFromErrno(saved));
         }
         int rc = s2s_platform::UpdateSectionFile(path, true, [&](SectionDoc& doc) {
+            // Decided under the registry's write lock: two adds racing cannot both pass.
+            std::string other = CollidingShare(doc, name);
+            if (!other.empty()) {
+                Logger::LogMsg(Logger::Error,
+                               "[ERROR] share_registry.cpp(%d): Share '%s' would be served as the "
+                               "same module as share '%s'\n",
+                               __LINE__, name, other.c_str());
+                return Fail(VLIB_ERR_NAME_TAKEN);
+            }
             if (!doc.ReplacePairs(name, pairs)) {
                 doc.AppendSection(name, pairs);
             }

@@ -1,6 +1,8 @@
 // The receiver's command handlers: a strict reader of untrusted command files and the six
 // commands on top of the pairing store. Answers are result codes (docs/protocol.md); nothing here
 // writes files: the hooks put the answer into the spool.
+#include <strings.h>
+
 #include <cctype>
 #include <cstring>
 #include <ctime>
@@ -26,6 +28,11 @@ constexpr size_t kMaxKey = 64;
 constexpr size_t kMaxClientID = 35;  // the pairing store reads client IDs into 36 bytes
 constexpr size_t kMaxServerName = 255;
 constexpr const char* kMultiMarker = "S2SMULTI-SRC-SUPPORT";
+// What clients may create in the store: client sections, and task sections per client. With the
+// longest names a client can send, these bounds keep the store well below the size its reader
+// takes (every write is also refused when it would pass that size).
+constexpr int kMaxClients = 256;
+constexpr int kMaxTasksPerClient = 64;
 
 typedef std::map<std::string, std::string> Pairs;
 
@@ -59,8 +66,14 @@ bool ValidKey(const std::string& key) {
     return true;
 }
 
+// The multi-client marker stands in the store's "clientID" for "many clients": as a client's
+// own ID it would count as paired without pairing and bind shares to nobody.
+bool ReservedClientID(const std::string& id) {
+    return strcasecmp(id.c_str(), kMultiMarker) == 0;
+}
+
 bool ValidClientID(const std::string& id) {
-    if (id.empty() || id.size() > kMaxClientID) {
+    if (id.empty() || id.size() > kMaxClientID || ReservedClientID(id)) {
         return false;
     }
     for (unsigned char c : id) {
@@ -100,6 +113,10 @@ bool Decimal(const std::string& v) {
     return true;
 }
 
+std::string Now() {
+    return std::to_string(static_cast<long long>(time(nullptr)));
+}
+
 Hash NewHash() {
     return Hash(VLIBCSzHashAlloc(16));
 }
@@ -109,6 +126,43 @@ bool Set(Hash& h, const char* key, const std::string& value) {
     int rc = VLIBCSzHashSetValue(&raw, key, value.c_str());
     h.reset(raw);
     return rc >= 0;
+}
+
+// The answer to a failed store write: the store is full (nothing was written), or it failed.
+int StoreWriteFailure() {
+    return VLIBCErrGet() == VLIB_ERR_TOO_LARGE ? kReceiverStoreFull : kReceiverStoreWrite;
+}
+
+// Whether the store may take one more section starting with `prefix` when it does not hold
+// `section` yet: fewer than `limit` such sections. 0 (yes), 216 (no) or 206.
+int RoomFor(const std::string& section, const std::string& prefix, int limit) {
+    List names(VLIBCSzListAlloc(64));
+    if (!names) {
+        return kReceiverInternal;
+    }
+    VLIBSzList* raw = names.release();
+    S2SCheckServerInfo();
+    int count = VLIBCFileEnumSection(S2SPath(S2S_PATH_PAIRING_STORE), &raw);
+    names.reset(raw);
+    if (count < 0) {
+        return VLIBCErrGet() == VLIB_ERR_FILE_NOT_FOUND ? kReceiverOK : kReceiverStoreRead;
+    }
+    int same = 0;
+    for (int i = 0; i < VLIBCSzListCount(names.get()); ++i) {
+        const std::string name = VLIBCSzListGet(names.get(), i);
+        if (name == section) {
+            return kReceiverOK;
+        }
+        same += name.compare(0, prefix.size(), prefix) == 0;
+    }
+    if (same >= limit) {
+        Logger::LogMsg(Logger::Warning,
+                       "[WARNING] receiver_commands.cpp(%d): the pairing store holds %d sections "
+                       "'%s...' already (at most %d)\n",
+                       __LINE__, same, prefix.c_str(), limit);
+        return kReceiverStoreFull;
+    }
+    return kReceiverOK;
 }
 
 // The client recorded in "PairedClientInfo" by the single-client scheme ("" when none, the
@@ -135,7 +189,7 @@ int ClientPaired(const std::string& id) {
     if (!SingleClient(&single)) {
         return -1;
     }
-    if (single == id) {
+    if (single == id && !ReservedClientID(id)) {
         return 1;
     }
     Hash h = NewHash();
@@ -214,7 +268,7 @@ int UpdateShare(const std::string& share,
             return kReceiverInternal;
         }
     }
-    return S2SServerUpdateShare(share.c_str(), h.get()) == 0 ? kReceiverOK : kReceiverStoreWrite;
+    return S2SServerUpdateShare(share.c_str(), h.get()) == 0 ? kReceiverOK : StoreWriteFailure();
 }
 
 // The share's "CompleteID" as stored, "" when absent. Binding writes it back with "RunningID":
@@ -238,11 +292,15 @@ int RecordMultiClient(const std::string& clientID, const std::string& serverName
                    {{"clientID", kMultiMarker}, {"serverName", kMultiMarker}})) {
         return kReceiverOK;
     }
+    int room = RoomFor("CLIENTID_" + clientID, "CLIENTID_", kMaxClients);
+    if (room != kReceiverOK) {
+        return room;
+    }
     if (old == 1 && s2s_svr_reset_pair() != 0) {
-        return kReceiverStoreWrite;
+        return StoreWriteFailure();
     }
     int rc = S2SServerUpdatePairInfo(clientID.c_str(), serverName.c_str());
-    return rc == 0 ? kReceiverOK : kReceiverStoreWrite;
+    return rc == 0 ? kReceiverOK : StoreWriteFailure();
 }
 
 class Command {
@@ -323,7 +381,7 @@ int Pairing(const Command& c) {
         return kReceiverInternal;
     }
     rc = S2SServerSetPairValue(h.get());
-    return rc == 0 ? kReceiverOK : kReceiverStoreWrite;
+    return rc == 0 ? kReceiverOK : StoreWriteFailure();
 }
 
 int PairingMultiSrc(const Command& c, ReceiverAnswer* a) {
@@ -433,7 +491,18 @@ int SyncStart(const Command& c) {
     if (withAttributes && encrypted != (c.Get("isEncrypt") == "1")) {
         return kReceiverAttrMismatch;
     }
-    return UpdateShare(share, {{"RunningID", c.Client()}, {"CompleteID", CompleteID(share)}});
+    // A share registered after the daemon was configured is served from this moment on: the
+    // daemon reads its configuration afresh for every connection, the data run included.
+    std::string error;
+    if (receiver_internal::RefreshShareModules(&error) != 0) {
+        Logger::LogMsg(Logger::Error,
+                       "[ERROR] receiver_commands.cpp(%d): the share modules were not brought up "
+                       "to date: %s\n",
+                       __LINE__, error.c_str());
+    }
+    return UpdateShare(
+        share,
+        {{"RunningID", c.Client()}, {"CompleteID", CompleteID(share)}, {"LastStart", Now()}});
 }
 
 int SyncFinish(const Command& c) {
@@ -451,13 +520,23 @@ int SyncFinish(const Command& c) {
     if (rc != kReceiverOK) {
         return rc;
     }
+    // Every finish records what became of the client's sync and when, for the status.
+    const std::string now = Now();
     if (type == "complete") {
-        return UpdateShare(share, {{"RunningID", c.Client()}, {"CompleteID", c.Client()}});
+        return UpdateShare(share, {{"RunningID", c.Client()},
+                                   {"CompleteID", c.Client()},
+                                   {"LastResult", type},
+                                   {"LastTime", now}});
     }
     if (type == "unpair") {
-        return UpdateShare(share, {{"RunningID", ""}, {"CompleteID", ""}});
+        return UpdateShare(
+            share,
+            {{"RunningID", ""}, {"CompleteID", ""}, {"LastResult", type}, {"LastTime", now}});
     }
-    return UpdateShare(share, {{"RunningID", c.Client()}, {"CompleteID", CompleteID(share)}});
+    return UpdateShare(share, {{"RunningID", c.Client()},
+                               {"CompleteID", CompleteID(share)},
+                               {"LastResult", type},
+                               {"LastTime", now}});
 }
 
 int UpdateTaskStatus(const Command& c) {
@@ -473,13 +552,17 @@ int UpdateTaskStatus(const Command& c) {
     if (paired <= 0) {
         return paired < 0 ? kReceiverStoreRead : kReceiverNotPaired;
     }
-    Hash h = NewHash();
-    if (!h || !Set(h, "status", std::to_string(static_cast<long long>(time(nullptr))))) {
-        return kReceiverInternal;
-    }
     // Tasks of different clients may share a name: the client ID keeps their heartbeats apart.
     std::string key = c.Client() + "/" + task;
-    return S2SServerUpdateTask(key.c_str(), h.get()) == 0 ? kReceiverOK : kReceiverStoreWrite;
+    int room = RoomFor("TASK_" + key, "TASK_" + c.Client() + "/", kMaxTasksPerClient);
+    if (room != kReceiverOK) {
+        return room;
+    }
+    Hash h = NewHash();
+    if (!h || !Set(h, "status", Now())) {
+        return kReceiverInternal;
+    }
+    return S2SServerUpdateTask(key.c_str(), h.get()) == 0 ? kReceiverOK : StoreWriteFailure();
 }
 
 }  // namespace
@@ -487,17 +570,13 @@ int UpdateTaskStatus(const Command& c) {
 namespace receiver_internal {
 
 bool ValidShareName(const std::string& name) {
-    if (name.empty() || name.size() > VURN_SHARE_NAME_MAX || HasControl(name) ||
-        name.find_first_of("/\\\"'`[]") != std::string::npos ||
-        name.find("..") != std::string::npos || name[0] == '@') {
-        return false;
-    }
-    return VURNShareNameIsValid(name.c_str()) == 1;
+    return VURNShareNameIsSyncable(name.c_str()) == 1;
 }
 
 bool ValidTaskName(const std::string& name) {
     return !name.empty() && name.size() <= VURN_SHARE_NAME_MAX && !HasControl(name) &&
-           name.find_first_of("\"'`[]\\") == std::string::npos && name.front() != ' ' &&
+           name.find_first_of("/\"'`[]\\") == std::string::npos &&
+           name.find("..") == std::string::npos && name.front() != ' ' && name.front() != '@' &&
            name.back() != ' ';
 }
 
@@ -506,10 +585,12 @@ int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs)
     pairs->clear();
     std::vector<std::string> lines;
     size_t start = 0;
+    bool unterminated = false;  // every line ends with a line break, the last one too
     while (start < input.size()) {
         size_t end = input.find('\n', start);
         if (end == std::string::npos) {
             end = input.size();
+            unterminated = true;
         }
         lines.push_back(input.substr(start, end - start));
         start = end + 1;
@@ -523,7 +604,7 @@ int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs)
             *token = t;
         }
     }
-    if (token->empty() || input.size() > command_reply::kMaxCommandFile) {
+    if (token->empty() || unterminated || input.size() > command_reply::kMaxCommandFile) {
         return kReceiverMalformed;
     }
     std::vector<std::pair<std::string, std::string>> ordered;

@@ -1,12 +1,17 @@
-// The receiver's rsync daemon: its configuration written from the share registry, its start and
-// stop, and the status a status page shows.
+// The receiver's rsync daemon: its configuration written from the share registry (and its share
+// modules brought up to date when the registry changes), its start and stop under one lock, and
+// the status a status page shows.
 #include <arpa/inet.h>
 #include <dirent.h>
 #include <fcntl.h>
+#include <limits.h>
+#include <linux/capability.h>
 #include <netinet/in.h>
 #include <poll.h>
 #include <pwd.h>
 #include <signal.h>
+#include <sys/file.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -21,6 +26,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
+#include <iterator>
+#include <map>
 #include <memory>
 #include <set>
 #include <sstream>
@@ -428,9 +435,147 @@ int ShareEncrypted(const std::string& name, bool* encrypted) {
 
 }  // namespace receiver_internal
 
-int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
+namespace {
+
+// Starts the part of the configuration that is rewritten from the share registry; everything
+// above it is written by `configure` alone.
+const char kShareMarker[] = "# Share modules, rewritten from the share registry when it changes.\n";
+// Present in the share part when some share may receive device files: the daemon then keeps the
+// right to create them (read by `start`).
+const char kDevicesLine[] = "# device files: allowed\n";
+
+// Holds the receiver's administration lock: configure, start, stop and a refresh of the share
+// modules never overlap (a second start would otherwise take the first one's daemon for its own
+// failed one and end it through the pid file).
+class AdminLock {
+  public:
+    AdminLock() {
+        const std::string path = S2SPath(S2S_PATH_RECEIVER_LOCK);
+        MakeDirs(Parent(path), 0755);
+        fd_ = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
+        if (fd_ >= 0) {
+            int rc;
+            while ((rc = flock(fd_, LOCK_EX)) != 0 && errno == EINTR) {
+            }
+            if (rc != 0) {
+                close(fd_);
+                fd_ = -1;
+            }
+        }
+    }
+    ~AdminLock() {
+        if (fd_ >= 0) {
+            close(fd_);
+        }
+    }
+    AdminLock(const AdminLock&) = delete;
+    AdminLock& operator=(const AdminLock&) = delete;
+    bool held() const { return fd_ >= 0; }
+
+  private:
+    int fd_ = -1;
+};
+
+// Key files are private to root: directories 0700, files 0600, whatever an earlier version or a
+// transfer left. Symbolic links are neither followed nor changed.
+void TightenKeys(const std::string& dir, int depth) {
+    chmod(dir.c_str(), 0700);
+    DIR* d = depth > 0 ? opendir(dir.c_str()) : nullptr;
+    if (d == nullptr) {
+        return;
+    }
+    while (struct dirent* e = readdir(d)) {
+        std::string name = e->d_name;
+        struct stat st;
+        std::string path = dir + "/" + name;
+        if (name == "." || name == ".." || lstat(path.c_str(), &st) != 0) {
+            continue;
+        }
+        if (S_ISDIR(st.st_mode)) {
+            TightenKeys(path, depth - 1);
+        } else if (S_ISREG(st.st_mode)) {
+            chmod(path.c_str(), 0600);
+        }
+    }
+    closedir(d);
+}
+
+// The share modules from the share registry. Names that cannot be modules are skipped with a
+// note; two shares the daemon would serve as one module fail the whole set.
+int ShareModules(std::string* text, std::vector<std::string>* notes, std::string* error) {
+    VLIBSzList* rawNames = VLIBCSzListAlloc(16);
+    int count = VURNShareEnum(&rawNames);
+    std::unique_ptr<VLIBSzList, ListDeleter> names(rawNames);
+    if (count < 0 && VLIBCErrGet() != VLIB_ERR_FILE_NOT_FOUND) {
+        return Fail(error, "cannot read the share registry");
+    }
+    std::ostringstream c;
+    std::map<std::string, std::string> modules;  // module key -> share
+    bool devices = false;
+    for (int i = 0; i < VLIBCSzListCount(names.get()); ++i) {
+        std::string name = VLIBCSzListGet(names.get(), i);
+        VURNShare* raw = nullptr;
+        if (VURNShareGet(name.c_str(), &raw) < 0) {
+            return Fail(error, "cannot read the share " + name);
+        }
+        std::unique_ptr<VURNShare, ShareDeleter> share(raw);
+        std::string path = share->path;
+        if (!receiver_internal::ValidShareName(name) || !ConfSafe(name) || path.empty() ||
+            path[0] != '/' || !ConfSafe(path)) {
+            std::string shown = HasControl(name) ? "?" : name;
+            Logger::LogMsg(Logger::Warning,
+                           "[WARNING] receiver_daemon.cpp(%d): share '%s' is not served (its name "
+                           "or path cannot be a daemon module)\n",
+                           __LINE__, shown.c_str());
+            if (notes != nullptr) {
+                notes->push_back("share '" + shown +
+                                 "' is not served: its name or path cannot be a daemon module "
+                                 "(quotes, '%', '..', a leading '@', two blanks in a row, or "
+                                 "the name global)");
+            }
+            continue;
+        }
+        char key[VURN_SHARE_NAME_MAX + 1];
+        if (VURNShareModuleKey(name.c_str(), key, sizeof key) < 0) {
+            return Fail(error, "cannot derive the module of share " + name);
+        }
+        auto taken = modules.emplace(key, name);
+        if (!taken.second) {
+            return Fail(error, "shares '" + taken.first->second + "' and '" + name +
+                                   "' would be served as one module (names may not differ only "
+                                   "in letter case or blanks): rename one of them");
+        }
+        const bool special = (share->status & VURN_SHARE_STATUS_SPECIAL_FILES) != 0;
+        devices = devices || special;
+        // Clients push; nothing is read back. Setuid and setgid bits of received files are
+        // dropped unless the share asks to keep them.
+        std::string module = "\tpath = " + path + "\n\twrite only = yes\n";
+        if (!special) {
+            module += "\tincoming chmod = Fug-s\n";
+        }
+        c << "[" << name << "]\n" << module << "\n";
+        if ((share->status & VURN_SHARE_STATUS_ENCRYPTED) != 0) {
+            char buf[4096];
+            if (VLIBShareEncryptPathGet(path.c_str(), buf, sizeof buf) < 0 || !ConfSafe(buf)) {
+                return Fail(error, "cannot find the encrypted directory of " + name);
+            }
+            MakeDirs(buf, 0700);
+            std::string encrypted =
+                "\tpath = " + std::string(buf) + module.substr(module.find('\n'));
+            c << "[@" << name << "@]\n" << encrypted << "\n";
+        }
+    }
+    *text = std::string(kShareMarker) + (devices ? kDevicesLine : "") + "\n" + c.str();
+    return 0;
+}
+
+int ConfigureLocked(const ReceiverSettings& s, std::string* error,
+                    std::vector<std::string>* notes) {
     if (s.port <= 0 || s.port > 65535) {
         return Fail(error, "invalid port");
+    }
+    if (s.maxConnections <= 0 || s.maxConnections > 10000) {
+        return Fail(error, "invalid connection limit (1 to 10000)");
     }
     if (!ValidAddress(s.address)) {
         return Fail(error, "invalid listen address");
@@ -461,6 +606,10 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
     if (!rootValue.empty() && !ConfSafe(rootValue)) {
         return Fail(error, "S2S_ROOT not usable in the daemon configuration");
     }
+    std::string shares;
+    if (ShareModules(&shares, notes, error) != 0) {
+        return -1;
+    }
     for (const std::string& dir : {Parent(conf), Parent(pid), Parent(log), Parent(lock)}) {
         MakeDirs(dir, 0755);
     }
@@ -479,6 +628,7 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
         readerGid = pw->pw_gid;
     }
     MakeDirs(keys, 0700);
+    TightenKeys(keys, 2);
 
     std::ostringstream c;
     c << "# Written by s2s-receiver configure; rewritten on every configure.\n"
@@ -502,13 +652,18 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
       << "secrets file = " << secrets << "\n"
       << "strict modes = yes\n"
       << "timeout = 900\n"
+      // Connections per module at once (the daemon counts them in the lock file).
+      << "max connections = " << s.maxConnections
+      << "\n"
       // Small protocol messages go out at once instead of waiting for the peer's delayed ACK.
       << "socket options = TCP_NODELAY\n\n";
 
     // The hooks run through the daemon's shell: every value is single-quoted and was checked to
-    // hold no quote. The shell replaces itself with the handler instead of forking it.
-    std::string hook =
-        "S2S_ROOT=" + Quote(rootValue) + "; export S2S_ROOT; exec " + Quote(s.handlerPath) + " ";
+    // hold no quote. Their error output goes to the daemon's log, so that a hook that cannot
+    // even start (a library it cannot load) says why there. The shell replaces itself with the
+    // handler instead of forking it.
+    std::string hook = "S2S_ROOT=" + Quote(rootValue) + "; export S2S_ROOT; [ -w " + Quote(log) +
+                       " ] && exec 2>>" + Quote(log) + "; exec " + Quote(s.handlerPath) + " ";
     c << "[" << S2S_COMMAND_MODULE << "]\n"
       << "\tpath = " << spool << "/replies\n"
       << "\tread only = yes\n"
@@ -523,61 +678,94 @@ int ReceiverConfigure(const ReceiverSettings& s, std::string* error) {
       << "\tpath = " << keys
       << "\n"
       // Every client run carries --delete; on a single key file it removes nothing, so the key
-      // module must not refuse it.
-      << "\twrite only = yes\n\n";
-
-    VLIBSzList* rawNames = VLIBCSzListAlloc(16);
-    int count = VURNShareEnum(&rawNames);
-    std::unique_ptr<VLIBSzList, ListDeleter> names(rawNames);
-    if (count < 0 && VLIBCErrGet() != VLIB_ERR_FILE_NOT_FOUND) {
-        return Fail(error, "cannot read the share registry");
-    }
-    for (int i = 0; i < VLIBCSzListCount(names.get()); ++i) {
-        std::string name = VLIBCSzListGet(names.get(), i);
-        VURNShare* raw = nullptr;
-        if (VURNShareGet(name.c_str(), &raw) < 0) {
-            return Fail(error, "cannot read the share " + name);
-        }
-        std::unique_ptr<VURNShare, ShareDeleter> share(raw);
-        std::string lower = name;
-        for (char& ch : lower) {
-            ch = static_cast<char>(std::tolower(static_cast<unsigned char>(ch)));
-        }
-        std::string path = share->path;
-        if (!receiver_internal::ValidShareName(name) || !ConfSafe(name) || lower == "global" ||
-            path.empty() || path[0] != '/' || !ConfSafe(path)) {
-            Logger::LogMsg(Logger::Warning,
-                           "[WARNING] receiver_daemon.cpp(%d): share '%s' is not served (its name "
-                           "or path cannot be a daemon module)\n",
-                           __LINE__, HasControl(name) ? "?" : name.c_str());
-            continue;
-        }
-        c << "[" << name << "]\n\tpath = " << path << "\n\n";
-        if ((share->status & VURN_SHARE_STATUS_ENCRYPTED) != 0) {
-            char buf[4096];
-            if (VLIBShareEncryptPathGet(path.c_str(), buf, sizeof buf) < 0 || !ConfSafe(buf)) {
-                return Fail(error, "cannot find the encrypted directory of " + name);
-            }
-            MakeDirs(buf, 0700);
-            c << "[@" << name << "@]\n\tpath = " << buf << "\n\n";
-        }
-    }
+      // module must not refuse it. Keys arrive private to root, each into the directory of one
+      // registered encrypted share (the hook refuses any other destination).
+      << "\twrite only = yes\n"
+      << "\tincoming chmod = D700,F600\n"
+      << "\tpre-xfer exec = " << hook << "hook-key\n\n";
+    c << shares;
 
     if (!WriteFileAtomic(secrets, s.user + ":" + s.password + "\n", 0600)) {
         return Fail(error, "cannot write " + secrets + ": " + strerror(errno));
     }
-    if (!WriteFileAtomic(conf, c.str(), 0644)) {
+    // Private: it names every share's path, and only root's daemon reads it.
+    if (!WriteFileAtomic(conf, c.str(), 0600)) {
         return Fail(error, "cannot write " + conf + ": " + strerror(errno));
     }
     return 0;
 }
 
-bool ReceiverRunning() {
-    pid_t pid = PidFromFile();
-    return pid > 0 && ProcessAlive(pid);
+}  // namespace
+
+namespace receiver_internal {
+
+int RefreshShareModules(std::string* error) {
+    const std::string conf = S2SPath(S2S_PATH_RSYNCD_CONF);
+    std::ifstream in(conf);
+    if (!in) {
+        struct stat st;
+        // Not configured: no daemon reads modules yet.
+        return stat(conf.c_str(), &st) != 0 && errno == ENOENT
+                   ? 0
+                   : Fail(error, conf + " cannot be read");
+    }
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    size_t marker = text.find(kShareMarker);
+    if (marker == std::string::npos) {
+        return Fail(error, conf + " was written by an earlier version: run s2s-receiver configure");
+    }
+    std::string shares;
+    if (ShareModules(&shares, nullptr, error) != 0) {
+        return -1;
+    }
+    if (text.compare(marker, std::string::npos, shares) == 0) {
+        return 0;
+    }
+    AdminLock lock;
+    if (!lock.held()) {
+        return Fail(error, std::string("cannot take the receiver's lock: ") + strerror(errno));
+    }
+    // Read again under the lock: a configure may have rewritten the file meanwhile.
+    std::ifstream again(conf);
+    text.assign((std::istreambuf_iterator<char>(again)), std::istreambuf_iterator<char>());
+    marker = text.find(kShareMarker);
+    if (marker == std::string::npos || ShareModules(&shares, nullptr, error) != 0) {
+        return marker == std::string::npos ? Fail(error, conf + " changed meanwhile") : -1;
+    }
+    if (!WriteFileAtomic(conf, text.substr(0, marker) + shares, 0600)) {
+        return Fail(error, "cannot write " + conf + ": " + strerror(errno));
+    }
+    return 0;
 }
 
-int ReceiverStart(std::string* error) {
+}  // namespace receiver_internal
+
+int ReceiverConfigure(const ReceiverSettings& s, std::string* error,
+                      std::vector<std::string>* notes) {
+    AdminLock lock;
+    if (!lock.held()) {
+        return Fail(error, std::string("cannot take the receiver's lock: ") + strerror(errno));
+    }
+    return ConfigureLocked(s, error, notes);
+}
+
+namespace {
+
+int StopLocked(std::string* error);
+
+// Whether the written configuration lets the daemon create device files (some share asks).
+bool DevicesAllowed(const std::string& conf) {
+    std::ifstream in(conf);
+    std::string line;
+    while (std::getline(in, line)) {
+        if (line + "\n" == kDevicesLine) {
+            return true;
+        }
+    }
+    return false;
+}
+
+int StartLocked(std::string* error) {
     const std::string conf = S2SPath(S2S_PATH_RSYNCD_CONF);
     struct stat st;
     if (stat(conf.c_str(), &st) != 0) {
@@ -586,14 +774,23 @@ int ReceiverStart(std::string* error) {
     if (ReceiverRunning()) {
         return Fail(error, "the daemon is running already");
     }
+    // The service's state lives in the pairing store: a store that cannot be written means a
+    // daemon nobody could tell is running, so it is not started at all.
+    if (SetEnabled(true) != 0) {
+        return Fail(error, std::string("the pairing store ") + S2SPath(S2S_PATH_PAIRING_STORE) +
+                               " cannot be written (" + VLIBCErrStr(VLIBCErrGet()) +
+                               "): the daemon was not started");
+    }
     unlink(S2SPath(S2S_PATH_RSYNCD_PID));
     std::string rsync = rsync_internal::FindProgram("rsync");
     if (rsync.empty()) {
+        SetEnabled(false);
         return Fail(error, "rsync is not installed");
     }
     int port = 873;
     std::string address;
     ListenSettings(&port, &address);
+    const bool devices = DevicesAllowed(conf);
 
     // The daemon outlives this program in a session of its own and stays in the foreground of
     // it (--no-detach), so that the pid it writes is the one to stop.
@@ -604,12 +801,14 @@ int ReceiverStart(std::string* error) {
     // writes its pid file (a port in use) is noticed at once.
     int report[2];
     if (pipe2(report, O_CLOEXEC) != 0) {
+        SetEnabled(false);
         return Fail(error, std::string("pipe: ") + strerror(errno));
     }
     pid_t first = fork();
     if (first < 0) {
         close(report[0]);
         close(report[1]);
+        SetEnabled(false);
         return Fail(error, std::string("fork: ") + strerror(errno));
     }
     if (first == 0) {
@@ -624,6 +823,14 @@ int ReceiverStart(std::string* error) {
         if (setsid() < 0) {
             _exit(1);
         }
+        // Unless a share asks for them, neither the daemon nor anything it starts can create
+        // device files, whatever a client sends (rsync's option refusal does not hold for -D).
+        if (!devices && prctl(PR_CAPBSET_DROP, CAP_MKNOD, 0, 0, 0) != 0) {
+            _exit(1);
+        }
+        // Module names are matched with ASCII case folding only, as the share registry
+        // assumes (VURNShareModuleKey).
+        setenv("LC_ALL", "C", 1);
         int devnull = open("/dev/null", O_RDWR);
         if (devnull >= 0) {
             dup2(devnull, 0);
@@ -646,6 +853,7 @@ int ReceiverStart(std::string* error) {
     while (waitpid(first, &status, 0) < 0 && errno == EINTR) {
     }
     if (!WIFEXITED(status) || WEXITSTATUS(status) != 0 || started <= 0) {
+        SetEnabled(false);
         return Fail(error, "cannot start the daemon");
     }
     auto deadline = std::chrono::steady_clock::now() + kStartWait;
@@ -658,20 +866,18 @@ int ReceiverStart(std::string* error) {
         bool died = !ProcessAlive(started);
         if (died || std::chrono::steady_clock::now() >= deadline) {
             std::string tail = LogTail();
-            ReceiverStop(nullptr);
+            // Ours only: the lock keeps any other start out, so the pid file names our daemon.
+            StopLocked(nullptr);
             return Fail(error, std::string(died ? "the daemon ended" : "the daemon did not start") +
                                    " instead of listening on port " + std::to_string(port) +
                                    (tail.empty() ? "" : ": " + tail));
         }
         std::this_thread::sleep_for(std::chrono::milliseconds(20));
     }
-    if (SetEnabled(true) != 0) {
-        return Fail(error, "cannot mark the service switched on in the pairing store");
-    }
     return 0;
 }
 
-int ReceiverStop(std::string* error) {
+int StopLocked(std::string* error) {
     pid_t pid = PidFromFile();
     if (pid > 0 && ProcessAlive(pid)) {
         // A daemon started before it led its own group is found through its descendants only.
@@ -684,30 +890,87 @@ int ReceiverStop(std::string* error) {
     receiver_internal::RemoveFinishedReplies();
     unlink(S2SPath(S2S_PATH_RSYNCD_PID));
     if (SetEnabled(false) != 0) {
-        return Fail(error, "cannot mark the service switched off in the pairing store");
+        std::string text = std::string("the daemon is stopped, but the pairing store ") +
+                           S2SPath(S2S_PATH_PAIRING_STORE) + " cannot record it (" +
+                           VLIBCErrStr(VLIBCErrGet()) + ")";
+        Logger::LogMsg(Logger::Warning, "[WARNING] receiver_daemon.cpp(%d): %s\n", __LINE__,
+                       text.c_str());
+        if (error != nullptr) {
+            *error = text;
+        }
+        return 1;
     }
     return 0;
 }
 
+// The connections that are inside a share or key module right now: the daemon's connection
+// processes whose root is a module's chroot other than the command module's.
+int RunningTransfers(pid_t daemon) {
+    const std::string replies = std::string(S2SPath(S2S_PATH_COMMAND_SPOOL)) + "/replies";
+    int count = 0;
+    for (const ProcEntry& p : ProcessTable()) {
+        if (p.ppid != daemon || p.zombie) {
+            continue;
+        }
+        char target[PATH_MAX];
+        ssize_t n = readlink(("/proc/" + std::to_string(p.pid) + "/root").c_str(), target,
+                             sizeof target - 1);
+        if (n <= 0) {
+            continue;
+        }
+        target[n] = '\0';
+        count += std::strcmp(target, "/") != 0 && replies != target;
+    }
+    return count;
+}
+
+}  // namespace
+
+bool ReceiverRunning() {
+    pid_t pid = PidFromFile();
+    return pid > 0 && ProcessAlive(pid);
+}
+
+int ReceiverStart(std::string* error) {
+    AdminLock lock;
+    if (!lock.held()) {
+        return Fail(error, std::string("cannot take the receiver's lock: ") + strerror(errno));
+    }
+    return StartLocked(error);
+}
+
+int ReceiverStop(std::string* error) {
+    AdminLock lock;
+    if (!lock.held()) {
+        return Fail(error, std::string("cannot take the receiver's lock: ") + strerror(errno));
+    }
+    return StopLocked(error);
+}
+
 int ReceiverGetStatus(ReceiverStatus* out) {
     *out = ReceiverStatus();
+    // What runs is read from the processes themselves, so that it is true also when the pairing
+    // store cannot be read.
+    out->running = ReceiverRunning();
+    out->transfers = out->running ? RunningTransfers(PidFromFile()) : 0;
     s2s_svr_status st{};
     int rc = s2s_svr_get_status(&st);
-    out->running = st.running != 0;
     out->busy = st.busy != 0;
     out->pairedClientID = st.client_id != nullptr ? st.client_id : "";
     out->pairedServerName = st.server_name != nullptr ? st.server_name : "";
     s2s_svr_put_status(&st);
+    const std::string store = S2SPath(S2S_PATH_PAIRING_STORE);
     if (rc != 0) {
+        out->storeError = store + " cannot be read (" + VLIBCErrStr(VLIBCErrGet()) + ")";
         return -1;
     }
     VLIBSzList* rawSections = VLIBCSzListAlloc(64);
-    int count = VLIBCFileEnumSection(S2SPath(S2S_PATH_PAIRING_STORE), &rawSections);
+    int count = VLIBCFileEnumSection(store.c_str(), &rawSections);
     std::unique_ptr<VLIBSzList, ListDeleter> sections(rawSections);
     if (count < 0) {
+        out->storeError = store + " cannot be read (" + VLIBCErrStr(VLIBCErrGet()) + ")";
         return -1;
     }
-    const std::string store = S2SPath(S2S_PATH_PAIRING_STORE);
     for (int i = 0; i < VLIBCSzListCount(sections.get()); ++i) {
         std::string section = VLIBCSzListGet(sections.get(), i);
         std::unique_ptr<VLIBSzHash, HashDeleter> h(VLIBCSzHashAlloc(8));
@@ -715,11 +978,19 @@ int ReceiverGetStatus(ReceiverStatus* out) {
         int found = VLIBCFileGetSection(store.c_str(), section.c_str(), &raw);
         h.reset(raw);
         if (found < 0) {
+            out->storeError = store + " cannot be read (" + VLIBCErrStr(VLIBCErrGet()) + ")";
             return -1;
         }
         auto value = [&](const char* key) {
             const char* v = VLIBCSzHashGetValue(h.get(), key);
             return std::string(v != nullptr ? v : "");
+        };
+        auto seconds = [&](const char* key) {
+            std::string v = value(key);
+            return v.empty() || v.size() > 18 ||
+                           v.find_first_not_of("0123456789") != std::string::npos
+                       ? 0L
+                       : std::atol(v.c_str());
         };
         if (section.compare(0, 9, "CLIENTID_") == 0) {
             out->clients.push_back({section.substr(9), value("ServerName")});
@@ -727,6 +998,9 @@ int ReceiverGetStatus(ReceiverStatus* out) {
             ReceiverShareState share;
             share.name = section.substr(6);
             share.completeID = value("CompleteID");
+            share.lastStart = seconds("LastStart");
+            share.lastResult = value("LastResult");
+            share.lastTime = seconds("LastTime");
             std::string running = value("RunningID");
             // The pairing store's own reading of the two IDs.
             if (running.empty()) {

@@ -9,6 +9,9 @@
 // later early hook: records of connections that have ended, and anything older than any command
 // may take.
 //
+// The key module's pre-transfer hook lets a connection write only into the key directory of one
+// registered encrypted share.
+//
 // The pre- and post-transfer hooks did that work in configurations written by earlier versions;
 // they are kept for those until the next configure.
 #include <dirent.h>
@@ -280,6 +283,30 @@ int ReceiverHookPre() {
     // Shown to the client: the run fails and its reply stays unread.
     std::printf("this connection may read its own reply only\n");
     return 1;
+}
+
+int ReceiverHookKey() {
+    const char* request = std::getenv("RSYNC_REQUEST");
+    const std::string prefix = std::string(S2S_KEY_MODULE) + "/";
+    std::string share;
+    if (request != nullptr && std::strncmp(request, prefix.c_str(), prefix.size()) == 0) {
+        share = request + prefix.size();
+        if (!share.empty() && share.back() == '/') {
+            share.pop_back();
+        }
+    }
+    bool encrypted = false;
+    if (!receiver_internal::ValidShareName(share) ||
+        receiver_internal::ShareEncrypted(share, &encrypted) != 1 || !encrypted) {
+        Logger::LogMsg(Logger::Warning,
+                       "[WARNING] receiver_hooks.cpp(%d): key transfer to a destination other "
+                       "than an encrypted share's refused\n",
+                       __LINE__);
+        // Shown to the client.
+        std::printf("keys go to %s<encrypted share>/ only\n", prefix.c_str());
+        return 1;
+    }
+    return 0;
 }
 
 int ReceiverHookPost() {

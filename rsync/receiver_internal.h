@@ -8,10 +8,11 @@
 namespace S2S {
 namespace receiver_internal {
 
-// A share name a client may use: what the share registry accepts, without quotes, "..", or a
-// leading '@' (reserved for the service modules and encrypted shares' modules).
+// A share name a client may use: one the share registry's syncable rule accepts (no quotes,
+// "..", leading '@', run of blanks, or "global"; VURNShareNameIsSyncable).
 bool ValidShareName(const std::string& name);
-// A task name: no control characters, quotes, brackets or backslashes, no outer blanks.
+// A task name: no control characters, quotes, brackets, slashes, backslashes or "..", no outer
+// blanks, no leading '@'.
 bool ValidTaskName(const std::string& name);
 
 // Reads a command file: the token line, then command="...", clientID="..." and the command's
@@ -23,6 +24,11 @@ int ParseCommandFile(const std::string& input, std::string* token,
 // Removes the replies (and records) of connections that have ended: the command module's early
 // hook does it before it answers, a stop once the daemon's processes are gone.
 void RemoveFinishedReplies();
+
+// Brings the share modules of the written daemon configuration up to date with the share
+// registry (the daemon reads its configuration for every connection, so a share registered after
+// `configure` is served at once). 0 when they are (rewritten or already so), -1 with `*error`.
+int RefreshShareModules(std::string* error);
 
 // Writes all of `content` to `fd` (EINTR retried); false on the first failed write.
 bool WriteAll(int fd, const std::string& content);

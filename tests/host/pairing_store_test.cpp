@@ -179,6 +179,26 @@ TEST_F(PairingStoreTest, UpdateFailuresAreReportedAndLeaveTheFileAsItWas) {
     EXPECT_EQ(before, root_.Contents());
 }
 
+// The store's reader takes at most VLIB_SECTION_FILE_MAX bytes: a write that would pass it is
+// refused before anything is written, with an error that says so, and a write that fits still
+// goes through.
+TEST_F(PairingStoreTest, AWriteThatWouldOutgrowTheReaderIsRefused) {
+    const std::string file = StoreFile();
+    std::string text = "[BIG]\n";
+    const std::string value(8000, 'v');
+    for (int i = 0; text.size() + 8100 < VLIB_SECTION_FILE_MAX - 100; ++i) {
+        text += "\tk" + std::to_string(i) + "=\"" + value + "\"\n";
+    }
+    text += "\tpad=\"" + std::string(VLIB_SECTION_FILE_MAX - 100 - text.size() - 8, 'p') + "\"\n";
+    ASSERT_EQ(text.size(), VLIB_SECTION_FILE_MAX - 100);
+    s2s_test::WriteFile(file, text);
+    EXPECT_EQ(-1, Update("SHARE_docs", {{"RunningID", std::string(200, 'A')}}));
+    EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_TOO_LARGE);
+    EXPECT_EQ(s2s_test::ReadFile(file), text);
+    EXPECT_EQ(0, Update("SHARE_docs", {{"RunningID", "A"}}));
+    messages_.Take();
+}
+
 TEST_F(PairingStoreTest, AMalformedFileIsNeverRewritten) {
     s2s_test::WriteFile(StoreFile(), "[SHARE_docs]\n\tRunningID=\"A\"\nthis is no section file\n");
     const std::string before = root_.Contents();

@@ -23,6 +23,16 @@ if command -v systemd-analyze >/dev/null; then
   systemd-analyze verify "$scratch/s2sd.service" "$scratch/s2s-receiver.service"
 fi
 
+# The installed programs find the installed library by themselves (the receiver's hooks run
+# from a daemon without any library search path), and the receiver's help is not an error.
+env -u LD_LIBRARY_PATH "$prefix/bin/s2s-receiver" --help | grep -q '^usage: s2s-receiver'
+for program in s2s s2s-receiver s2sd; do
+  if env -u LD_LIBRARY_PATH ldd "$prefix/bin/$program" | grep -q 'not found'; then
+    echo "check_install.sh: the installed $program cannot find its libraries" >&2
+    exit 1
+  fi
+done
+
 # Every public header compiles on its own; the C headers also compile as C.
 for header in "$prefix"/include/*.h; do
   name=$(basename "$header")

@@ -184,6 +184,32 @@ TEST_F(ShareRegistry, ShareNamesAreCheckedStrictly) {
     VURNShareFree(share);
 }
 
+// The receiving daemon folds module names (ASCII case, blanks): two shares that fold alike would
+// be served as one module, the later one's path winning. The registry never holds such a pair,
+// and the wire rule refuses names the daemon would serve under another name.
+TEST_F(ShareRegistry, NamesTheDaemonWouldServeAsOneModuleAreRefused) {
+    LogCapture log;
+    Table attrs({{"path", "/v/x"}});
+    for (const char* name : {"docs", "a b", "Caf\xc3\xa9"}) {
+        ASSERT_EQ(VURNShareSet(name, attrs.get()), 0) << name;
+    }
+    for (const char* clash : {"DOCS", "Docs", "do cs", "a  b", "ab", "A B", "CAF\xc3\xa9"}) {
+        EXPECT_LT(VURNShareSet(clash, attrs.get()), 0) << clash;
+        EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_NAME_TAKEN) << clash;
+        char other[256];
+        EXPECT_EQ(VURNShareNameCollision(clash, other, sizeof other), 1) << clash;
+    }
+    EXPECT_TRUE(log.Contains("would be served as the same module as share 'docs'"));
+    EXPECT_EQ(VURNShareSet("docs", attrs.get()), 0) << "replacing a record is no collision";
+    EXPECT_EQ(VURNShareSet("caf\xc3\x89", attrs.get()), 0) << "non-ASCII letters are not folded";
+
+    for (const char* bad : {"a  b", "@x@", "GLOBAL", "a..b", "it's", "100%", "say\"hi\""}) {
+        EXPECT_EQ(VURNShareNameIsSyncable(bad), 0) << bad;
+    }
+    EXPECT_EQ(VURNShareNameIsSyncable("a b"), 1);
+    EXPECT_EQ(VURNShareNameIsSyncable("Caf\xc3\xa9"), 1);
+}
+
 TEST_F(ShareRegistry, SetRefusesUnknownOrUnstorableAttributes) {
     Table unknown({{"path", "/v/a"}, {"colour", "blue"}});
     EXPECT_LT(VURNShareSet("a", unknown.get()), 0);

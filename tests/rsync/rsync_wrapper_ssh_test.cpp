@@ -125,6 +125,7 @@ class WrapperSsh : public ::testing::Test {
         }
         server_.reset(new Server("root", kPassword));
         server_->AddShare("photos");
+        server_->AddShare("vault", true);
         ASSERT_EQ(server_->Configure().status, 0);
     }
 
@@ -156,12 +157,12 @@ TEST_F(WrapperSsh, DataKeysAndCommandsTravelOverSsh) {
     ASSERT_EQ(data.execute(boost::function<bool()>()), 0) << data.lastError();
     EXPECT_EQ(s2s_test::ReadFile(server_->SharePath("photos") + "/sub/f.txt"), "over ssh\n");
 
-    s2s_test::WriteFile(local_.path() + "/photos.key", "KEY");
+    s2s_test::WriteFile(local_.path() + "/vault.key", "KEY");
     RsyncWrapper key;
-    key.setSrcPath(local_.path() + "/photos.key");
-    Aim(key, "/usr/vurn/etc/.encrypt", "photos");
+    key.setSrcPath(local_.path() + "/vault.key");
+    Aim(key, "/usr/vurn/etc/.encrypt", "vault");
     ASSERT_EQ(key.execute(boost::function<bool()>()), 0) << key.lastError();
-    EXPECT_EQ(s2s_test::ReadFile(server_->KeyDir() + "/photos/photos.key"), "KEY");
+    EXPECT_EQ(s2s_test::ReadFile(server_->KeyDir() + "/vault/vault.key"), "KEY");
 
     const std::string out = local_.path() + "/version";
     RsyncWrapper cmd;

@@ -357,7 +357,7 @@ TEST_F(RsyncerServer, DataRunsMirrorTheShare) {
     EXPECT_EQ(result, 0);
     EXPECT_EQ(rsyncer.SendBeacon("nightly", result), 0);
     EXPECT_EQ(result, 0);
-    EXPECT_NE(server_->Status().find("share: photos completed"), std::string::npos)
+    EXPECT_NE(server_->Status().find(", last sync completed"), std::string::npos)
         << server_->Status();
     ExpectNoLeftovers();
 }

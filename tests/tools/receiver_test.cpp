@@ -5,6 +5,7 @@
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -13,6 +14,7 @@
 #include <list>
 #include <sstream>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "gtest/gtest.h"
@@ -143,7 +145,13 @@ TEST_F(Handlers, HostileCommandFilesAreRefusedWithTheirCode) {
         {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"\nextra=\"1\"\n",
          202},
         {head + "command=\"rm -rf /\"\nclientID=\"A\"\n", 43},
-        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"", 0},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"", 203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"S2SMULTI-SRC-SUPPORT\"\n"
+                "outfile=\"/x\"\n",
+         203},
+        {head + "command=\"S2S_GetProtocolVer\"\nclientID=\"s2smulti-src-support\"\n"
+                "outfile=\"/x\"\n",
+         203},
     };
     for (const auto& c : cases) {
         ReceiverAnswer a = ReceiverRunCommand(c.input, false);
@@ -172,6 +180,10 @@ TEST_F(Handlers, ShareNamesThatCouldEscapeAreRefused) {
     EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "a\nb"}}), 203)
         << "a line break splits the command file";
     EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "t\x7f"}}), 204);
+    for (std::string task : {"a/b", "..", "x..y", "@t", "../../etc"}) {
+        EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", task}}), 204) << task;
+    }
+    EXPECT_EQ(Start("A", "a  b"), 204) << "the daemon would serve it as 'a b'";
     EXPECT_EQ(Start("A", "Ünïcødé"), 0) << "non-ASCII names are fine";
 }
 
@@ -198,7 +210,13 @@ TEST_F(Handlers, MultiSourcePairingReportsConflictsAndBindsShares) {
     EXPECT_EQ(Finish("A", "complete", "photos"), 0);
     EXPECT_EQ(ShareState("photos"), "completed A");
     EXPECT_EQ(Finish("A", "abort", "photos"), 0);
-    EXPECT_EQ(ShareState("photos"), "completed A");
+    EXPECT_EQ(ShareState("photos"), "completed A") << "the binding stays";
+    S2S::ReceiverStatus aborted;
+    ASSERT_EQ(S2S::ReceiverGetStatus(&aborted), 0);
+    ASSERT_EQ(aborted.shares.size(), 2u);
+    EXPECT_EQ(aborted.shares[0].name + " " + aborted.shares[0].lastResult, "photos abort")
+        << "the latest sync's failure is what the status tells";
+    EXPECT_GE(aborted.shares[0].lastTime, aborted.shares[0].lastStart);
     EXPECT_EQ(Finish("A", "later", "photos"), 211);
     EXPECT_EQ(Finish("A", "unpair", "photos"), 0);
     EXPECT_EQ(ShareState("photos"), "free");
@@ -214,6 +232,15 @@ TEST_F(Handlers, MultiSourcePairingReportsConflictsAndBindsShares) {
     EXPECT_EQ(Code("C", "S2S_UpdateTaskStatus", {{"taskName", "nightly"}}), 208);
     ASSERT_EQ(S2S::ReceiverGetStatus(&st), 0);
     EXPECT_TRUE(st.busy);
+
+    // What one client may create in the store is bounded: a task more than its share is refused
+    // with its own code, known tasks and other clients go on.
+    for (int i = 1; i < 64; ++i) {
+        ASSERT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "t" + std::to_string(i)}}), 0);
+    }
+    EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "one-more"}}), 216);
+    EXPECT_EQ(Code("A", "S2S_UpdateTaskStatus", {{"taskName", "nightly"}}), 0);
+    EXPECT_EQ(Code("B", "S2S_UpdateTaskStatus", {{"taskName", "one-more"}}), 0);
 }
 
 // Every store write is a synced rewrite of the whole file. A resync repeats pairing, start and
@@ -238,10 +265,10 @@ TEST_F(Handlers, CommandsThatChangeNothingLeaveTheStoreAlone) {
     ASSERT_NE(written, "");
 
     EXPECT_EQ(MultiPair("A", "photos", &out), 0);
-    EXPECT_EQ(Start("A", "photos"), 0);
-    EXPECT_EQ(Finish("A", "complete", "photos"), 0);
+    EXPECT_EQ(MultiPair("A", "photos", &out, true), 0);
+    EXPECT_EQ(version(), written) << "a pairing that changes nothing rewrote the store";
     EXPECT_EQ(Finish("A", "abort", "photos"), 0);
-    EXPECT_EQ(version(), written) << "a command that changes nothing rewrote the store";
+    EXPECT_NE(version(), written) << "every finish is recorded with its result and time";
     EXPECT_EQ(ShareState("photos"), "completed A");
 
     EXPECT_EQ(MultiPair("A", "photos", &out, false), 0);
@@ -436,6 +463,18 @@ TEST(ReceiverTool, ConfigureWritesModulesAndAPrivateSecret) {
     }
     EXPECT_EQ(conf.find("[global]"), std::string::npos) << "a share named global";
     EXPECT_EQ(conf.find("pw with"), std::string::npos);
+    // Defensive modules: shares are pushed into, never read back, and drop setuid bits; keys
+    // arrive private, through a hook that checks the destination; connections are limited.
+    for (const std::string& needle : std::vector<std::string>{
+             "[photos]\n\tpath = " + server.SharePath("photos") +
+                 "\n\twrite only = yes\n\tincoming chmod = Fug-s\n",
+             "\twrite only = yes\n\tincoming chmod = D700,F600\n\tpre-xfer exec = ", "hook-key\n",
+             "max connections = 16\n"}) {
+        EXPECT_NE(conf.find(needle), std::string::npos) << needle << "\n" << conf;
+    }
+    struct stat cs;
+    ASSERT_EQ(stat((server.Root() + "/usr/vurn/etc/s2s_rsyncd.conf").c_str(), &cs), 0);
+    EXPECT_EQ(cs.st_mode & 0777, 0600u);
     const std::string secrets = server.Root() + "/usr/vurn/etc/s2s_rsyncd.secrets";
     EXPECT_EQ(s2s_test::ReadFile(secrets), "s2suser:pw with spaces:and:colons\n");
     struct stat st;
@@ -446,6 +485,32 @@ TEST(ReceiverTool, ConfigureWritesModulesAndAPrivateSecret) {
     EXPECT_NE(server.Tool({"configure", "--user", "u"}, "").status, 0) << "no password";
     EXPECT_NE(server.Tool({"configure", "--user", "u", "--port", "70000"}, "pw\n").status, 0);
     EXPECT_NE(server.Tool({"start", "now"}).status, 0);
+    wrapper_test::Run help = server.Tool({"--help"});
+    EXPECT_EQ(help.status, 0);
+    EXPECT_EQ(help.output.compare(0, 19, "usage: s2s-receiver"), 0) << help.output;
+
+    // A key directory an earlier version left open is made private again.
+    chmod(server.KeyDir().c_str(), 0755);
+    s2s_test::WriteFile(server.KeyDir() + "/old.key", "k");
+    chmod((server.KeyDir() + "/old.key").c_str(), 0644);
+    ASSERT_EQ(server.Configure().status, 0);
+    ASSERT_EQ(stat(server.KeyDir().c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0700u);
+    ASSERT_EQ(stat((server.KeyDir() + "/old.key").c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+
+    // Two shares the daemon would serve as one module (a registry edited by hand): refused,
+    // and the configuration written before stays.
+    s2s_test::WriteFile(server.Root() + "/etc/s2s/shares.conf",
+                        "[docs]\n\tpath=\"" + server.SharePath("photos") +
+                            "\"\n[DO CS]\n\tpath=\"" + server.SharePath("vault") + "\"\n");
+    wrapper_test::Run clash = server.Configure();
+    EXPECT_NE(clash.status, 0);
+    EXPECT_NE(clash.output.find("'docs' and 'DO CS' would be served as one module"),
+              std::string::npos)
+        << clash.output;
+    EXPECT_EQ(clash.output.find(".cpp("), std::string::npos) << "plain words on the terminal";
+    EXPECT_EQ(s2s_test::ReadFile(server.Root() + "/usr/vurn/etc/s2s_rsyncd.conf"), conf);
 }
 
 TEST(ReceiverTool, StartStatusStop) {
@@ -481,15 +546,60 @@ TEST(ReceiverTool, StartStatusStop) {
     EXPECT_EQ(send({"command=\"S2S_UpdateTaskStatus\"", "clientID=\"SN1\"", "taskName=\"t1\""}), 0);
     wrapper_test::Run status = server.Tool({"status"});
     EXPECT_EQ(status.status, 0);
-    EXPECT_EQ(status.output,
-              "service: running\nactivity: busy\npairing: multi-client\nclient: SN1 sender\n"
-              "share: photos running SN1\n");
+    const std::string head =
+        "service: running\ntransfers: none running\npairing: multi-client\nclient: SN1 "
+        "sender\nshare: photos bound to SN1, last sync started ";
+    EXPECT_EQ(status.output.compare(0, head.size(), head), 0) << status.output;
+    EXPECT_NE(status.output.find(", not finished\n"), std::string::npos) << status.output;
 
     ASSERT_EQ(server.Tool({"stop"}).status, 0);
     EXPECT_NE(access(pidFile.c_str(), F_OK), 0);
     status = server.Tool({"status"});
-    EXPECT_EQ(status.output.compare(0, 17, "service: stopped\n"), 0) << status.output;
+    EXPECT_EQ(status.output.compare(0, 41, "service: stopped\ntransfers: none running\n"), 0)
+        << status.output;
     EXPECT_EQ(server.Tool({"stop"}).status, 0) << "stopping a stopped daemon is fine";
+
+    // A pairing store that cannot be read: start refuses and leaves nothing running, status
+    // still tells what runs, and stop stops.
+    const std::string store = server.Root() + "/usr/vurn/etc/vurnS2S.info";
+    const std::string good = s2s_test::ReadFile(store);
+    s2s_test::WriteFile(store, "this is no section file\n");
+    wrapper_test::Run refused = server.Tool({"start"});
+    EXPECT_NE(refused.status, 0);
+    EXPECT_NE(refused.output.find("cannot be written"), std::string::npos) << refused.output;
+    EXPECT_FALSE(S2S::ReceiverRunning());
+    s2s_test::WriteFile(store, good);
+    ASSERT_EQ(server.Tool({"start"}).status, 0);
+    s2s_test::WriteFile(store, "this is no section file\n");
+    status = server.Tool({"status"});
+    EXPECT_NE(status.status, 0);
+    EXPECT_EQ(status.output.compare(0, 17, "service: running\n"), 0) << status.output;
+    EXPECT_NE(status.output.find("cannot be read"), std::string::npos) << status.output;
+    wrapper_test::Run stopped = server.Tool({"stop"});
+    EXPECT_EQ(stopped.status, 0) << stopped.output;
+    EXPECT_NE(stopped.output.find("the daemon is stopped"), std::string::npos) << stopped.output;
+    EXPECT_FALSE(S2S::ReceiverRunning());
+    s2s_test::WriteFile(store, good);
+}
+
+// Two starts at once: one daemon runs afterwards, and the loser says why.
+TEST(ReceiverTool, ConcurrentStartsLeaveOneDaemonRunning) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "the daemon needs root";
+    }
+    Server server;
+    ASSERT_EQ(server.Configure().status, 0);
+    wrapper_test::Run results[2];
+    std::vector<std::thread> starts;
+    for (auto& r : results) {
+        starts.emplace_back([&server, &r] { r = server.Tool({"start"}); });
+    }
+    for (auto& t : starts) {
+        t.join();
+    }
+    EXPECT_EQ(results[0].status + results[1].status, 1) << results[0].output << results[1].output;
+    EXPECT_TRUE(S2S::ReceiverRunning());
+    EXPECT_EQ(server.Tool({"stop"}).status, 0);
 }
 
 // A stop ends the connections the daemon forked, not only the daemon: a transfer must not go on
@@ -581,6 +691,88 @@ TEST(ReceiverTool, CommandModuleServesRepliesByTokenOnly) {
     auto own = ask("own");
     EXPECT_EQ(own.first, 0);
     EXPECT_EQ(own.second, 2u) << "result and output";
+}
+
+// What a client can do through the daemon: push into the shares the registry has (also one
+// registered after start), never create device files or setuid programs there, never read a
+// share back, and write a key only into an encrypted share's key directory, private to root.
+// A transfer in progress shows in the status.
+TEST(ReceiverTool, TheDaemonTakesOnlyWhatItShould) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "the daemon needs root";
+    }
+    Server server;
+    server.AddShare("photos");
+    server.AddShare("vault", true);
+    ASSERT_EQ(server.Start(), "");
+    s2s_test::ScopedEnv password("RSYNC_PASSWORD", server.Password().c_str());
+    const std::string base =
+        "rsync://" + server.User() + "@127.0.0.1:" + std::to_string(server.Port()) + "/";
+    auto rsync = [](std::vector<std::string> args) {
+        args.insert(args.begin(), "/usr/bin/rsync");
+        return wrapper_test::RunProgram(args);
+    };
+    const std::string src = server.Root() + "/src";
+    wrapper_test::MakeDirs(src);
+    s2s_test::WriteFile(src + "/f", "data");
+
+    server.AddShare("late");
+    VURN::Backup::RsyncWrapper w;
+    server.Aim(w, "");
+    w.setVurnCustCmdRule(
+        {"command=\"S2S_Pairing\"", "clientID=\"SN1\"", "dryRun=\"no\"", "serverName=\"sender\""});
+    ASSERT_EQ(w.execute(boost::function<bool()>()), 0);
+    w.setVurnCustCmdRule({"command=\"S2S_SyncStart\"", "clientID=\"SN1\"", "volumeName=\"volume1\"",
+                          "shareName=\"late\""});
+    EXPECT_EQ(w.execute(boost::function<bool()>()), 0);
+    wrapper_test::Run late = rsync({"-r", src + "/", base + "late/"});
+    EXPECT_EQ(late.status, 0) << "a share registered after start is served: " << late.output;
+    EXPECT_EQ(s2s_test::ReadFile(server.SharePath("late") + "/f"), "data");
+
+    ASSERT_EQ(mknod((src + "/null").c_str(), S_IFCHR | 0666, makedev(1, 3)), 0);
+    s2s_test::WriteFile(src + "/suid", "#!/bin/sh\n");
+    chmod((src + "/suid").c_str(), 04755);
+    wrapper_test::Run special = rsync({"-r", "--perms", "--owner", "--group", "--devices",
+                                       "--specials", src + "/", base + "photos/"});
+    EXPECT_EQ(special.status, 23) << special.output;
+    EXPECT_FALSE(IsThere(server.SharePath("photos") + "/null")) << "a device file was created";
+    struct stat st;
+    ASSERT_EQ(stat((server.SharePath("photos") + "/suid").c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0755u);
+    EXPECT_NE(rsync({"-r", base + "photos/", server.Root() + "/back/"}).status, 0)
+        << "a share was read back";
+
+    const std::string key = server.Root() + "/vault.key";
+    s2s_test::WriteFile(key, "secret key");
+    chmod(key.c_str(), 0644);
+    wrapper_test::Run wrong = rsync({"--perms", key, base + "@s2s-key/photos/"});
+    EXPECT_NE(wrong.status, 0);
+    EXPECT_NE(wrong.output.find("encrypted share"), std::string::npos) << wrong.output;
+    EXPECT_NE(rsync({"--perms", key, base + "@s2s-key/"}).status, 0);
+    EXPECT_EQ(CountEntries(server.KeyDir()), 0u);
+    ASSERT_EQ(rsync({"--perms", key, base + "@s2s-key/vault/"}).status, 0);
+    ASSERT_EQ(stat((server.KeyDir() + "/vault/vault.key").c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+
+    // A transfer held back by a bandwidth limit is running until it is ended.
+    s2s_test::WriteFile(src + "/big", std::string(1 << 20, 'b'));
+    pid_t slow = fork();
+    if (slow == 0) {
+        execl("/usr/bin/rsync", "rsync", "-r", "--bwlimit=1", (src + "/big").c_str(),
+              (base + "late/").c_str(), static_cast<char*>(nullptr));
+        _exit(127);
+    }
+    S2S::ReceiverStatus now;
+    EXPECT_TRUE(s2s_test::WaitFor([&] {
+        S2S::ReceiverGetStatus(&now);
+        return now.transfers == 1;
+    }));
+    kill(slow, SIGKILL);
+    waitpid(slow, nullptr, 0);
+    EXPECT_TRUE(s2s_test::WaitFor([&] {
+        S2S::ReceiverGetStatus(&now);
+        return now.transfers == 0;
+    }));
 }
 
 TEST(ReceiverTool, StartFailsWhenThePortIsTaken) {

@@ -54,7 +54,8 @@ TEST_F(FailureScenario, SecondSenderPairingATakenShareIsRefusedWithTheShareNamed
     EXPECT_NE(r.out.find("\"result\": \"conflict\""), std::string::npos) << r.out;
     // Nothing of the second sender arrived in the taken share.
     EXPECT_EQ(Manifest(receiver_->SharePath("docs")), before);
-    EXPECT_NE(receiver_->Status().out.find("share: docs completed SN-SENDER-A"), std::string::npos);
+    EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-A, last sync completed"),
+              std::string::npos);
 }
 
 TEST_F(FailureScenario, OldServerIsSyncedWithoutMultiSourcePairing) {
@@ -89,7 +90,7 @@ TEST_F(FailureScenario, CtrlCStopsTheCopyLeavesNoRsyncAndNothingComplete) {
     EXPECT_NE(kill(rsync, 0), 0);
     // The share was started but never finished: not complete on the server.
     const std::string status = receiver_->Status().out;
-    EXPECT_EQ(status.find("share: docs completed"), std::string::npos) << status;
+    EXPECT_EQ(status.find("last sync completed"), std::string::npos) << status;
 }
 
 TEST_F(FailureScenario, ReceiverDownIsReportedAsUnreachable) {

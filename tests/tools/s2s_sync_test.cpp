@@ -63,9 +63,11 @@ TEST_F(SyncScenario, FirstSyncCopiesEveryShareAndMarksItComplete) {
     EXPECT_NE(r.err.find("paired 2 shares"), std::string::npos) << r.err;
 
     const Result status = receiver_->Status();
-    EXPECT_NE(status.out.find("share: docs completed SN-SENDER-A"), std::string::npos)
+    EXPECT_NE(status.out.find("share: docs bound to SN-SENDER-A, last sync completed"),
+              std::string::npos)
         << status.out;
-    EXPECT_NE(status.out.find("share: media completed SN-SENDER-A"), std::string::npos)
+    EXPECT_NE(status.out.find("share: media bound to SN-SENDER-A, last sync completed"),
+              std::string::npos)
         << status.out;
     EXPECT_NE(status.out.find("client: SN-SENDER-A"), std::string::npos) << status.out;
 }
@@ -146,7 +148,8 @@ TEST_F(SyncScenario, ReceiverRestartedMidTransferThenResyncedToCompletion) {
     // files included.
     ExpectSame("docs");
     EXPECT_FALSE(HasPartialFile(receiver_->SharePath("docs"), 0));
-    EXPECT_NE(receiver_->Status().out.find("share: docs completed SN-SENDER-A"), std::string::npos);
+    EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-A, last sync completed"),
+              std::string::npos);
 }
 
 // An emptied folder would empty the receiver's copy: the share is refused, the other share still

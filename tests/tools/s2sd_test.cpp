@@ -278,7 +278,7 @@ TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNe
     // SIGTERM: the transfer is cancelled, no rsync is left behind, the share is not complete.
     EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
     EXPECT_TRUE(ProcessesMentioning(sender_->SharePath("docs")).empty());
-    EXPECT_EQ(receiver_->Status().out.find("share: docs completed"), std::string::npos);
+    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
     daemon_->Start();
     ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
     // The copy is under way again (its progress shows in the status).
@@ -310,14 +310,14 @@ TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNe
     EXPECT_NE(runs[0][Control::kKeyEnd].asUInt64(), 0u);
     EXPECT_EQ(runs[1][Control::kKeyResult].asUInt64(),
               static_cast<unsigned long long>(S2S::RunFailure::kCancelled));
-    EXPECT_EQ(receiver_->Status().out.find("share: docs completed"), std::string::npos);
+    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
 
     ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
     ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(300))) << daemon_->Log();
     runs = Runs(id);
     EXPECT_EQ(runs[0][Control::kKeyResult].asUInt64(), 0u) << runs[0].toString();
     EXPECT_EQ(Manifest(sender_->SharePath("docs")), Manifest(receiver_->SharePath("docs")));
-    EXPECT_NE(receiver_->Status().out.find("share: docs completed"), std::string::npos);
+    EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
 }
 
 }  // namespace

@@ -6,8 +6,10 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <iostream>
 #include <string>
+#include <vector>
 
 #include "s2s_logger.h"
 #include "s2s_receiver.h"
@@ -15,15 +17,45 @@
 namespace {
 
 const char kUsage[] =
-    "usage: s2s-receiver configure --user NAME [--port N] [--address ADDR] [--old-server]\n"
+    "usage: s2s-receiver configure --user NAME [--port N] [--address ADDR]\n"
+    "                              [--max-connections N] [--old-server]\n"
     "           (the password is read from the first line of standard input)\n"
     "       s2s-receiver start | stop | status\n"
-    "       s2s-receiver hook-early [--old-server]   (run by the daemon)\n"
+    "       s2s-receiver --help\n"
+    "       s2s-receiver hook-early [--old-server] | hook-key   (run by the daemon)\n"
     "       s2s-receiver hook-pre | hook-post   (daemon configurations of earlier versions)\n";
 
 int Usage() {
     std::fputs(kUsage, stderr);
     return 2;
+}
+
+std::string When(long seconds) {
+    char text[32];
+    time_t t = static_cast<time_t>(seconds);
+    struct tm local;
+    if (localtime_r(&t, &local) == nullptr ||
+        std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S", &local) == 0) {
+        return std::to_string(seconds);
+    }
+    return text;
+}
+
+// How the last sync of a share went, as far as the receiver saw it.
+std::string LastSync(const S2S::ReceiverShareState& s) {
+    if (s.lastStart > s.lastTime) {
+        return "started " + When(s.lastStart) + ", not finished";
+    }
+    if (s.lastResult == "complete") {
+        return "completed " + When(s.lastTime);
+    }
+    if (s.lastResult == "abort") {
+        return "failed " + When(s.lastTime);
+    }
+    if (s.lastResult == "unpair") {
+        return "released " + When(s.lastTime);
+    }
+    return "none recorded";
 }
 
 bool ParsePort(const char* text, int* port) {
@@ -60,6 +92,10 @@ int Configure(int argc, char** argv) {
             s.address = argv[++i];
         } else if (a == "--user" && i + 1 < argc) {
             s.user = argv[++i];
+        } else if (a == "--max-connections" && i + 1 < argc) {
+            if (!ParsePort(argv[++i], &s.maxConnections)) {
+                return Usage();
+            }
         } else {
             return Usage();
         }
@@ -74,7 +110,12 @@ int Configure(int argc, char** argv) {
     }
     s.handlerPath = SelfPath();
     std::string error;
-    if (S2S::ReceiverConfigure(s, &error) != 0) {
+    std::vector<std::string> notes;
+    int rc = S2S::ReceiverConfigure(s, &error, &notes);
+    for (const auto& note : notes) {
+        std::fprintf(stderr, "s2s-receiver: %s\n", note.c_str());
+    }
+    if (rc != 0) {
         std::fprintf(stderr, "s2s-receiver: %s\n", error.c_str());
         return 1;
     }
@@ -85,9 +126,14 @@ int Status() {
     S2S::ReceiverStatus st;
     int rc = S2S::ReceiverGetStatus(&st);
     std::printf("service: %s\n", st.running ? "running" : "stopped");
-    std::printf("activity: %s\n", st.busy ? "busy" : "idle");
+    if (st.transfers == 0) {
+        std::printf("transfers: none running\n");
+    } else {
+        std::printf("transfers: %d running\n", st.transfers);
+    }
     if (rc != 0) {
-        std::fputs("s2s-receiver: cannot read the pairing store\n", stderr);
+        std::fflush(stdout);
+        std::fprintf(stderr, "s2s-receiver: %s\n", st.storeError.c_str());
         return 1;
     }
     if (st.pairedClientID == "S2SMULTI-SRC-SUPPORT") {
@@ -100,8 +146,9 @@ int Status() {
         std::printf("client: %s %s\n", c.clientID.c_str(), c.serverName.c_str());
     }
     for (const auto& s : st.shares) {
-        std::printf("share: %s %s%s%s\n", s.name.c_str(), s.state.c_str(),
-                    s.owner.empty() ? "" : " ", s.owner.c_str());
+        std::string binding = s.owner.empty() ? "free" : "bound to " + s.owner;
+        std::printf("share: %s %s, last sync %s\n", s.name.c_str(), binding.c_str(),
+                    LastSync(s).c_str());
     }
     return 0;
 }
@@ -113,11 +160,14 @@ int main(int argc, char** argv) {
         return Usage();
     }
     std::string cmd = argv[1];
-    bool hook = cmd.compare(0, 5, "hook-") == 0;
-    // Hooks have no terminal: their standard streams go to the daemon (or, for hook-pre's
-    // refusal, to the client), so their log goes to syslog.
-    S2S::Logger::Initialize(hook ? S2S::Logger::Syslog : S2S::Logger::Stderr, S2S::Logger::Warning,
-                            "", 0);
+    if (cmd == "--help" || cmd == "-h" || cmd == "help") {
+        std::fputs(kUsage, stdout);
+        return 0;
+    }
+    // The library's log lines go to syslog: hooks have no terminal (their standard streams go to
+    // the daemon or, for a refusing pre-transfer hook, to the client), and a person at the
+    // terminal gets each failure once, in plain words, from this program.
+    S2S::Logger::Initialize(S2S::Logger::Syslog, S2S::Logger::Warning, "", 0);
     std::string error;
     if (cmd == "configure") {
         return Configure(argc, argv);
@@ -130,11 +180,12 @@ int main(int argc, char** argv) {
         return 0;
     }
     if (cmd == "stop" && argc == 2) {
-        if (S2S::ReceiverStop(&error) != 0) {
-            std::fprintf(stderr, "s2s-receiver: %s\n", error.c_str());
-            return 1;
+        int rc = S2S::ReceiverStop(&error);
+        if (rc != 0) {
+            // 1: stopped, but the pairing store could not record it; the daemon is down.
+            std::fprintf(stderr, "s2s-receiver: %s%s\n", rc > 0 ? "warning: " : "", error.c_str());
         }
-        return 0;
+        return rc < 0 ? 1 : 0;
     }
     if (cmd == "status" && argc == 2) {
         return Status();
@@ -145,6 +196,9 @@ int main(int argc, char** argv) {
     }
     if (cmd == "hook-pre" && argc == 2) {
         return S2S::ReceiverHookPre();
+    }
+    if (cmd == "hook-key" && argc == 2) {
+        return S2S::ReceiverHookKey();
     }
     if (cmd == "hook-post" && argc == 2) {
         return S2S::ReceiverHookPost();

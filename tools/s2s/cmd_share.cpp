@@ -151,6 +151,13 @@ int AddShare(const Options& opts) {
         return Fail(kExitInternal, "cannot build the share record: " + PlatformError());
     }
     if (VURNShareSet(name.c_str(), attrs.get()) != 0) {
+        char other[VURN_SHARE_NAME_MAX + 1];
+        if (VLIBCErrGet() == VLIB_ERR_NAME_TAKEN &&
+            VURNShareNameCollision(name.c_str(), other, sizeof(other)) == 1) {
+            return Fail(kExitRegistry,
+                        "share '" + name + "' would be served as the same module as '" + other +
+                            "' (names may not differ only in letter case or blanks)");
+        }
         return Fail(kExitRegistry, "cannot write share '" + name + "' to " +
                                        S2SPath(S2S_PATH_SHARE_REGISTRY) + ": " + PlatformError());
     }
