@@ -45,7 +45,7 @@ const std::vector<OptionSpec> kSyncOptions = {
     {"block-level", "", false, "send only the changed blocks of changed files"},
     {"ssh", "", false, "reach the server over SSH"},
     {"ssh-port", "PORT", false, "the server's SSH port (also used for encryption keys)"},
-    {"max-bandwidth", "N", false, "the bandwidth limit handed to rsync (0: none)"},
+    {"max-bandwidth", "N", false, "limit each copy to N KiB per second (0: no limit)"},
     {"password-file", "FILE", false, "read the password from FILE (mode 600; - for stdin)"},
     {"exclude", "PATTERN", true, "leave out files matching an rsync exclude pattern"},
     {"json", "", false, "print a JSON summary on standard output (messages go to stderr)"},
@@ -124,6 +124,24 @@ class StopSignals {
     struct sigaction old_hup_ = {};
 };
 
+// rsync's own lines (or the library's local cause) as one line for a message: "" or ": a; b".
+std::string Because(const std::string& lines) {
+    std::string joined;
+    size_t start = 0;
+    while (start < lines.size()) {
+        size_t end = lines.find('\n', start);
+        if (end == std::string::npos) {
+            end = lines.size();
+        }
+        const std::string line = lines.substr(start, end - start);
+        if (line.find_first_not_of(" \t") != std::string::npos) {
+            joined += (joined.empty() ? "" : "; ") + line;
+        }
+        start = end + 1;
+    }
+    return joined.empty() ? joined : ": " + joined;
+}
+
 double SecondsSince(Clock::time_point start) {
     return std::chrono::duration<double>(Clock::now() - start).count();
 }
@@ -159,6 +177,7 @@ struct ShareReport {
     int result = 0;
     std::string step;  // the step that failed: start, copy, key, finish
     std::string message;
+    std::string rsync_errors;  // what rsync itself said about the failed step
 };
 
 class SyncRun {
@@ -220,19 +239,27 @@ int SyncRun::Connect() {
             : info.GetServerIP() +
                   (info.GetServerName().empty() ? "" : " (" + info.GetServerName() + ")");
     Say("connecting to %s as %s\n", target.c_str(), info.GetUser().c_str());
-    const int rc = rsyncer_.Initialize(info);
+    const int rc = rsyncer_.Connect(info);
     if (g_stop_signal != 0) {
         return Finish(kExitCancelled, "stopped before the server answered");
     }
     if (rc == S2S::kRsyncResultNoAddress) {
         return Finish(kExitUnreachable, "no address found for server " + target);
     }
+    if (rc == S2S::kRsyncResultNoVersion) {
+        // Never taken for an old server: pairing would then skip the multi-source check.
+        const int why = rsyncer_.GetServerVersionResult();
+        return Finish(why == 1 || why == 11 ? kExitInternal : ClassifyCommandResult(why),
+                      "the server answered, but its protocol version could not be read (" +
+                          ResultName(why) + ")" + Because(rsyncer_.GetLastError()));
+    }
     if (rc != 0) {
         const ExitCode code = ClassifyConnectResult(rc);
         std::string why = code == kExitAuth
                               ? "the server refused user '" + info.GetUser() + "' or its password"
                               : "the server did not answer";
-        return Finish(code, why + ": " + ResultName(rc) + ", " + ResultMeaning(rc));
+        return Finish(code, why + ": " + ResultName(rc) + ", " + ResultMeaning(rc) +
+                                Because(rsyncer_.GetLastError()));
     }
     const int version = rsyncer_.GetServerVersionValue();
     Say("server %s answers: %s\n", rsyncer_.GetSyncInfo().GetServerIP().c_str(),
@@ -258,7 +285,8 @@ int SyncRun::Pair() {
             return Finish(ClassifyCommandResult(result),
                           "the server refused the pairing: " + ResultName(result));
         }
-        return Finish(kExitInternal, "the pairing request could not be sent (see the log above)");
+        return Finish(kExitInternal,
+                      "the pairing request could not be sent" + Because(rsyncer_.GetLastError()));
     }
     if (result == S2S::kRsyncResultConflict || !conflicts.empty()) {
         std::string names;
@@ -360,8 +388,10 @@ void SyncRun::SyncShare(ShareReport& share) {
         share.state = "failed";
         share.step = "copy";
         share.result = result;
+        share.rsync_errors = rsyncer_.GetLastError();
         share.message = "copying share '" + share.name + "' failed: " + ResultName(result) + ", " +
-                        ResultMeaning(result) + "; it is not marked complete";
+                        ResultMeaning(result) + Because(share.rsync_errors) +
+                        "; it is not marked complete";
         Finish(rc != 0 ? kExitInternal : ClassifyTransferResult(result), share.message);
         return;
     }
@@ -382,8 +412,10 @@ void SyncRun::SyncShare(ShareReport& share) {
             share.state = "failed";
             share.step = "key";
             share.result = key;
+            share.rsync_errors = rsyncer_.GetLastError();
             share.message = "sending the key of share '" + share.name +
-                            "' failed: " + ResultName(key) + ", " + ResultMeaning(key);
+                            "' failed: " + ResultName(key) + ", " + ResultMeaning(key) +
+                            Because(share.rsync_errors);
             Finish(kExitKeySync, share.message);
             return;
         }
@@ -466,7 +498,8 @@ int SyncRun::Run(S2S::SyncTask& task) {
                    "the server did not take the task's status: " + ResultName(result));
         }
     } else if (g_stop_signal == 0) {
-        Finish(kExitInternal, "the task's status could not be sent (see the log above)");
+        Finish(kExitInternal,
+               "the task's status could not be sent" + Because(rsyncer_.GetLastError()));
     }
     if (g_stop_signal != 0) {
         return Finish(kExitCancelled, "stopped while reporting the task's status");
@@ -491,6 +524,17 @@ nlohmann::json SyncRun::Summary() const {
         }
         if (!share.message.empty()) {
             entry["message"] = share.message;
+        }
+        if (!share.rsync_errors.empty()) {
+            nlohmann::json lines = nlohmann::json::array();
+            size_t start = 0;
+            while (start < share.rsync_errors.size()) {
+                size_t end = share.rsync_errors.find('\n', start);
+                end = end == std::string::npos ? share.rsync_errors.size() : end;
+                lines.push_back(share.rsync_errors.substr(start, end - start));
+                start = end + 1;
+            }
+            entry["rsync_errors"] = lines;
         }
         if (share.state == "synced") {
             files += share.size.files;
@@ -633,6 +677,15 @@ int RunSyncCommand(const Args& args) {
         task.SetInfo(info);
     }
     std::fill(password.begin(), password.end(), '\0');
+    const S2S::SyncInfo& credentials = task.GetInfo().GetSyncInfo();
+    if (!VURN::Backup::RsyncWrapper::credentialsFit(credentials.GetUser(),
+                                                    credentials.GetPassword())) {
+        return Fail(kExitPassword,
+                    "the password is too long: rsync cannot authenticate user name and password "
+                    "of more than " +
+                        std::to_string(VURN::Backup::RsyncWrapper::kMaxSecretLine) +
+                        " bytes together (with the ':' between them)");
+    }
 
     // The first broken rule is logged as a NOTE line; a person needs to see it here. The two rules
     // whose note has no line end are checked first with a message of our own.

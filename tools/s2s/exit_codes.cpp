@@ -59,6 +59,7 @@ const ResultInfo kResultTable[] = {
     {35, "connect-timeout", "the server's rsync daemon did not answer in time"},
     {42, "no-address", "no address of the server could be looked up"},
     {43, "unknown-command", "the server does not know the command (an old server)"},
+    {44, "no-version", "the server answered, but its protocol version could not be read"},
     {51, "unknown-command", "the server does not know the command (an old server)"},
     {201, "missing-key", "the server found a required key missing"},
     {202, "attributes-refused", "the server does not accept share attributes"},
