@@ -172,8 +172,8 @@ field() { sed -n "s/^  \"$2\": \([0-9.]*\),\{0,1\}$/\1/p" "$1"; }
 run_sync() {  # label
   echo "== $1: s2s sync --task task.json --password-file password"
   local status=0
-  S2S_ROOT=$sender S2S_REMOTE_ROOT=$receiver "$bin/s2s" sync --task "$task" --password-file "$password_file" --json \
-    >"$work/$1.json" || status=$?
+  S2S_ROOT=$sender S2S_REMOTE_ROOT=$receiver "$bin/s2s" sync --task "$task" \
+    --password-file "$password_file" --json >"$work/$1.json" || status=$?
   if [ "$status" -ne 0 ]; then
     echo "demo: $1 failed with exit code $status" >&2
     cat "$work/$1.json" >&2
