@@ -42,7 +42,7 @@ cleanup() {
 trap cleanup EXIT
 
 for root in "$sender" "$receiver"; do
-  mkdir -p "$root/etc/s2s" "$root/tmp/S2S" "$root/volume1"
+  mkdir -p "$root/etc/s2s" "$root/volume1"  # tmp/S2S is made (private) at first use
   printf '[host]\n\tserial="SN-BENCH-%s"\n[volumes]\n\t%s="internal,directory"\n' "$(basename "$root")" \
     "$root/volume1" >"$root/etc/s2s/host.conf"
 done

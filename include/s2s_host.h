@@ -48,9 +48,17 @@ class S2S_EXPORT LockFactory {
     std::string path;
 };
 
-// A fresh empty file "/tmp/S2S/temp.XXXXXX" (under $S2S_ROOT when set) reserving a unique name;
-// "" when it cannot be made (the directory is created at service start, not here).
+// A fresh empty file "/tmp/S2S/temp.XXXXXX" (under $S2S_ROOT when set) reserving a unique name,
+// created with O_EXCL|O_NOFOLLOW; "" when it cannot be made. The server writes command output
+// into these files, so the directory is checked before every use: it is created at first use
+// (mode 0700, missing parents 0755) and refused when it is not a real directory owned by this
+// program's user (root on a server) or when its group or other users have any access. This
+// departs on purpose from the older rule (the directory made elsewhere and trusted as found,
+// failures silent): a directory another user can write let that user redirect the output onto
+// any file. A refusal is logged as one ERROR line saying what is wrong and what to do.
 S2S_EXPORT std::string GetTempFile();
+// The same without logging; on failure `error` says why in words, for the caller to report.
+S2S_EXPORT std::string GetTempFile(std::string& error);
 // Deletes a file from GetTempFile. An empty path does nothing.
 S2S_EXPORT void PutTempFile(const std::string& path);
 

@@ -328,7 +328,9 @@ S2S_EXPORT int VURNShareNameCollision(const char* name, char* buf, int size);
  * ------------------------------------------------------------------------------------------- */
 /* The machine serial number into buf (at most size-1 bytes; a longer serial is cut): host.conf's
  * serial, else the DMI product serial (S2S_PATH_DMI_SERIAL) when readable and not a placeholder,
- * else "" (no serial). 0, or negative on bad arguments or an unreadable host file (buf ""). */
+ * else "" (no serial). Serials name the machine towards servers: every byte other than an ASCII
+ * letter, digit, '-', '_', '.' or ':' (blanks in virtual machines' serials) is given as '-'. 0, or
+ * negative on bad arguments or an unreadable host file (buf ""). */
 S2S_EXPORT int VLIBGetSerialNumber(char* buf, int size);
 /* 1 when host.conf says ha=yes, else 0 (also when it cannot be read: logged). */
 S2S_EXPORT int VURNHAIsRunning(void);

@@ -32,9 +32,10 @@
 // module, 10 server unreachable, 30/35 time-outs, 23 partial transfer, ...); the server's result
 // code for a command; 51 when the server has no command module (a server that knows no custom
 // commands); 20 when the run was cancelled through the predicate; 1 when the settings are
-// incomplete or malformed; 11 when a local file (temporary directory, command file, output file)
-// could not be handled; 12 when a command's reply is malformed; 14 when rsync could not be
-// started.
+// incomplete or malformed (also: a user name and password rsync cannot authenticate, see
+// credentialsFit); 11 when a local file (temporary directory, command file, output file, which is
+// never written through a symbolic link) could not be handled; 12 when a command's reply is
+// malformed; 14 when rsync could not be started.
 //
 // Pointing a wrapper at a test daemon started by s2s-receiver on 127.0.0.1:<port>:
 //   w.setPort(port); w.setDestPath("127.0.0.1", user, password, "<share>", "");
@@ -43,6 +44,7 @@
 #define S2S_RSYNC_WRAPPER_H
 
 #include <boost/function.hpp>
+#include <cstddef>
 #include <list>
 #include <memory>
 #include <string>
@@ -63,6 +65,14 @@ class S2S_EXPORT RsyncWrapper {
         kResultCancelled = 20,   // the cancel predicate returned true
         kResultNoCommands = 51,  // the server has no command module
     };
+
+    // rsync's daemon reads its secrets file in lines of at most 1023 bytes ("user:password"
+    // without the line end): a longer pair can never authenticate, over the daemon port or SSH.
+    static constexpr size_t kMaxSecretLine = 1023;
+    // False when `user` and `password` cannot authenticate for that reason (with a one-letter user
+    // name: a password of 1022 bytes or more). execute() refuses such settings with 1; programs
+    // that take a password refuse it at once with this test.
+    static bool credentialsFit(const std::string& user, const std::string& password);
 
     RsyncWrapper();
     virtual ~RsyncWrapper();
@@ -98,11 +108,18 @@ class S2S_EXPORT RsyncWrapper {
     // Maps an absolute server directory used as a destination to the daemon module serving it.
     void setServerPathModule(std::string serverPath, std::string module);
     // Where the debug log goes when setDebugLog(true) (default "/var/log/s2s_rsync.log" below
-    // $S2S_ROOT).
+    // $S2S_ROOT). Before a run that writes it, a log of kLogRotateBytes or more is rotated: it
+    // becomes "<log>.1", the older ones move up to "<log>.<kLogKeep>", and the oldest is dropped.
     void setLogFile(std::string path);
+    static constexpr long long kLogRotateBytes = 8LL << 20;
+    static constexpr int kLogKeep = 3;
+    // Data runs: rsync's --bwlimit, in KiB (1024 bytes) per second; 0 (the default) is unlimited.
+    void setBandwidthLimit(unsigned kibPerSecond);
     // Over ssh: the server's daemon configuration that the one-shot daemon reads (default
-    // "/usr/vurn/etc/s2s_rsyncd.conf" below the local $S2S_ROOT, which is the server's path when
-    // S2S_ROOT is unset on both ends). Only [A-Za-z0-9._/-] characters are accepted.
+    // "/usr/vurn/etc/s2s_rsyncd.conf" on the server). The local $S2S_ROOT says nothing about
+    // the server's paths and is not applied; $S2S_REMOTE_ROOT, when set, stands for the server's
+    // root (both servers on one machine: tests, the demo). Only [A-Za-z0-9._/-] characters are
+    // accepted.
     void setRemoteConfig(std::string path);
     // Over ssh: the known-hosts file to check and record the server's key in (default: ssh's
     // own). Unknown hosts are accepted and recorded on first contact.

@@ -27,6 +27,7 @@ enum RsyncResult : int {
     kRsyncResultOK = 0,
     kRsyncResultNoAddress = 42,      // TestServer: the server's addresses could not be looked up
     kRsyncResultUnknownCmd = 43,     // old server: the command is unknown
+    kRsyncResultNoVersion = 44,      // Connect: the server answered, its version query failed
     kRsyncResultUnknownCmdAlt = 51,  // old server, second form of the same answer
     kRsyncResultRetryPlain = 202,    // S2S_SyncStart: attribute keys refused, send without them
     kRsyncResultDryRunOK = 207,      // dry-run pairing answer that still proves a connection
@@ -80,8 +81,17 @@ class S2S_EXPORT Rsyncer {
     Rsyncer& operator=(const Rsyncer&) = delete;
 
     // Copies `info` and looks for a reachable server address and its protocol version:
-    // TestServer's result (0 when found).
+    // TestServer's result (0 when found). Kept as it always was: when the connection test passed
+    // but the version query then failed, this is still 0 and the version stays -1, which reads as
+    // a server without multi-source pairing; use Connect.
     int Initialize(const SyncInfo& info);
+    // What our programs call instead of Initialize: the same, except that a failed version query
+    // is a failure. 0 only when the server's protocol version is known (an old server's 0
+    // included); TestServer's code when no address answered; kRsyncResultNoVersion when an address
+    // answered but the version could not be read (GetServerVersionResult says how it failed,
+    // GetLastError why). Pairing must not go on then: an unknown version would be taken for an
+    // old server and skip the multi-source conflict check.
+    int Connect(const SyncInfo& info);
     // Keeps everything: the share cache and the server version survive re-initialisation.
     void Clear();
     void SetCancelChecker(bool (*fn)()) { cancelChecker = fn; }
@@ -117,6 +127,15 @@ class S2S_EXPORT Rsyncer {
     // --- remote commands: 0 when the command was sent (its code in `result`), -1 when not ------
     void GetServerVersion();
     int GetServerVersionValue() const { return serverVersion; }
+    // How the last version query ended: 0 when it read a version (an old server's too); else
+    // the run's code, or the wrapper's 11 (no temporary output file here), 12 (no number in the
+    // reply) or 1 (no command could be built) for a failure of its own.
+    int GetServerVersionResult() const { return versionResult; }
+    // Why the last run or step failed, in words, for people: the error lines rsync printed in
+    // that run (at most 8, never the password; rsync's own text such as "No space left on
+    // device"), or the local cause when it failed before rsync ran (the temporary directory,
+    // for instance). "" when there is nothing to say.
+    std::string GetLastError() const { return lastError; }
     bool SupportMultiSource() const { return serverVersion > 0; }
     int DoSinglePairing(bool dryRun, int& result) const;
     int DoMultiPairing(bool dryRun, const std::list<std::string>& shares,
@@ -134,7 +153,8 @@ class S2S_EXPORT Rsyncer {
     int StartSyncShare(const std::string& shareName, bool withAttributes, int& result);
     // Announces the share with its attributes, and again without them when the server asks (202).
     int StartSyncShare(const std::string& shareName, int& result);
-    // Pushes the whole share (relPath "/") or one path inside it (relPath starting with "/").
+    // Pushes the whole share (relPath "/") or one path inside it (relPath starting with "/"),
+    // at most at the task's bandwidth limit (SyncInfo::GetMaxBandwidth, KiB per second; 0 none).
     int RunSync(unsigned long long id, const std::string& shareName, const std::string& relPath,
                 const std::list<std::string>& excludes, int& result);
 
@@ -154,6 +174,8 @@ class S2S_EXPORT Rsyncer {
     void RunCommandLines(const std::list<std::string>& lines, bool isTest, int& result) const;
 
     int serverVersion;  // -1 unknown, 0 old server without multi-source support, >0 version
+    int versionResult;  // how the last version query ended (GetServerVersionResult)
+    mutable std::string lastError;  // GetLastError; const operations run rsync too
     bool (*cancelChecker)();
     SyncInfo syncInfo;
     std::map<std::string, ShareInfo> shareInfoCache;

@@ -60,6 +60,7 @@ struct ShareOutcome {
     int result = 0;       // the remote result code of the failed step
     std::string step;     // the step that failed: pairing, source-check, start, copy, key, finish
     std::string message;  // why, for a person
+    std::string rsync_errors;  // what rsync itself said about a failed copy or key step
     std::string guard;    // why the source check refused the share (SourceGuardResultName)
     long long would_delete = -1;  // what a refused run would have deleted on the receiver
 };

@@ -231,6 +231,16 @@ int VLIBGetSerialNumber(char* buf, int size) {
         if (serial.empty()) {
             serial = DmiSerial();
         }
+        // Serial numbers name this machine towards servers, which take letters, digits and
+        // "-_.:" only; firmware of virtual machines reports serials with blanks and other
+        // characters ("VMware-56 4d ..."). Each such byte becomes '-', so any serial gives an
+        // identity a server accepts, the same one every time.
+        for (char& c : serial) {
+            const unsigned char u = static_cast<unsigned char>(c);
+            if (!(std::isalnum(u) && u < 0x80) && c != '-' && c != '_' && c != '.' && c != ':') {
+                c = '-';
+            }
+        }
         // The caller's size is the limit: a longer serial number is cut, as callers expect.
         size_t n = std::min(serial.size(), static_cast<size_t>(size - 1));
         std::memcpy(buf, serial.data(), n);

@@ -1,3 +1,5 @@
+// Encryption key sync: an encrypted share's key file travels to the server's key directory over
+// SSH.
 #include <list>
 #include <memory>
 #include <string>
@@ -22,6 +24,7 @@ constexpr int kKeyPathSize = 4096;
 // The key file's content is opaque here: it is never opened, parsed or logged, only handed to
 // rsync by path.
 int Rsyncer::SyncEncryptKey(const std::string& shareName) const {
+    lastError.clear();
     VURNShare* raw = nullptr;
     const int got = VURNShareGet(shareName.c_str(), &raw);
     ShareRecord share(raw);  // freed on every path below
@@ -79,8 +82,10 @@ int Rsyncer::SyncEncryptKey(const std::string& shareName) const {
     // The key never travels over the rsync daemon's own channel, whatever the task's setting.
     task.SetSSH(true);
     task.SetServerPort(syncInfo.GetSSHPort());
-    return task.Execute(keyFile, S2S_PATH_KEY_DIR, cancelChecker, shareName,
-                        std::list<std::string>());
+    const int result =
+        task.Execute(keyFile, S2S_PATH_KEY_DIR, cancelChecker, shareName, std::list<std::string>());
+    lastError = task.lastError();
+    return result;
 }
 
 }  // namespace S2S

@@ -1,3 +1,5 @@
+// Remote commands over rsync: the command files, the version query, pairing, the connection test
+// and the search for a reachable address, finishing a share's sync and the task's heartbeat.
 #include <fstream>
 #include <list>
 #include <string>
@@ -125,11 +127,14 @@ int Rsyncer::GenSendBeaconCmd(const std::string& taskName, std::list<std::string
 }
 
 void Rsyncer::GetServerVersion() {
-    const std::string outfile = GetTempFile();
+    std::string why;
+    const std::string outfile = GetTempFile(why);
     if (outfile.empty()) {
         Logger::LogMsg(Logger::Error,
                        "[ERROR] s2s_rsyncer.cpp(%d): GetServerVersion: Fail to get output file\n",
                        __LINE__);
+        versionResult = RsyncTask::kResultLocalFile;
+        lastError = why;
         return;
     }
     std::list<std::string> lines;
@@ -139,12 +144,16 @@ void Rsyncer::GetServerVersion() {
             Logger::Error,
             "[ERROR] s2s_rsyncer.cpp(%d): GetServerVersion: Fail to write command file\n",
             __LINE__);
+        versionResult = RsyncTask::kResultUsage;
+        lastError = "the version query could not be built (no client ID)";
         return;
     }
     RsyncTask task;
     InitRsyncTask(task, true);
     task.SetListOnly(true);
     const int r = task.ExecuteCmd(lines, cancelChecker);
+    lastError = task.lastError();
+    versionResult = 0;
     if (r == kRsyncResultUnknownCmd || r == kRsyncResultUnknownCmdAlt) {
         // A server that does not know the command predates multi-source pairing.
         serverVersion = 0;
@@ -152,6 +161,7 @@ void Rsyncer::GetServerVersion() {
         Logger::LogMsg(Logger::Error,
                        "[ERROR] s2s_rsyncer.cpp(%d): Fail to get server version [%d]\n", __LINE__,
                        r);
+        versionResult = r;
     } else {
         std::ifstream in(outfile.c_str());
         if (!in.is_open()) {
@@ -159,12 +169,18 @@ void Rsyncer::GetServerVersion() {
                            "[ERROR] s2s_rsyncer.cpp(%d): Fail to open server version file\n",
                            __LINE__);
             serverVersion = -1;
+            versionResult = RsyncTask::kResultLocalFile;
+            lastError = "the version reply could not be read back from " + outfile;
         } else {
             int version = -1;
             if (!(in >> version)) {
                 version = -1;
             }
             serverVersion = version;
+            if (version < 0) {
+                versionResult = RsyncTask::kResultBadReply;
+                lastError = "the server's version reply holds no version number";
+            }
         }
     }
     PutTempFile(outfile);
@@ -174,6 +190,7 @@ void Rsyncer::RunCommandLines(const std::list<std::string>& lines, bool isTest, 
     RsyncTask task;
     InitRsyncTask(task, isTest);
     result = task.ExecuteCmd(lines, cancelChecker);
+    lastError = task.lastError();
 }
 
 int Rsyncer::DoSinglePairing(bool dryRun, int& result) const {
@@ -213,11 +230,13 @@ int Rsyncer::DoMultiPairing(bool dryRun, const std::list<std::string>& shares,
                        __LINE__);
         return -1;
     }
-    const std::string outfile = GetTempFile();
+    std::string why;
+    const std::string outfile = GetTempFile(why);
     if (outfile.empty()) {
         Logger::LogMsg(Logger::Error,
                        "[ERROR] s2s_rsyncer.cpp(%d): MultiPairing: Fail to get output file\n",
                        __LINE__);
+        lastError = why;
         return -1;
     }
     int ret = -1;
@@ -230,6 +249,7 @@ int Rsyncer::DoMultiPairing(bool dryRun, const std::list<std::string>& shares,
         RsyncTask task;
         InitRsyncTask(task, dryRun);
         result = task.ExecuteCmd(lines, cancelChecker);
+        lastError = task.lastError();
         // 214 lists the shares another client holds: still a complete exchange.
         if (result == 0 || result == kRsyncResultConflict) {
             if (!ReadConflictShares(outfile, conflictShares)) {

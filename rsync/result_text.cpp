@@ -40,6 +40,7 @@ const ResultInfo kResultTable[] = {
     {35, "connect-timeout", "the server's rsync daemon did not answer in time"},
     {42, "no-address", "no address of the server could be looked up"},
     {43, "unknown-command", "the server does not know the command (an old server)"},
+    {44, "no-version", "the server answered, but its protocol version could not be read"},
     {51, "unknown-command", "the server does not know the command (an old server)"},
     {201, "missing-key", "the server found a required key missing"},
     {202, "attributes-refused", "the server does not accept share attributes"},
@@ -55,6 +56,7 @@ const ResultInfo kResultTable[] = {
     {213, "not-tested", "no server address was tested"},
     {214, "conflict", "some shares are paired with another client"},
     {215, "server-internal", "the receiving server failed internally"},
+    {216, "store-full", "the receiving server's pairing store is full (a size or per-client limit)"},
     {255, "remote-shell", "the remote shell (ssh) failed"},
     {300, "local-key-failure", "the share's key could not be found locally"},
 };

@@ -1,10 +1,14 @@
+// The rsync wrapper's settings and its data runs: the command line of a transfer, the connection
+// options shared with command runs, the child's environment, and the run itself.
 #include <dirent.h>
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cctype>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <utility>
 #include <vector>
@@ -117,6 +121,41 @@ int ProgressPercent(const std::string& line) {
     return value <= 100 ? value : -1;
 }
 
+// The remote configuration is a path on the server: the local S2S_ROOT does not apply to it.
+std::string DefaultRemoteConfig() {
+    const char* root = std::getenv("S2S_REMOTE_ROOT");
+    std::string base = root != nullptr ? root : "";
+    while (!base.empty() && base.back() == '/') {
+        base.pop_back();
+    }
+    return base + kDefaultRemoteConfig;
+}
+
+// Moves a full log aside before rsync appends to it: <log> becomes <log>.1, <log>.1 <log>.2, and
+// so on up to <log>.<keep>; the oldest is dropped. Runs of several processes may meet here: the
+// log's own flock lets one of them rotate, and the others see the fresh file afterwards.
+void RotateLog(const std::string& log, long long limit, int keep) {
+    int fd = open(log.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
+    if (fd < 0) {
+        return;  // no log yet: rsync creates it
+    }
+    struct stat held;
+    struct stat now;
+    if (flock(fd, LOCK_EX) == 0 && fstat(fd, &held) == 0 && held.st_size >= limit &&
+        stat(log.c_str(), &now) == 0 && now.st_ino == held.st_ino && now.st_dev == held.st_dev) {
+        for (int i = keep - 1; i >= 1; --i) {
+            rename((log + "." + std::to_string(i)).c_str(),
+                   (log + "." + std::to_string(i + 1)).c_str());
+        }
+        if (rename(log.c_str(), (log + ".1").c_str()) != 0) {
+            Logger::LogMsg(Logger::Warning,
+                           "[WARNING] rsync_wrapper.cpp(%d): Fail to rotate log '%s': %s\n",
+                           __LINE__, log.c_str(), strerror(errno));
+        }
+    }
+    close(fd);
+}
+
 void MakeParentDir(const std::string& path) {
     size_t slash = path.rfind('/');
     if (slash == std::string::npos || slash == 0) {
@@ -206,6 +245,10 @@ std::string RsyncWrapper::Impl::CheckConnection() const {
         }
         if (authStrict && password.empty() && !(ssh && !identity.empty())) {
             return "authentication requires a password";
+        }
+        if (!credentialsFit(user, password)) {
+            return "the user name and password together are longer than rsync accepts (" +
+                   std::to_string(kMaxSecretLine) + " bytes with the ':' between them)";
         }
     }
     if (port < 0 || port > 65535 || timeout < 0 || connectTimeout < 0) {
@@ -311,7 +354,7 @@ void RsyncWrapper::Impl::ConnectionOptions(std::vector<std::string>* argv) const
         rsh += " -l " + user;
     }
     argv->push_back("--rsh=" + rsh);
-    std::string config = remoteConfig.empty() ? S2SPath(kDefaultRemoteConfig) : remoteConfig;
+    std::string config = remoteConfig.empty() ? DefaultRemoteConfig() : remoteConfig;
     argv->push_back("--rsync-path=rsync --config=" + config);
 }
 
@@ -470,7 +513,11 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     if (debugLog) {
         std::string log = logFile.empty() ? S2SPath(kDefaultLogFile) : logFile;
         MakeParentDir(log);
+        RotateLog(log, kLogRotateBytes, kLogKeep);
         a.push_back("--log-file=" + log);
+    }
+    if (bwlimit > 0) {
+        a.push_back("--bwlimit=" + std::to_string(bwlimit));
     }
     if (progress) {
         a.push_back("--info=progress2");
@@ -484,6 +531,10 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     a.push_back(Url(target));
     Environment(&job);
     return Run(job, cancel, false);
+}
+
+bool RsyncWrapper::credentialsFit(const std::string& user, const std::string& password) {
+    return user.size() + 1 + password.size() <= kMaxSecretLine;
 }
 
 RsyncWrapper::RsyncWrapper() : impl_(new Impl) {}
@@ -563,6 +614,9 @@ void RsyncWrapper::setServerPathModule(std::string serverPath, std::string modul
 }
 void RsyncWrapper::setLogFile(std::string path) {
     impl_->logFile = std::move(path);
+}
+void RsyncWrapper::setBandwidthLimit(unsigned kibPerSecond) {
+    impl_->bwlimit = kibPerSecond;
 }
 void RsyncWrapper::setRemoteConfig(std::string path) {
     impl_->remoteConfig = std::move(path);

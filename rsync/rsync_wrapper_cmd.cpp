@@ -94,6 +94,44 @@ bool WriteWhole(const std::string& path, const std::string& content, int flags, 
     return close(fd) == 0 && ok;
 }
 
+// The output file's content comes from the server. The caller names its own reserved temporary
+// file (or a name that does not exist yet); it is never written through a symbolic link, into
+// something that is not a plain file, into a file of another user or into one with other names
+// (hard links). "" on success, else why not.
+std::string WriteOutputFile(const std::string& path, const std::string& content) {
+    int fd = open(path.c_str(), O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
+    if (fd < 0 && errno == ENOENT) {
+        fd = open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600);
+    }
+    if (fd < 0) {
+        return errno == ELOOP ? "it is a symbolic link" : strerror(errno);
+    }
+    struct stat st;
+    std::string why;
+    if (fstat(fd, &st) != 0) {
+        why = strerror(errno);
+    } else if (!S_ISREG(st.st_mode) || st.st_nlink != 1 || st.st_uid != geteuid()) {
+        why = "it is not a plain file of this user with a single name";
+    } else if (ftruncate(fd, 0) != 0) {
+        why = strerror(errno);
+    }
+    for (size_t done = 0; why.empty() && done < content.size();) {
+        ssize_t n = write(fd, content.data() + done, content.size() - done);
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            why = n < 0 ? strerror(errno) : "short write";
+            break;
+        }
+        done += static_cast<size_t>(n);
+    }
+    if (close(fd) != 0 && why.empty()) {
+        why = strerror(errno);
+    }
+    return why;
+}
+
 // The local path the caller named in outfile="...", or "".
 std::string OutfileOf(const std::list<std::string>& lines) {
     static const std::string kPrefix = "outfile=\"";
@@ -181,8 +219,10 @@ int RsyncWrapper::Impl::ExecuteCommand(const boost::function<bool()>& cancel) {
         std::stringstream content;
         content << in.rdbuf();
         // The caller's file (from its temporary-file service) keeps its owner and mode.
-        if (!in.is_open() || !WriteWhole(outfile, content.str(), O_CREAT | O_TRUNC, 0600)) {
-            lastError = "cannot write the output file " + outfile + ": " + strerror(errno);
+        const std::string why = in.is_open() ? WriteOutputFile(outfile, content.str())
+                                             : "the reply's output cannot be read";
+        if (!why.empty()) {
+            lastError = "cannot write the output file " + outfile + ": " + why;
             Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__,
                            lastError.c_str());
             return kResultLocalFile;

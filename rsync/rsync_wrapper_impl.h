@@ -30,6 +30,7 @@ struct RsyncWrapper::Impl {
     bool numericIds = false;
     bool deleteExtraneous = false;
     int timeout = 0;
+    unsigned bwlimit = 0;  // KiB per second, 0 unlimited
     int connectTimeout = 30;
     bool debugLog = false;
     std::list<std::string> excludes;

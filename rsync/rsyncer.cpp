@@ -1,3 +1,5 @@
+// Rsyncer's life cycle, its share-information cache, the start of a share's sync and its data
+// runs.
 #include <list>
 #include <string>
 
@@ -15,7 +17,7 @@ const char* Flag(bool on) {
 
 }  // namespace
 
-Rsyncer::Rsyncer() : serverVersion(-1), cancelChecker(nullptr) {}
+Rsyncer::Rsyncer() : serverVersion(-1), versionResult(0), cancelChecker(nullptr) {}
 
 Rsyncer::~Rsyncer() = default;
 
@@ -23,6 +25,18 @@ int Rsyncer::Initialize(const SyncInfo& info) {
     Clear();
     syncInfo = info;
     return TestServer();
+}
+
+int Rsyncer::Connect(const SyncInfo& info) {
+    const int rc = Initialize(info);
+    if (rc != 0 || serverVersion >= 0) {
+        return rc;
+    }
+    Logger::LogMsg(Logger::Error,
+                   "[ERROR] s2s_rsyncer.cpp(%d): The server answered but its version is unknown "
+                   "[%d]\n",
+                   __LINE__, versionResult);
+    return kRsyncResultNoVersion;
 }
 
 // Re-initialising an Rsyncer deliberately keeps the share cache and the server version: a share's
@@ -135,6 +149,7 @@ int Rsyncer::RunSync(unsigned long long /*id*/, const std::string& shareName,
     task.SetCompression(syncInfo.UseCompression());
     task.SetBlockLevelSync(syncInfo.UseBlockLevelSync());
     task.SetSyncACL(true);
+    task.setBandwidthLimit(syncInfo.GetMaxBandwidth());
     if (progressCallback) {
         task.setProgressCallback(progressCallback);
     }
@@ -152,11 +167,13 @@ int Rsyncer::RunSync(unsigned long long /*id*/, const std::string& shareName,
     }
     // A path that vanished before it could be sent counts as done.
     if (!IsPathExist(src)) {
+        lastError.clear();
         result = 0;
         return 0;
     }
     // An encrypted share goes as its ciphertext directory under "@name@".
     result = task.Execute(src, info.GetModuleName(), cancelChecker, "", excludes);
+    lastError = task.lastError();
     return 0;
 }
 

@@ -66,6 +66,24 @@ std::string NameAndMeaning(int code) {
     return RsyncResultName(code) + ", " + RsyncResultMeaning(code);
 }
 
+// rsync's own lines (or the library's local cause) as one line for a message: "" or ": a; b".
+std::string Because(const std::string& lines) {
+    std::string joined;
+    size_t start = 0;
+    while (start < lines.size()) {
+        size_t end = lines.find('\n', start);
+        if (end == std::string::npos) {
+            end = lines.size();
+        }
+        const std::string line = lines.substr(start, end - start);
+        if (line.find_first_not_of(" \t") != std::string::npos) {
+            joined += (joined.empty() ? "" : "; ") + line;
+        }
+        start = end + 1;
+    }
+    return joined.empty() ? joined : ": " + joined;
+}
+
 // Sets the run of this thread for the life of Run.
 class CurrentRun {
   public:
@@ -182,7 +200,7 @@ bool TaskRun::Connect() {
             : info.GetServerIP() +
                   (info.GetServerName().empty() ? "" : " (" + info.GetServerName() + ")");
     Say("connecting to " + target + " as " + info.GetUser());
-    const int rc = rsyncer_.Initialize(info);
+    const int rc = rsyncer_.Connect(info);
     server_version_ = rsyncer_.GetServerVersionValue();
     if (Cancelled()) {
         Fail(RunFailure::kCancelled, "stopped before the server answered");
@@ -192,13 +210,21 @@ bool TaskRun::Connect() {
         Fail(RunFailure::kUnreachable, "no address found for server " + target);
         return false;
     }
+    if (rc == kRsyncResultNoVersion) {
+        // Never taken for an old server: pairing would then skip the multi-source check.
+        const int why = rsyncer_.GetServerVersionResult();
+        Fail(why == 1 || why == 11 ? RunFailure::kLocal : ClassifyCommandResult(why),
+             "the server answered, but its protocol version could not be read (" +
+                 RsyncResultName(why) + ")" + Because(rsyncer_.GetLastError()));
+        return false;
+    }
     if (rc != 0) {
         const RunFailure failure = ClassifyConnectResult(rc);
         const std::string why =
             failure == RunFailure::kAuth
                 ? "the server refused user '" + info.GetUser() + "' or its password"
                 : "the server did not answer";
-        Fail(failure, why + ": " + NameAndMeaning(rc));
+        Fail(failure, why + ": " + NameAndMeaning(rc) + Because(rsyncer_.GetLastError()));
         return false;
     }
     settled_address_ = rsyncer_.GetSyncInfo().GetServerIP();
@@ -237,7 +263,8 @@ bool TaskRun::Pair() {
                  "the server refused the pairing: " + RsyncResultName(result));
             return false;
         }
-        Fail(RunFailure::kLocal, "the pairing request could not be sent (see the log above)");
+        Fail(RunFailure::kLocal,
+             "the pairing request could not be sent" + Because(rsyncer_.GetLastError()));
         return false;
     }
     if (result == kRsyncResultConflict || !conflicts.empty()) {
@@ -369,8 +396,9 @@ void TaskRun::SyncShare(ShareOutcome& share) {
         share.state = ShareState::kFailed;
         share.step = "copy";
         share.result = result;
+        share.rsync_errors = rsyncer_.GetLastError();
         share.message = "copying share '" + share.name + "' failed: " + NameAndMeaning(result) +
-                        "; it is not marked complete";
+                        Because(share.rsync_errors) + "; it is not marked complete";
         Fail(rc != 0 ? RunFailure::kLocal : ClassifyTransferResult(result), share.message);
         return;
     }
@@ -391,8 +419,9 @@ void TaskRun::SyncShare(ShareOutcome& share) {
             share.state = ShareState::kFailed;
             share.step = "key";
             share.result = key;
-            share.message =
-                "sending the key of share '" + share.name + "' failed: " + NameAndMeaning(key);
+            share.rsync_errors = rsyncer_.GetLastError();
+            share.message = "sending the key of share '" + share.name +
+                            "' failed: " + NameAndMeaning(key) + Because(share.rsync_errors);
             Fail(RunFailure::kKeySync, share.message);
             return;
         }
@@ -480,7 +509,8 @@ RunFailure TaskRun::Run(const SyncTask& task) {
                  "the server did not take the task's status: " + RsyncResultName(result));
         }
     } else if (!Cancelled()) {
-        Fail(RunFailure::kLocal, "the task's status could not be sent (see the log above)");
+        Fail(RunFailure::kLocal,
+             "the task's status could not be sent" + Because(rsyncer_.GetLastError()));
     }
     if (Cancelled()) {
         Fail(RunFailure::kCancelled, "stopped while reporting the task's status");

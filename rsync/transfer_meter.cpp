@@ -1,4 +1,4 @@
-// The transfer meter and the tree measure of a share's copy.
+// The size of a share's tree, and the meter that follows a running rsync through /proc.
 #include "rsync/transfer_meter.h"
 
 #include <sys/syscall.h>
@@ -13,6 +13,7 @@
 #include <fstream>
 #include <memory>
 #include <sstream>
+#include <utility>
 #include <vector>
 
 namespace S2S {
@@ -26,12 +27,30 @@ struct DirCloser {
     void operator()(DIR* dir) const { closedir(dir); }
 };
 
-void MeasureDir(int dir_fd, TreeSize& size, int depth) {
-    // fdopendir takes over dir_fd; closedir releases it.
-    std::unique_ptr<DIR, DirCloser> dir(fdopendir(dir_fd));
+// One directory of the walk: its identity and the subdirectories still to visit.
+struct Level {
+    dev_t dev = 0;
+    ino_t ino = 0;
+    std::vector<std::string> pending;
+};
+
+// Counts the regular files of the directory open at `fd` and notes its subdirectories.
+bool ScanDir(int fd, TreeSize& size, Level& level) {
+    struct stat self;
+    const int dup_fd = fcntl(fd, F_DUPFD_CLOEXEC, 0);
+    if (fstat(fd, &self) != 0 || dup_fd < 0) {
+        if (dup_fd >= 0) {
+            close(dup_fd);
+        }
+        return false;
+    }
+    level.dev = self.st_dev;
+    level.ino = self.st_ino;
+    // fdopendir takes over dup_fd; closedir releases it.
+    std::unique_ptr<DIR, DirCloser> dir(fdopendir(dup_fd));
     if (!dir) {
-        close(dir_fd);
-        return;
+        close(dup_fd);
+        return false;
     }
     while (struct dirent* entry = readdir(dir.get())) {
         const char* name = entry->d_name;
@@ -39,20 +58,17 @@ void MeasureDir(int dir_fd, TreeSize& size, int depth) {
             continue;
         }
         struct stat st;
-        if (fstatat(dirfd(dir.get()), name, &st, AT_SYMLINK_NOFOLLOW) != 0) {
+        if (fstatat(fd, name, &st, AT_SYMLINK_NOFOLLOW) != 0) {
             continue;
         }
         if (S_ISREG(st.st_mode)) {
             ++size.files;
             size.bytes += static_cast<uint64_t>(st.st_size);
-        } else if (S_ISDIR(st.st_mode) && depth < 256) {
-            const int child =
-                openat(dirfd(dir.get()), name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-            if (child >= 0) {
-                MeasureDir(child, size, depth + 1);
-            }
+        } else if (S_ISDIR(st.st_mode)) {
+            level.pending.push_back(name);
         }
     }
+    return true;
 }
 
 // The children that thread `tid` of process `pid` started.
@@ -86,11 +102,56 @@ bool ReadChars(pid_t pid, uint64_t& rchar) {
 
 }  // namespace
 
+// The walk goes as deep as the tree does: one descriptor is open at a time (the directory being
+// read), and the way back up is "..", checked against the directory it came from, so neither
+// descriptors nor path lengths bound the depth. A tree changed under the walk so that ".." leads
+// elsewhere ends it with what was counted so far.
 TreeSize MeasureTree(const std::string& root) {
     TreeSize size;
-    const int fd = open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    int fd = open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (fd < 0) {
+        return size;
+    }
+    std::vector<Level> stack(1);
+    if (!ScanDir(fd, size, stack.back())) {
+        close(fd);
+        return size;
+    }
+    while (!stack.empty()) {
+        Level& top = stack.back();
+        if (!top.pending.empty()) {
+            const std::string name = top.pending.back();
+            top.pending.pop_back();
+            const int child =
+                openat(fd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+            if (child < 0) {
+                continue;
+            }
+            Level level;
+            if (!ScanDir(child, size, level)) {
+                close(child);
+                continue;
+            }
+            close(fd);
+            fd = child;
+            stack.push_back(std::move(level));
+            continue;
+        }
+        stack.pop_back();
+        if (stack.empty()) {
+            break;
+        }
+        const int parent = openat(fd, "..", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+        close(fd);
+        fd = parent;
+        struct stat st;
+        if (fd < 0 || fstat(fd, &st) != 0 || st.st_dev != stack.back().dev ||
+            st.st_ino != stack.back().ino) {
+            break;
+        }
+    }
     if (fd >= 0) {
-        MeasureDir(fd, size, 0);
+        close(fd);
     }
     return size;
 }

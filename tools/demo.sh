@@ -89,7 +89,8 @@ S2S_ROOT=$receiver "$bin/s2s-receiver" start
 # --- the SSH server that carries encryption keys -------------------------------------------------
 # Keys always travel over SSH. The SSH server sees a demo account (an alias of root with the demo
 # password) through copies of the account files mounted in this private mount namespace; the
-# remote rsync reads the receiver's daemon configuration under the path the sender asks for.
+# remote rsync reads the receiver's daemon configuration below the receiver's root, which the
+# sender learns from S2S_REMOTE_ROOT (a real server keeps it at its fixed path).
 start_sshd() {
   local ssh_dir=$work/ssh
   mkdir -p "$ssh_dir" /run/sshd
@@ -120,9 +121,6 @@ LogLevel ERROR
 EOF
   /usr/sbin/sshd -D -e -f "$ssh_dir/sshd_config" 2>>"$ssh_dir/sshd.log" &
   sshd_pid=$!
-  local conf=/usr/vurn/etc/s2s_rsyncd.conf
-  mkdir -p "$sender$(dirname "$conf")"
-  ln -sf "$receiver$conf" "$sender$conf"
   for _ in $(seq 1 100); do
     (exec 3<>/dev/tcp/127.0.0.1/$ssh_port) 2>/dev/null && return 0
     sleep 0.05
@@ -174,8 +172,8 @@ field() { sed -n "s/^  \"$2\": \([0-9.]*\),\{0,1\}$/\1/p" "$1"; }
 run_sync() {  # label
   echo "== $1: s2s sync --task task.json --password-file password"
   local status=0
-  S2S_ROOT=$sender "$bin/s2s" sync --task "$task" --password-file "$password_file" --json \
-    >"$work/$1.json" || status=$?
+  S2S_ROOT=$sender S2S_REMOTE_ROOT=$receiver "$bin/s2s" sync --task "$task" \
+    --password-file "$password_file" --json >"$work/$1.json" || status=$?
   if [ "$status" -ne 0 ]; then
     echo "demo: $1 failed with exit code $status" >&2
     cat "$work/$1.json" >&2

@@ -28,22 +28,49 @@ class HostRoot : public ::testing::Test {
     ScopedEnv env_;
 };
 
-TEST_F(HostRoot, TempFileNeedsItsDirectory) {
-    EXPECT_EQ(S2S::GetTempFile(), "");
-    MakeDir(root_ / "tmp/S2S");
+TEST_F(HostRoot, TempFilesLiveInAPrivateDirectoryMadeAtFirstUse) {
+    const std::string dir = root_ / "tmp/S2S";
     std::string a = S2S::GetTempFile();
     std::string b = S2S::GetTempFile();
-    std::string prefix = root_.path() + "/tmp/S2S/temp.";
+    struct stat st;
+    ASSERT_EQ(lstat(dir.c_str(), &st), 0);
+    EXPECT_TRUE(S_ISDIR(st.st_mode));
+    EXPECT_EQ(st.st_mode & 07777, 0700u);
+    EXPECT_EQ(st.st_uid, geteuid());
+    std::string prefix = dir + "/temp.";
     ASSERT_EQ(a.compare(0, prefix.size(), prefix), 0) << a;
     EXPECT_EQ(a.size(), prefix.size() + 6);
     EXPECT_NE(a, b);
-    struct stat st;
     ASSERT_EQ(stat(a.c_str(), &st), 0);  // the empty file reserves the name
     EXPECT_EQ(st.st_size, 0);
     EXPECT_TRUE(S2S::IsPathExist(a));
     S2S::PutTempFile(a);
     EXPECT_FALSE(S2S::IsPathExist(a));
     S2S::PutTempFile(b);
+}
+
+// Another user who can write the directory can swap a reserved name for a link and have a
+// command's output written where the link points: such a directory is refused, saying why.
+TEST_F(HostRoot, TempDirectoryOpenToOthersOrNotOursIsRefused) {
+    const std::string dir = root_ / "tmp/S2S";
+    std::string error;
+    ASSERT_NE(S2S::GetTempFile(error), "") << error;
+    ASSERT_EQ(chmod(dir.c_str(), 01777), 0);
+    LogCapture log;
+    EXPECT_EQ(S2S::GetTempFile(), "");
+    EXPECT_TRUE(log.Contains("has mode 1777")) << log.Text();
+    EXPECT_TRUE(log.Contains("chmod 700 " + dir)) << log.Text();
+    ASSERT_EQ(chmod(dir.c_str(), 0700), 0);
+    if (geteuid() == 0) {
+        ASSERT_EQ(chown(dir.c_str(), 65534, 65534), 0);
+        EXPECT_EQ(S2S::GetTempFile(error), "");
+        EXPECT_NE(error.find("belongs to user 65534, not to root"), std::string::npos) << error;
+        ASSERT_EQ(chown(dir.c_str(), 0, 0), 0);
+    }
+    s2s_test::RemoveTree(dir);
+    ASSERT_EQ(symlink(root_.path().c_str(), dir.c_str()), 0);
+    EXPECT_EQ(S2S::GetTempFile(error), "");
+    EXPECT_NE(error.find("is not a directory"), std::string::npos) << error;
 }
 
 TEST_F(HostRoot, PutTempFileLogsAFailedUnlinkAndIgnoresAnEmptyPath) {

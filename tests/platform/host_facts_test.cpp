@@ -68,6 +68,12 @@ TEST_F(HostFacts, SerialFromTheHostFileThenDmiAndCutToTheBuffer) {
     EXPECT_EQ(Serial(), "SN-1234567890");
     EXPECT_EQ(Serial(6), "SN-12");
     EXPECT_LT(VLIBGetSerialNumber(nullptr, 5), 0);
+    // Virtual machines report serials with blanks; servers take letters, digits and "-_.:" only.
+    WriteHostConf("");
+    WriteDmiSerial("VMware-56 4d 8a 3b\n");
+    EXPECT_EQ(Serial(), "VMware-56-4d-8a-3b");
+    WriteHostConf("[host]\n\tserial=\"A/b \xc3\xa9_x.y:z\"\n");
+    EXPECT_EQ(Serial(), "A-b---_x.y:z");
 }
 
 TEST_F(HostFacts, HaStateAndModelClass) {

@@ -344,6 +344,26 @@ TEST_F(WrapperTest, RelativeRunRecreatesThePathInsideTheModule) {
     ASSERT_EQ(w.execute(boost::function<bool()>()), 0) << w.lastError();
     EXPECT_EQ(s2s_test::ReadFile(server_->SharePath("docs") + "/a/b/f"), "x");
     EXPECT_NE(access((server_->SharePath("docs") + "/a/other").c_str(), F_OK), 0);
+
+    // The debug log grows with every run: once full it is moved aside before the next one, and
+    // only the newest old logs are kept.
+    const std::string log = local_.path() + "/rsync.log";
+    s2s_test::WriteFile(log + ".1", "older");
+    s2s_test::WriteFile(log + ".3", "oldest");
+    s2s_test::WriteFile(log, "full log\n");
+    ASSERT_EQ(truncate(log.c_str(), RsyncWrapper::kLogRotateBytes), 0);
+    RsyncWrapper logged;
+    logged.setDebugLog(true);
+    logged.setLogFile(log);
+    logged.setSrcPath(src + "/a/b/f");
+    server_->Aim(logged, "docs");
+    ASSERT_EQ(logged.execute(boost::function<bool()>()), 0) << logged.lastError();
+    struct stat st;
+    ASSERT_EQ(stat(log.c_str(), &st), 0);
+    EXPECT_LT(st.st_size, 100000);
+    EXPECT_EQ(s2s_test::ReadFile(log + ".1").compare(0, 9, "full log\n"), 0);
+    EXPECT_EQ(s2s_test::ReadFile(log + ".2"), "older");
+    EXPECT_EQ(access((log + ".4").c_str(), F_OK), -1);
 }
 
 TEST_F(WrapperTest, EncryptedModuleAndKeyDirectory) {
@@ -466,6 +486,19 @@ TEST_F(WrapperTest, CommandsReturnTheServersCodeAndOutput) {
     EXPECT_EQ(w.execute(boost::function<bool()>()), 0) << w.lastError();
     EXPECT_EQ(s2s_test::ReadFile(out), "1\n");
 
+    // The server chose the output's content: it never goes through a link to another file.
+    const std::string victim = local_.path() + "/victim";
+    s2s_test::WriteFile(victim, "precious");
+    ASSERT_EQ(symlink(victim.c_str(), (local_.path() + "/linked").c_str()), 0);
+    RsyncWrapper linked;
+    server_->Aim(linked, "");
+    linked.setVurnCustCmdRule({"command=\"S2S_GetProtocolVer\"",
+                               std::string("clientID=\"") + kClientID + "\"",
+                               "outfile=\"" + local_.path() + "/linked\""});
+    EXPECT_EQ(linked.execute(boost::function<bool()>()), RsyncWrapper::kResultLocalFile);
+    EXPECT_NE(linked.lastError().find("symbolic link"), std::string::npos) << linked.lastError();
+    EXPECT_EQ(s2s_test::ReadFile(victim), "precious");
+
     RsyncWrapper unknown;
     server_->Aim(unknown, "");
     unknown.setVurnCustCmdRule({"command=\"S2S_NoSuchThing\"", "clientID=\"abc\""});
@@ -556,6 +589,39 @@ TEST_F(WrapperTest, ConcurrentCommandsStayApart) {
         EXPECT_EQ(outputs[i], i % 2 == 0 ? "1\n" : "") << i;
     }
     ExpectCleanSpool();
+}
+
+// rsync's daemon reads "user:password" lines of at most 1023 bytes: the longest password that fits
+// authenticates; one byte more is refused by configure and, with its own message, by a run.
+TEST(WrapperCredentials, LongestPasswordThatFitsWorksOneMoreIsRefused) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "needs root";
+    }
+    const std::string user = "u";
+    const std::string longest(1021, 'p');
+    EXPECT_TRUE(RsyncWrapper::credentialsFit(user, longest));
+    EXPECT_FALSE(RsyncWrapper::credentialsFit(user, longest + "p"));
+    {
+        Server refused(user, longest + "p");
+        const wrapper_test::Run r = refused.Configure();
+        EXPECT_EQ(r.status, 1);
+        EXPECT_NE(r.output.find("the password is too long"), std::string::npos) << r.output;
+    }
+    Server server(user, longest);
+    server.AddShare("photos");
+    ASSERT_EQ(server.Start(), "");
+    s2s_test::TempDir local("s2s-wrapper-src");
+    s2s_test::WriteFile(local / "f", "x");
+    RsyncWrapper fits;
+    fits.setSrcPath(local / "f");
+    server.Aim(fits, "photos");
+    EXPECT_EQ(fits.execute(boost::function<bool()>()), 0) << fits.lastError();
+    RsyncWrapper tooLong;
+    tooLong.setSrcPath(local / "f");
+    server.Aim(tooLong, "photos");
+    tooLong.setDestPath("127.0.0.1", user, longest + "p", "photos", "");
+    EXPECT_EQ(tooLong.execute(boost::function<bool()>()), RsyncWrapper::kResultUsage);
+    EXPECT_NE(tooLong.lastError().find("longer than rsync accepts"), std::string::npos);
 }
 
 // The transport on its own: a daemon whose command module runs a stand-in handler that answers

@@ -144,6 +144,26 @@ TEST_F(RsyncerServer, CurrentServerReportsItsVersion) {
     EXPECT_EQ(rsyncer.GetServerVersionValue(), 1);
 }
 
+// A version query that fails is no answer: taking it for an old server would pair the client as
+// a whole and skip the multi-source conflict check. Initialize keeps its old rule; Connect fails.
+TEST_F(RsyncerServer, FailedVersionQueryIsAFailureNotAnOldServer) {
+    StartServer();
+    ASSERT_EQ(chmod(client_->TempDir().c_str(), 0777), 0);  // refused: others could write there
+    S2S::Rsyncer kept;
+    EXPECT_EQ(kept.Initialize(Info()), 0);
+    EXPECT_EQ(kept.GetServerVersionValue(), -1);
+    S2S::Rsyncer rsyncer;
+    EXPECT_EQ(rsyncer.Connect(Info()), S2S::kRsyncResultNoVersion);
+    EXPECT_EQ(rsyncer.GetServerVersionValue(), -1);
+    EXPECT_EQ(rsyncer.GetServerVersionResult(), 11);
+    EXPECT_NE(rsyncer.GetLastError().find("has mode 0777"), std::string::npos)
+        << rsyncer.GetLastError();
+    ASSERT_EQ(chmod(client_->TempDir().c_str(), 0700), 0);
+    EXPECT_EQ(rsyncer.Connect(Info()), 0);
+    EXPECT_EQ(rsyncer.GetServerVersionValue(), 1);
+    EXPECT_EQ(rsyncer.GetServerVersionResult(), 0);
+}
+
 // A stock rsync daemon without the command module: the wrapper answers 51, which the version
 // query takes for an old server, while the connection test fails with it.
 TEST_F(RsyncerServer, StockDaemonWithoutCommandsIsAnOldServer) {
@@ -474,6 +494,54 @@ TEST_F(RsyncerServer, CancellationStopsALargeTransfer) {
     EXPECT_EQ(static_cast<size_t>(st.st_size), kBig);
 }
 
+std::chrono::steady_clock::time_point g_limitedStart;
+uint64_t g_limitedBytes = 0;
+double g_limitedSeconds = 0;
+
+// Watches a limited copy for two seconds: the bytes the server has written so far (its temporary
+// file, or the file once complete) against the time since the run began.
+bool StopLimitedCopyAfterTwoSeconds() {
+    g_limitedSeconds =
+        std::chrono::duration<double>(std::chrono::steady_clock::now() - g_limitedStart).count();
+    g_limitedBytes = 0;
+    if (DIR* d = opendir(g_partialDir.c_str())) {
+        while (struct dirent* e = readdir(d)) {
+            struct stat st;
+            if (std::string(e->d_name).find("big.bin") != std::string::npos &&
+                stat((g_partialDir + "/" + e->d_name).c_str(), &st) == 0) {
+                g_limitedBytes += static_cast<uint64_t>(st.st_size);
+            }
+        }
+        closedir(d);
+    }
+    return g_limitedSeconds >= 2.0;
+}
+
+// The task's bandwidth limit holds: in two seconds at 256 KiB/s a copy moves about half a MiB,
+// where an unlimited one over loopback finishes all 8 MiB. The bound is generous (twice the rate,
+// plus 1 MiB for rsync's buffers) and only a limit that is ignored can break it.
+TEST_F(RsyncerServer, BandwidthLimitSlowsTheCopy) {
+    StartServer();
+    constexpr uint64_t kSize = 8u << 20;
+    WriteBytes(client_->Volume() + "/docs/big.bin", kSize, 5);
+    g_partialDir = server_->Volume() + "/docs";
+    S2S::SyncInfo info = Info();
+    info.SetMaxBandwidth(256);
+    S2S::Rsyncer rsyncer;
+    ASSERT_EQ(rsyncer.Initialize(info), 0);
+    int result = -1;
+    Lines conflicts;
+    ASSERT_EQ(rsyncer.DoPairing(false, {"docs"}, conflicts, result), 0);
+    rsyncer.SetCancelChecker(&StopLimitedCopyAfterTwoSeconds);
+    g_limitedStart = std::chrono::steady_clock::now();
+    ASSERT_EQ(rsyncer.RunSync(1, "docs", "/", {}, result), 0);
+    EXPECT_EQ(result, kWrapperCancelled);
+    const double bound = 2.0 * 256 * 1024 * g_limitedSeconds + (1u << 20);
+    EXPECT_LT(static_cast<double>(g_limitedBytes), bound)
+        << g_limitedBytes << " bytes in " << g_limitedSeconds << " s";
+    EXPECT_LT(g_limitedBytes, kSize);
+}
+
 // The command lines of the rsync runs: an "rsync" first on PATH records its arguments (one run a
 // line, each argument ended by \x1f) and hands over to the real program. Reading /proc from the
 // cancel checker instead missed runs that ended before the first look.
@@ -551,6 +619,7 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     S2S::SyncInfo info = Info();
     info.SetSSHPort(2222);  // not used: the task does not use SSH
     info.SetCompression(true);
+    info.SetMaxBandwidth(300);  // KiB per second, for data runs only
     S2S::Rsyncer rsyncer;
     rsyncer.SetCancelChecker(&RecordRsyncArgv);
     ASSERT_EQ(rsyncer.Initialize(info), 0);
@@ -559,6 +628,7 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
         EXPECT_TRUE(Contains(args, "--timeout=60"));
         EXPECT_FALSE(HasPrefix(args, "--rsh"));
         EXPECT_FALSE(HasPrefix(args, "--log-file"));
+        EXPECT_FALSE(HasPrefix(args, "--bwlimit"));
         EXPECT_TRUE(HasPrefix(args, "rsync://s2suser@127.0.0.1/@s2s-cmd/")) << args.back();
         EXPECT_FALSE(HasPrefix(args, "rsync://s2suser@127.0.0.1:"));
     }
@@ -571,8 +641,9 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     ASSERT_EQ(result, 0);
     ASSERT_EQ(Argvs().size(), 1u);
     std::vector<std::string> args = Argvs()[0];
-    for (const char* expected : {"--timeout=600", "--delete", "--numeric-ids", "--compress",
-                                 "--whole-file", "--acls", "--exclude=*.tmp", "--exclude=cache/"}) {
+    for (const char* expected :
+         {"--timeout=600", "--delete", "--numeric-ids", "--compress", "--whole-file", "--acls",
+          "--exclude=*.tmp", "--exclude=cache/", "--bwlimit=300"}) {
         EXPECT_TRUE(Contains(args, expected)) << expected;
     }
     EXPECT_TRUE(Contains(args, "--log-file=" + client_->Root() + "/var/log/s2s_rsync.log"));
@@ -584,6 +655,7 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     // A path inside the share: relative mode from the "/." anchor; block-level sync is delta.
     info.SetCompression(false);
     info.SetBlockLevelSync(true);
+    info.SetMaxBandwidth(0);  // no limit
     S2S::Rsyncer delta;
     ASSERT_EQ(delta.Initialize(info), 0);
     delta.SetCancelChecker(&RecordRsyncArgv);
@@ -594,6 +666,7 @@ TEST_F(RsyncerServer, RunsCarryTheirOptions) {
     args = Argvs()[0];
     EXPECT_TRUE(Contains(args, "--relative"));
     EXPECT_TRUE(Contains(args, "--no-whole-file"));
+    EXPECT_FALSE(HasPrefix(args, "--bwlimit"));
     EXPECT_FALSE(Contains(args, "--compress"));
     EXPECT_EQ(args[args.size() - 2], src + "/./a/b");
     EXPECT_EQ(args.back(), "rsync://s2suser@127.0.0.1/photos");

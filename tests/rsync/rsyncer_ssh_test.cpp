@@ -175,12 +175,9 @@ class RsyncerKeySyncSsh : public ::testing::Test {
         ASSERT_EQ(r.status, 0) << r.output;
         r = server_->Start();
         ASSERT_EQ(r.status, 0) << r.output;
-        // Client and server share this machine: the server's configuration is where the client
-        // expects the server to keep it.
-        rsyncer_test::MakeDirs(client_->Root() + "/usr/vurn/etc");
-        ASSERT_EQ(symlink(server_->ConfigFile().c_str(),
-                          (client_->Root() + "/usr/vurn/etc/s2s_rsyncd.conf").c_str()),
-                  0);
+        // Client and server share this machine: the server's fixed paths are below its root,
+        // which the client learns from S2S_REMOTE_ROOT (its own S2S_ROOT says nothing about them).
+        remoteRoot_.reset(new s2s_test::ScopedEnv("S2S_REMOTE_ROOT", server_->Root().c_str()));
         const std::string why = sshd_.Start();
         ASSERT_EQ(why, "");
     }
@@ -217,6 +214,7 @@ class RsyncerKeySyncSsh : public ::testing::Test {
 
     std::unique_ptr<ClientHost> client_;
     std::unique_ptr<Receiver> server_;
+    std::unique_ptr<s2s_test::ScopedEnv> remoteRoot_;
     TestSshd sshd_;
 };
 

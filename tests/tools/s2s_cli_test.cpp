@@ -127,6 +127,13 @@ TEST_F(CliTest, PasswordFileMustBePrivate) {
              "--password-file", host_.Root()});
     EXPECT_EQ(r.status, 4) << r.All();
     EXPECT_NE(r.err.find("is not a regular file"), std::string::npos) << r.err;
+    // One byte longer than rsync can authenticate with the user "u".
+    WriteFile(path, std::string(1022, 'p') + "\n");
+    chmod(path.c_str(), 0600);
+    r = S2s({"sync", "--server-ip", "127.0.0.1", "--user", "u", "--share", "docs",
+             "--password-file", path});
+    EXPECT_EQ(r.status, 4) << r.All();
+    EXPECT_NE(r.err.find("the password is too long"), std::string::npos) << r.err;
 }
 
 TEST_F(CliTest, TaskFilesAreCheckedStrictly) {

@@ -1,7 +1,9 @@
 // End-to-end scenarios of `s2s sync` that must fail, or cope, with a clear exit code and message:
 // a second sender pairing a share that is taken, an old server, Ctrl-C in the middle of a copy, a
-// receiver that is down, and a wrong password.
+// receiver that is down, a wrong password, an unsafe temporary directory and a full disk.
 #include <gtest/gtest.h>
+#include <sched.h>
+#include <sys/mount.h>
 
 #include "tools/s2s_scenario.h"
 
@@ -100,6 +102,45 @@ TEST_F(FailureScenario, ReceiverDownIsReportedAsUnreachable) {
     EXPECT_EQ(r.status, 5) << r.All();
     EXPECT_NE(r.err.find("the server did not answer: socket-io (10)"), std::string::npos) << r.err;
     EXPECT_NE(r.out.find("\"result\": \"unreachable\""), std::string::npos) << r.out;
+    // What rsync said, in the tool's own plain words: no library log lines on the terminal.
+    EXPECT_NE(r.err.find("Connection refused"), std::string::npos) << r.err;
+    EXPECT_EQ(r.err.find("[ERROR]"), std::string::npos) << r.err;
+}
+
+// A temporary directory other users can write is refused, and a version query that fails for
+// that reason stops the sync: it is never taken for an old server.
+TEST_F(FailureScenario, UnsafeTemporaryDirectoryStopsTheSyncWithTheReason) {
+    StartReceiver();
+    ASSERT_EQ(chmod((sender_->Root() + "/tmp/S2S").c_str(), 0777), 0);
+    const Result r = sender_->Sync(kUser, {"docs"});
+    EXPECT_EQ(r.status, 1) << r.All();
+    EXPECT_NE(r.err.find("protocol version could not be read"), std::string::npos) << r.err;
+    EXPECT_NE(r.err.find("has mode 0777"), std::string::npos) << r.err;
+    EXPECT_EQ(r.All().find("an old server"), std::string::npos) << r.All();
+    EXPECT_EQ(receiver_->Status().out.find("client:"), std::string::npos);
+}
+
+// A full disk on the receiver: rsync's own words (which file, "No space left on device") reach
+// the message and the JSON, not only the sender's rsync log.
+TEST_F(FailureScenario, FullDiskOnTheReceiverIsNamedInTheMessageAndTheJson) {
+    // A small file system on the receiver's share, in a mount namespace of this test's own (the
+    // receiver's daemon, started afterwards, sees it; nothing outside does).
+    if (unshare(CLONE_NEWNS) != 0 || mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr)) {
+        GTEST_SKIP() << "needs a private mount namespace";
+    }
+    const std::string target = receiver_->SharePath("docs");
+    ASSERT_EQ(mount("tmpfs", target.c_str(), "tmpfs", 0, "size=256k"), 0);
+    struct Unmount {
+        std::string path;
+        ~Unmount() { umount2(path.c_str(), MNT_DETACH); }
+    } unmount{target};
+    StartReceiver();
+    WriteRandomFile(sender_->SharePath("docs") + "/big.bin", 1u << 20);
+    const Result r = sender_->Sync(kUser, {"docs"}, {"--json"});
+    ASSERT_EQ(r.status, 9) << r.All();
+    EXPECT_NE(r.err.find("No space left on device"), std::string::npos) << r.err;
+    EXPECT_NE(r.out.find("\"rsync_errors\": ["), std::string::npos) << r.out;
+    EXPECT_NE(r.out.find("No space left on device"), std::string::npos) << r.out;
 }
 
 TEST_F(FailureScenario, WrongPasswordIsReportedAsAuthenticationFailure) {

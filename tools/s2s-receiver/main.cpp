@@ -13,6 +13,7 @@
 
 #include "s2s_logger.h"
 #include "s2s_receiver.h"
+#include "s2s_rsync_wrapper.h"
 
 namespace {
 
@@ -106,6 +107,13 @@ int Configure(int argc, char** argv) {
     // Never from the command line: other users can read a process's arguments.
     if (!std::getline(std::cin, s.password)) {
         std::fputs("s2s-receiver: no password on standard input\n", stderr);
+        return 1;
+    }
+    if (!VURN::Backup::RsyncWrapper::credentialsFit(s.user, s.password)) {
+        std::fprintf(stderr,
+                     "s2s-receiver: the password is too long: rsync cannot authenticate user name "
+                     "and password of more than %zu bytes together (with the ':' between them)\n",
+                     VURN::Backup::RsyncWrapper::kMaxSecretLine);
         return 1;
     }
     s.handlerPath = SelfPath();

@@ -11,6 +11,7 @@
 #include <nlohmann/json.hpp>
 
 #include "s2s_host.h"
+#include "s2s_rsync_wrapper.h"
 #include "s2s_source_guard.h"
 #include "s2s_sync_obj.h"
 #include "s2s_task_run.h"
@@ -37,7 +38,7 @@ const std::vector<OptionSpec> kSyncOptions = {
     {"block-level", "", false, "send only the changed blocks of changed files"},
     {"ssh", "", false, "reach the server over SSH"},
     {"ssh-port", "PORT", false, "the server's SSH port (also used for encryption keys)"},
-    {"max-bandwidth", "N", false, "the bandwidth limit handed to rsync (0: none)"},
+    {"max-bandwidth", "N", false, "limit each copy to N KiB per second (0: no limit)"},
     {"password-file", "FILE", false, "read the password from FILE (mode 600; - for stdin)"},
     {"exclude", "PATTERN", true, "leave out files matching an rsync exclude pattern"},
     {"allow-empty-source", "", false, "sync an empty share folder even over a full copy"},
@@ -192,6 +193,17 @@ nlohmann::json Summary(const S2S::TaskRun& run) {
         if (!share.message.empty()) {
             entry["message"] = share.message;
         }
+        if (!share.rsync_errors.empty()) {
+            nlohmann::json lines = nlohmann::json::array();
+            size_t start = 0;
+            while (start < share.rsync_errors.size()) {
+                size_t end = share.rsync_errors.find('\n', start);
+                end = end == std::string::npos ? share.rsync_errors.size() : end;
+                lines.push_back(share.rsync_errors.substr(start, end - start));
+                start = end + 1;
+            }
+            entry["rsync_errors"] = lines;
+        }
         if (!share.guard.empty()) {
             entry["guard"] = share.guard;
         }
@@ -327,6 +339,15 @@ int RunSyncCommand(const Options& opts) {
         task.SetInfo(info);
     }
     std::fill(password.begin(), password.end(), '\0');
+    const S2S::SyncInfo& credentials = task.GetInfo().GetSyncInfo();
+    if (!VURN::Backup::RsyncWrapper::credentialsFit(credentials.GetUser(),
+                                                    credentials.GetPassword())) {
+        return Fail(kExitPassword,
+                    "the password is too long: rsync cannot authenticate user name and password "
+                    "of more than " +
+                        std::to_string(VURN::Backup::RsyncWrapper::kMaxSecretLine) +
+                        " bytes together (with the ':' between them)");
+    }
 
     // The first broken rule is logged as a NOTE line; a person needs to see it here. The two rules
     // whose note has no line end are checked first with a message of our own.

@@ -29,8 +29,8 @@ int ShowTaskFile(const std::string& path);
 // Prints "s2s: <message>" to standard error (and a hint to --help for usage errors); returns
 // `code` so callers can write `return Fail(kExitUsage, "...")`.
 int Fail(int code, const std::string& message);
-// Sets where the library's log lines go (standard error) and how many: `verbosity` -1 quiet,
-// 0 errors, 1 informational, 2 debug.
+// Sets where the library's log lines go and how many: `verbosity` -1 none, 0 errors to the system
+// log (not the terminal), 1 informational and 2 debug lines to standard error.
 void SetupLogging(int verbosity);
 
 }  // namespace s2s_cli

@@ -1,3 +1,4 @@
+// Helpers every command of `s2s` shares: failure messages and where the library's log goes.
 #include <cstdio>
 
 #include "s2s_logger.h"
@@ -15,12 +16,16 @@ int Fail(int code, const std::string& message) {
 }
 
 void SetupLogging(int verbosity) {
-    // The library logs through one process-wide logger; below ERROR nothing passes, so a quiet run
-    // prints only the tool's own lines.
-    int level = S2S::Logger::Error;
-    if (verbosity < 0) {
-        level = S2S::Logger::Error - 1;
-    } else if (verbosity == 1) {
+    // The library logs through one process-wide logger, in lines for the system log (level tag,
+    // source file and line). A person at the terminal gets the tool's own messages, which carry
+    // the cause; the library's lines go there only when asked for (--verbose, --debug). By
+    // default its errors go to the system log, and a quiet run drops them.
+    if (verbosity == 0) {
+        S2S::Logger::Initialize(S2S::Logger::Syslog, S2S::Logger::Error, "", 0);
+        return;
+    }
+    int level = S2S::Logger::Error - 1;
+    if (verbosity == 1) {
         level = S2S::Logger::Info;
     } else if (verbosity >= 2) {
         level = S2S::Logger::Debug;
