@@ -129,8 +129,9 @@ class S2S_EXPORT PStream {
     // The history is edited by the transferring thread and read, rarely, by others (GetStatus,
     // DumpHistory). An edit takes the mutex only while someone reads: the editor announces itself
     // in editing_ and then looks at watchers_, a reader announces itself in watchers_ and then
-    // waits for editing_ to fall before taking the mutex (both sequentially consistent, so at
-    // least one of the two sees the other).
+    // waits for editing_ to fall before taking the mutex. A full barrier between each one's
+    // announcement and its look makes at least one of the two see the other; the reader pays for
+    // both sides with a process-wide barrier where the kernel offers one.
     bool BeginEdit();
     void EndEdit(bool locked);
     void Watch();

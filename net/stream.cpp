@@ -1,9 +1,14 @@
 #include "s2s_stream.h"
 
+#include <linux/membarrier.h>
 #include <sched.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
 #include <algorithm>
 #include <cctype>
 #include <climits>
+#include <cstdlib>
 #include <cstring>
 #include <tuple>
 #include <typeinfo>
@@ -77,6 +82,25 @@ bool IsSecretKey(const char* key, size_t length) {
 }
 
 constexpr char kMasked[] = "********";
+
+// A barrier on every thread of the process at once (membarrier), so that the thread that edits a
+// stream's key path needs no fence of its own. Registered once; unavailable on kernels without it.
+bool RegisterHeavyBarrier() {
+    long commands = syscall(SYS_membarrier, MEMBARRIER_CMD_QUERY, 0, 0);
+    return commands > 0 && (commands & MEMBARRIER_CMD_PRIVATE_EXPEDITED) != 0 &&
+           syscall(SYS_membarrier, MEMBARRIER_CMD_REGISTER_PRIVATE_EXPEDITED, 0, 0) == 0;
+}
+
+bool HeavyBarrierAvailable() {
+    static const bool available = RegisterHeavyBarrier();
+    return available;
+}
+
+void HeavyBarrier() {
+    if (syscall(SYS_membarrier, MEMBARRIER_CMD_PRIVATE_EXPEDITED, 0, 0) != 0) {
+        std::abort();  // registered above: failing now would leave an edit unguarded
+    }
+}
 
 // True when the codec may go straight to the rings: a plain Channel (no step replaced by a
 // subclass) and no debug line that the long way would log.
@@ -348,8 +372,14 @@ void PStream::SetRecvLimits(size_t max_bytes, unsigned int max_depth) {
 }
 
 bool PStream::BeginEdit() {
-    editing_.store(true, std::memory_order_seq_cst);
-    if (watchers_.load(std::memory_order_seq_cst) == 0) {
+    editing_.store(true, std::memory_order_relaxed);
+    // With process-wide barriers a reader forces the fence on this thread; without, pay it here.
+    if (HeavyBarrierAvailable()) {
+        std::atomic_signal_fence(std::memory_order_seq_cst);
+    } else {
+        std::atomic_thread_fence(std::memory_order_seq_cst);
+    }
+    if (watchers_.load(std::memory_order_relaxed) == 0) {
         return false;
     }
     editing_.store(false, std::memory_order_release);
@@ -367,7 +397,10 @@ void PStream::EndEdit(bool locked) {
 
 void PStream::Watch() {
     watchers_.fetch_add(1, std::memory_order_seq_cst);
-    while (editing_.load(std::memory_order_seq_cst)) {
+    if (HeavyBarrierAvailable()) {
+        HeavyBarrier();
+    }
+    while (editing_.load(std::memory_order_acquire)) {
         sched_yield();  // an unlocked edit is a few instructions long
     }
     pthread_mutex_lock(&mutex_);
