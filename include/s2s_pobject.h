@@ -29,7 +29,7 @@ class S2S_EXPORT PObject {
     template <typename T>
     static int type_trait();
 
-    PObject() = default;
+    PObject() noexcept {}  // user-provided: a `const PObject` may be default-initialised
     PObject(unsigned long long value);
     PObject(const std::string& value);
     PObject(const char* value);
