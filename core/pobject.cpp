@@ -1,6 +1,8 @@
+// PObject: storage, access, copying, printing and release of the library's dynamic value.
 #include "s2s_pobject.h"
 
 #include <cstdio>
+#include <iterator>
 #include <stdexcept>
 #include <utility>
 
@@ -75,48 +77,43 @@ PObject& PObject::operator=(const PObject& other) {
 
 PObject& PObject::operator=(PObject&& other) noexcept {
     if (this != &other) {
-        PObject taken;
-        taken.swap(other);
+        PObject taken(std::move(other));
         swap(taken);  // the old content leaves with `taken`
     }
     return *this;
 }
 
 bool PObject::isEmpty() const {
-    if (isNull()) {
-        return true;
-    }
     switch (type_) {
+        case kNull:
+            return true;
         case kString:
             return static_cast<const std::string*>(payload_)->empty();
         case kArray:
-            return static_cast<const Array*>(payload_)->empty();
+            return payload_ == nullptr || static_cast<const Array*>(payload_)->empty();
         case kMap:
-            return static_cast<const Map*>(payload_)->empty();
+            return payload_ == nullptr || static_cast<const Map*>(payload_)->empty();
         default:
             return false;  // an integer is never empty, also when 0
     }
 }
 
 unsigned long long PObject::asUInt64() const {
-    if (isInteger() && !isNull()) {
-        return *static_cast<const unsigned long long*>(payload_);
-    }
-    return 0;
+    return type_ == kInteger ? number_ : 0;
 }
 
 bool PObject::asBool() const {
-    if (isInteger() && !isNull()) {
-        return asUInt64() != 0;
+    if (type_ == kInteger) {
+        return number_ != 0;
     }
     return !isEmpty();
 }
 
 std::string PObject::asString() const {
-    if (isString() && !isNull()) {
+    if (type_ == kString) {
         return *static_cast<const std::string*>(payload_);
     }
-    if (isInteger() && !isNull()) {
+    if (type_ == kInteger) {
         char text[64];
         std::snprintf(text, sizeof(text), "%u", asUInt32());
         return text;
@@ -125,29 +122,37 @@ std::string PObject::asString() const {
 }
 
 const PObject::Array& PObject::asArray() const {
-    if (isArray() && !isNull()) {
+    if (type_ == kArray && payload_ != nullptr) {
         return *static_cast<const Array*>(payload_);
     }
     return GetEmptyArray();
 }
 
 const PObject::Map& PObject::asMap() const {
-    if (isMap() && !isNull()) {
+    if (type_ == kMap && payload_ != nullptr) {
         return *static_cast<const Map*>(payload_);
     }
     return GetEmptyMap();
 }
 
 PObject::Array& PObject::asArray() {
-    if (!isArray() || isNull()) {
-        copy(Array());
+    if (type_ != kArray) {
+        clear();
+        type_ = kArray;
+    }
+    if (payload_ == nullptr) {
+        payload_ = new Array();
     }
     return *static_cast<Array*>(payload_);
 }
 
 PObject::Map& PObject::asMap() {
-    if (!isMap() || isNull()) {
-        copy(Map());
+    if (type_ != kMap) {
+        clear();
+        type_ = kMap;
+    }
+    if (payload_ == nullptr) {
+        payload_ = new Map();
     }
     return *static_cast<Map*>(payload_);
 }
@@ -171,7 +176,7 @@ const PObject* PObject::MapEntryAt(unsigned int index) const {
 
 PObject& PObject::operator[](unsigned int index) {
     // Mutable array elements are reached through asArray(), never here.
-    if (isMap() && !isNull()) {
+    if (type_ == kMap) {
         const PObject* entry = MapEntryAt(index);
         if (entry != nullptr) {
             return const_cast<PObject&>(*entry);
@@ -181,8 +186,8 @@ PObject& PObject::operator[](unsigned int index) {
 }
 
 const PObject& PObject::operator[](const std::string& key) const {
-    if (isMap() && !isNull()) {
-        const Map& map = asMap();
+    if (type_ == kMap && payload_ != nullptr) {
+        const Map& map = *static_cast<const Map*>(payload_);
         auto it = map.find(key);
         if (it != map.end()) {
             return it->second;
@@ -192,14 +197,11 @@ const PObject& PObject::operator[](const std::string& key) const {
 }
 
 const PObject& PObject::operator[](unsigned int index) const {
-    if (isNull()) {
-        return GetEmptyObject();
-    }
-    if (isArray()) {
+    if (type_ == kArray) {
         const Array& array = asArray();
         return index < array.size() ? array[index] : GetEmptyObject();
     }
-    if (isMap()) {
+    if (type_ == kMap) {
         const PObject* entry = MapEntryAt(index);
         return entry != nullptr ? *entry : GetEmptyObject();
     }
@@ -207,139 +209,229 @@ const PObject& PObject::operator[](unsigned int index) const {
 }
 
 bool PObject::hasMember(const std::string& key) const {
-    return isMap() && !isNull() && asMap().count(key) != 0;
+    return type_ == kMap && payload_ != nullptr &&
+           static_cast<const Map*>(payload_)->count(key) != 0;
 }
 
 void PObject::clear() {
-    if (isNull()) {
-        type_ = kNull;
-        return;
-    }
-    if (isContainer()) {
-        // A tree decoded from a peer may be nested a million levels deep: release it with an
-        // explicit work list instead of recursion, so the depth never reaches the call stack.
-        std::vector<PObject> pending;
-        TakeChildren(pending);
-        while (!pending.empty()) {
-            PObject last;
-            last.swap(pending.back());
-            pending.pop_back();
-            last.TakeChildren(pending);
-        }
-    }
     switch (type_) {
         case kString:
             delete static_cast<std::string*>(payload_);
             break;
-        case kInteger:
-            delete static_cast<unsigned long long*>(payload_);
-            break;
-        case kMap:
-            delete static_cast<Map*>(payload_);
-            break;
         case kArray:
-            delete static_cast<Array*>(payload_);
+        case kMap:
+            if (payload_ != nullptr) {
+                // A tree decoded from a peer may be nested a million levels deep: release it with
+                // an explicit work list instead of recursion, so the depth never reaches the call
+                // stack. Only containers that hold containers need the list.
+                std::vector<PObject> pending;
+                TakeChildren(pending);
+                while (!pending.empty()) {
+                    PObject last(std::move(pending.back()));
+                    pending.pop_back();
+                    last.TakeChildren(pending);
+                }
+                if (type_ == kArray) {
+                    delete static_cast<Array*>(payload_);
+                } else {
+                    delete static_cast<Map*>(payload_);
+                }
+            }
             break;
         default:
-            break;  // no payload type is known for other codes
+            break;  // null and integers hold nothing outside the object
     }
     type_ = kNull;
     payload_ = nullptr;
 }
 
-// Moves the container children of this object onto `pending`, leaving only leaves behind.
+// Moves the non-empty container children of this object onto `pending`, leaving only leaves.
 void PObject::TakeChildren(std::vector<PObject>& pending) {
-    if (isNull()) {
+    auto take = [&pending](PObject& child) {
+        if (child.isContainer() && child.payload_ != nullptr) {
+            pending.emplace_back(std::move(child));
+        }
+    };
+    if (payload_ == nullptr) {
         return;
     }
     if (type_ == kArray) {
         for (PObject& element : *static_cast<Array*>(payload_)) {
-            if (element.isContainer() && !element.isNull()) {
-                pending.emplace_back();
-                pending.back().swap(element);
-            }
+            take(element);
         }
     } else if (type_ == kMap) {
         for (auto& entry : *static_cast<Map*>(payload_)) {
-            if (entry.second.isContainer() && !entry.second.isNull()) {
-                pending.emplace_back();
-                pending.back().swap(entry.second);
-            }
+            take(entry.second);
         }
     }
+}
+
+template <>
+void PObject::copy<unsigned long long>(const unsigned long long& value) {
+    clear();
+    type_ = kInteger;
+    number_ = value;
+}
+
+template <>
+void PObject::copy<std::string>(const std::string& value) {
+    // Built before the old content goes: `value` may live inside this object.
+    std::string* fresh = new std::string(value);
+    clear();
+    type_ = kString;
+    payload_ = fresh;
+}
+
+template <>
+void PObject::copy<PObject::Array>(const Array& value) {
+    PObject fresh;
+    if (!value.empty()) {
+        Array& items = fresh.asArray();
+        items.resize(value.size());
+        for (size_t i = 0; i < value.size(); ++i) {
+            items[i].copy(value[i]);
+        }
+    } else {
+        fresh.type_ = kArray;
+    }
+    swap(fresh);  // the old content leaves with `fresh`
+}
+
+template <>
+void PObject::copy<PObject::Map>(const Map& value) {
+    PObject fresh;
+    if (!value.empty()) {
+        Map& map = fresh.asMap();
+        for (const auto& entry : value) {
+            map.emplace_hint(map.end(), entry.first, PObject())->second.copy(entry.second);
+        }
+    } else {
+        fresh.type_ = kMap;
+    }
+    swap(fresh);
 }
 
 void PObject::copy(const PObject& other) {
     // Clears first, on purpose: self-assignment leaves the object null, and assigning one of its
     // own descendants is not supported.
     clear();
-    if (other.isNull()) {
-        return;
-    }
-    switch (other.type_) {
-        case kInteger:
-            copy(other.asUInt64());
-            break;
-        case kString:
-            copy(other.asString());
-            break;
-        case kArray:
-            copy(other.asArray());
-            break;
-        case kMap:
-            copy(other.asMap());
-            break;
-        default:
-            break;
+    // Containers are copied level by level from a work list: each pair is a source container and
+    // its still empty copy; children that are containers themselves join the list.
+    std::vector<std::pair<const PObject*, PObject*>> pending;
+    pending.emplace_back(&other, this);
+    while (!pending.empty()) {
+        const PObject& from = *pending.back().first;
+        PObject& to = *pending.back().second;
+        pending.pop_back();
+        switch (from.type_) {
+            case kInteger:
+                to.type_ = kInteger;
+                to.number_ = from.number_;
+                break;
+            case kString:
+                to.payload_ = new std::string(*static_cast<const std::string*>(from.payload_));
+                to.type_ = kString;
+                break;
+            case kArray: {
+                to.type_ = kArray;
+                const Array& items = from.asArray();
+                if (items.empty()) {
+                    break;
+                }
+                // Sized once, so the addresses on the work list stay valid.
+                Array& copies = to.asArray();
+                copies.resize(items.size());
+                for (size_t i = items.size(); i-- > 0;) {
+                    pending.emplace_back(&items[i], &copies[i]);
+                }
+                break;
+            }
+            case kMap: {
+                to.type_ = kMap;
+                const Map& map = from.asMap();
+                if (map.empty()) {
+                    break;
+                }
+                Map& copies = to.asMap();
+                for (auto it = map.rbegin(); it != map.rend(); ++it) {
+                    auto at = copies.emplace_hint(copies.begin(), it->first, PObject());
+                    pending.emplace_back(&it->second, &at->second);
+                }
+                break;
+            }
+            default:
+                break;  // null stays null
+        }
     }
 }
 
 void PObject::swap(PObject& other) noexcept {
     std::swap(type_, other.type_);
-    std::swap(payload_, other.payload_);
+    std::swap(number_, other.number_);
 }
 
 void PObject::Print(std::string& out) const {
-    if (isNull()) {
-        out += "null";
-        return;
-    }
-    switch (type_) {
-        case kInteger:
-            out += std::to_string(asUInt64());
-            break;
-        case kString:
+    // The text is written from a work list rather than by recursion, so that any depth prints.
+    // Each step is a value still to print, or (value null) the separator/closing text to append.
+    struct Step {
+        const PObject* value;
+        const char* text;
+        const std::string* key;
+    };
+    std::vector<Step> pending;
+    pending.push_back(Step{this, nullptr, nullptr});
+    while (!pending.empty()) {
+        Step step = pending.back();
+        pending.pop_back();
+        if (step.key != nullptr) {
             out += '"';
-            out += *static_cast<const std::string*>(payload_);
-            out += '"';
-            break;
-        case kArray: {
-            out += '[';
-            const char* separator = "";
-            for (const PObject& element : asArray()) {
-                out += separator;
-                element.Print(out);
-                separator = ", ";
-            }
-            out += ']';
-            break;
+            out += *step.key;
+            out += "\": ";
         }
-        case kMap: {
-            out += '{';
-            const char* separator = "";
-            for (const auto& entry : asMap()) {
-                out += separator;
+        if (step.value == nullptr) {
+            out += step.text;
+            continue;
+        }
+        const PObject& value = *step.value;
+        switch (value.type_) {
+            case kNull:
+                out += "null";
+                break;
+            case kInteger:
+                out += std::to_string(value.number_);
+                break;
+            case kString:
                 out += '"';
-                out += entry.first;
-                out += "\": ";
-                entry.second.Print(out);
-                separator = ", ";
+                out += *static_cast<const std::string*>(value.payload_);
+                out += '"';
+                break;
+            case kArray: {
+                out += '[';
+                pending.push_back(Step{nullptr, "]", nullptr});
+                const Array& items = value.asArray();
+                for (size_t i = items.size(); i-- > 0;) {
+                    pending.push_back(Step{&items[i], nullptr, nullptr});
+                    if (i > 0) {
+                        pending.push_back(Step{nullptr, ", ", nullptr});
+                    }
+                }
+                break;
             }
-            out += '}';
-            break;
+            case kMap: {
+                out += '{';
+                pending.push_back(Step{nullptr, "}", nullptr});
+                const Map& map = value.asMap();
+                for (auto it = map.rbegin(); it != map.rend(); ++it) {
+                    pending.push_back(Step{&it->second, nullptr, &it->first});
+                    if (std::next(it) != map.rend()) {
+                        pending.push_back(Step{nullptr, ", ", nullptr});
+                    }
+                }
+                break;
+            }
+            default:
+                break;  // other type codes contribute nothing
         }
-        default:
-            break;  // other type codes contribute nothing
     }
 }
 

@@ -15,6 +15,7 @@
 #include "s2s_channel.h"
 #include "s2s_export.h"
 #include "s2s_pobject.h"
+#include "s2s_stream.h"
 
 namespace S2S {
 
@@ -78,9 +79,18 @@ class S2S_EXPORT IPCSender {
     // An accepted descriptor: owned by the sender after 0, still the caller's after -1.
     int assign(int fd);
     void close();  // flushes what is buffered, then closes
+    // What recv() accepts from the peer (PStream::SetRecvLimits; the stream's defaults at first).
+    void SetRecvLimits(size_t max_bytes, unsigned int max_depth) {
+        max_recv_bytes_ = max_bytes;
+        max_recv_depth_ = max_depth;
+    }
 
   protected:
     Channel channel_;
+
+  private:
+    size_t max_recv_bytes_ = PStream::kDefaultMaxRecvBytes;
+    unsigned int max_recv_depth_ = PStream::kDefaultMaxRecvDepth;
 };
 
 }  // namespace S2S

@@ -1,6 +1,11 @@
 // PObject: the one dynamic value of the library. Every message that crosses a process boundary is
 // a tree of these: null, unsigned 64-bit integer, byte string, array, or map with byte-ordered
 // string keys. Deep-copy value semantics; not thread-safe (one object, one thread at a time).
+//
+// Storage: an integer is held in the object itself; a string, array or map is a separately
+// allocated payload. An array or map may have no payload yet: it is then empty, and gets one on
+// its first mutable use. Copying, printing and releasing never recurse, so a tree of any depth
+// (a decoded message may be nested a million levels) costs heap, never call stack.
 #ifndef S2S_POBJECT_H
 #define S2S_POBJECT_H
 
@@ -24,7 +29,7 @@ class S2S_EXPORT PObject {
     template <typename T>
     static int type_trait();
 
-    PObject() = default;
+    PObject() noexcept {}  // user-provided: a `const PObject` may be default-initialised
     PObject(unsigned long long value);
     PObject(const std::string& value);
     PObject(const char* value);
@@ -45,7 +50,7 @@ class S2S_EXPORT PObject {
     PObject& operator=(const PObject& other);
     PObject& operator=(PObject&& other) noexcept;
 
-    bool isNull() const { return payload_ == nullptr; }
+    bool isNull() const { return type_ == kNull; }
     bool isArray() const { return type_ == kArray; }
     bool isMap() const { return type_ == kMap; }
     bool isInteger() const { return type_ == kInteger; }
@@ -98,8 +103,12 @@ class S2S_EXPORT PObject {
     void Print(std::string& out) const;
     void TakeChildren(std::vector<PObject>& pending);
 
+    // kNull exactly when the object is null; every operation that empties it resets both fields.
     int type_ = kNull;
-    void* payload_ = nullptr;  // owned; holds the storage type of type_, null exactly when null
+    union {
+        void* payload_ = nullptr;  // owned: std::string, Array or Map; null for an empty container
+        unsigned long long number_;  // an integer's value
+    };
 };
 
 template <>
@@ -119,14 +128,15 @@ inline int PObject::type_trait<std::string>() {
     return kString;
 }
 
-template <typename T>
-void PObject::copy(const T& value) {
-    // The payload is a separately allocated storage object: swap() then exchanges two words.
-    T* fresh = new T(value);
-    clear();
-    payload_ = fresh;
-    type_ = type_trait<T>();
-}
+// The typed copies (one per storage type) are defined with the rest of the class.
+template <>
+void PObject::copy<unsigned long long>(const unsigned long long& value);
+template <>
+void PObject::copy<std::string>(const std::string& value);
+template <>
+void PObject::copy<PObject::Array>(const Array& value);
+template <>
+void PObject::copy<PObject::Map>(const Map& value);
 
 }  // namespace S2S
 

@@ -2,11 +2,15 @@
 // back (docs/wire-format.md describes the bytes). Each tag is one byte: 0x00 null (followed by a
 // length byte 0), 0x01 integer (length byte n in 1..8, then n big-endian bytes), 0x10 string
 // (16-bit big-endian length, then the bytes), 0x41 array and 0x42 map (contents, then the end tag
-// 0x40). There is no count, no overall length and no nesting limit.
+// 0x40). There is no count, no overall length and no nesting limit in the format itself.
 //
 // The reader takes bytes from other processes: whatever arrives, it ends with a status. Nesting
-// is followed on the heap, not on the call stack, so depth costs memory in proportion to the
-// bytes received and never the stack.
+// is followed on the heap, not on the call stack. Because a peer could otherwise make a receiver
+// build a tree of any size (memory grows many times faster than the bytes that describe it), a
+// receive refuses a message deeper than a nesting limit or longer than a byte limit, with
+// kStatusProtocolError (-5) and an ERROR line naming the limit. The limits are on by default for
+// every receive (kDefaultMaxRecvDepth, kDefaultMaxRecvBytes); SetRecvLimits changes them, 0
+// lifting one.
 //
 // Besides the codec a stream keeps diagnostics: the key path it is inside (logged on a failure),
 // the nesting depth (indentation of debug lines) and two status counters. Another thread may read
@@ -40,6 +44,11 @@ class S2S_EXPORT PStream {
         kTagArray = 0x41,  // 'A'
         kTagMap = 0x42,    // 'B'
     };
+
+    // Limits a receive starts with: enough for every message of the service (a task list of tens
+    // of thousands of tasks), far below what would exhaust a machine's memory.
+    static constexpr unsigned int kDefaultMaxRecvDepth = 512;
+    static constexpr size_t kDefaultMaxRecvBytes = 16u << 20;
 
     PStream();
     ~PStream();
@@ -94,6 +103,8 @@ class S2S_EXPORT PStream {
     void ClearHistory();
     // Stored only.
     void SetDefaultRecvLocation(const std::string& path);
+    // Nesting levels and wire bytes one receive accepts (0: no limit).
+    void SetRecvLimits(size_t max_bytes, unsigned int max_depth);
 
   private:
     struct Frame;
@@ -115,6 +126,16 @@ class S2S_EXPORT PStream {
     // (`is_key`) is logged as it is; a value may be masked (LoggedValue).
     int RecvText(Channel& channel, std::string& text, bool is_key);
     int ChannelFailure(int status);
+    // The history is edited by the transferring thread and read, rarely, by others (GetStatus,
+    // DumpHistory). An edit takes the mutex only while someone reads: the editor announces itself
+    // in editing_ and then looks at watchers_, a reader announces itself in watchers_ and then
+    // waits for editing_ to fall before taking the mutex. A full barrier between each one's
+    // announcement and its look makes at least one of the two see the other; the reader pays for
+    // both sides with a process-wide barrier where the kernel offers one.
+    bool BeginEdit();
+    void EndEdit(bool locked);
+    void Watch();
+    void Unwatch();
     void ResetStatus();
     void PushKey(const char* key, size_t length);
     // Pop and push in one locked step: the entry's key gives way to the next key of its map.
@@ -136,6 +157,11 @@ class S2S_EXPORT PStream {
     pthread_mutex_t mutex_;
     int depth_ = 0;
     std::string recv_location_;
+    std::atomic<int> watchers_{0};
+    std::atomic<bool> editing_{false};
+    size_t max_recv_bytes_ = kDefaultMaxRecvBytes;
+    unsigned int max_recv_depth_ = kDefaultMaxRecvDepth;
+    size_t received_ = 0;  // wire bytes of the receive in progress
 };
 
 template <>

@@ -291,6 +291,7 @@ int IPCSender::send(const PObject& obj, bool wait_reply, PObject& reply) {
 
 int IPCSender::recv(PObject& obj) {
     PStream stream;
+    stream.SetRecvLimits(max_recv_bytes_, max_recv_depth_);
     return stream.Recv(channel_, obj) < 0 ? -1 : 0;
 }
 

@@ -1,8 +1,14 @@
 #include "s2s_stream.h"
 
+#include <linux/membarrier.h>
+#include <sched.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
 #include <algorithm>
 #include <cctype>
 #include <climits>
+#include <cstdlib>
 #include <cstring>
 #include <tuple>
 #include <typeinfo>
@@ -76,6 +82,25 @@ bool IsSecretKey(const char* key, size_t length) {
 }
 
 constexpr char kMasked[] = "********";
+
+// A barrier on every thread of the process at once (membarrier), so that the thread that edits a
+// stream's key path needs no fence of its own. Registered once; unavailable on kernels without it.
+bool RegisterHeavyBarrier() {
+    long commands = syscall(SYS_membarrier, MEMBARRIER_CMD_QUERY, 0, 0);
+    return commands > 0 && (commands & MEMBARRIER_CMD_PRIVATE_EXPEDITED) != 0 &&
+           syscall(SYS_membarrier, MEMBARRIER_CMD_REGISTER_PRIVATE_EXPEDITED, 0, 0) == 0;
+}
+
+bool HeavyBarrierAvailable() {
+    static const bool available = RegisterHeavyBarrier();
+    return available;
+}
+
+void HeavyBarrier() {
+    if (syscall(SYS_membarrier, MEMBARRIER_CMD_PRIVATE_EXPEDITED, 0, 0) != 0) {
+        std::abort();  // registered above: failing now would leave an edit unguarded
+    }
+}
 
 // True when the codec may go straight to the rings: a plain Channel (no step replaced by a
 // subclass) and no debug line that the long way would log.
@@ -178,6 +203,7 @@ int PStream::Recv(Channel& channel, unsigned long long& value) {
                     result = (result << 8) + static_cast<unsigned char>(at[i]);
                 }
                 channel.Consume(1 + length);
+                received_ += 1 + length;
                 value = result;
                 return kStatusSuccessful;  // no debug line is due on this path
             }
@@ -195,6 +221,7 @@ int PStream::Recv(Channel& channel, unsigned long long& value) {
                        __LINE__, length);
         return kStatusProtocolError;
     }
+    received_ += 1 + length;
     unsigned char bytes[8];
     if (length > 0) {
         ret = ReadBytes(channel, reinterpret_cast<char*>(bytes), length);
@@ -241,6 +268,7 @@ int PStream::RecvText(Channel& channel, std::string& text, bool is_key) {
                                               static_cast<unsigned char>(at[1]);
     if (at != nullptr && channel.BufferedRun(2 + length) != nullptr) {
         // Length and body buffered in one piece: one copy, straight from the ring.
+        received_ += 2 + length;
         text.assign(at + 2, strnlen(at + 2, length));
         channel.Consume(2 + length);
     } else {
@@ -250,6 +278,7 @@ int PStream::RecvText(Channel& channel, std::string& text, bool is_key) {
             return ChannelFailure(ret);
         }
         length = wire_length;
+        received_ += 2 + length;
         text.resize(length);
         if (length > 0) {
             ret = ReadBytes(channel, &text[0], length);
@@ -305,11 +334,11 @@ void PStream::UpdateStatus(unsigned long long a, unsigned long long b) {
 }
 
 void PStream::GetStatus(std::string& path, unsigned long long& a, unsigned long long& b) {
-    pthread_mutex_lock(&mutex_);
+    Watch();
     path = GetHistory();
     a = status_a_.load(std::memory_order_relaxed);
     b = status_b_.load(std::memory_order_relaxed);
-    pthread_mutex_unlock(&mutex_);
+    Unwatch();
 }
 
 std::string PStream::GetHistory() {
@@ -317,24 +346,69 @@ std::string PStream::GetHistory() {
 }
 
 void PStream::DumpHistory() {
-    pthread_mutex_lock(&mutex_);
+    Watch();
     Logger::LogMsg(Logger::Error, "[ERROR] s2s_stream.cpp(%d): Error stack: %s\n", __LINE__,
                    GetHistory().c_str());
-    pthread_mutex_unlock(&mutex_);
+    Unwatch();
 }
 
 void PStream::ClearHistory() {
-    pthread_mutex_lock(&mutex_);
+    bool locked = BeginEdit();
     history_.clear();
     marks_.clear();
     status_a_.store(0, std::memory_order_relaxed);
     status_b_.store(0, std::memory_order_relaxed);
-    pthread_mutex_unlock(&mutex_);
+    EndEdit(locked);
     depth_ = 0;
 }
 
 void PStream::SetDefaultRecvLocation(const std::string& path) {
     recv_location_ = path;
+}
+
+void PStream::SetRecvLimits(size_t max_bytes, unsigned int max_depth) {
+    max_recv_bytes_ = max_bytes;
+    max_recv_depth_ = max_depth;
+}
+
+bool PStream::BeginEdit() {
+    editing_.store(true, std::memory_order_relaxed);
+    // With process-wide barriers a reader forces the fence on this thread; without, pay it here.
+    if (HeavyBarrierAvailable()) {
+        std::atomic_signal_fence(std::memory_order_seq_cst);
+    } else {
+        std::atomic_thread_fence(std::memory_order_seq_cst);
+    }
+    if (watchers_.load(std::memory_order_relaxed) == 0) {
+        return false;
+    }
+    editing_.store(false, std::memory_order_release);
+    pthread_mutex_lock(&mutex_);
+    return true;
+}
+
+void PStream::EndEdit(bool locked) {
+    if (locked) {
+        pthread_mutex_unlock(&mutex_);
+    } else {
+        editing_.store(false, std::memory_order_release);
+    }
+}
+
+void PStream::Watch() {
+    watchers_.fetch_add(1, std::memory_order_seq_cst);
+    if (HeavyBarrierAvailable()) {
+        HeavyBarrier();
+    }
+    while (editing_.load(std::memory_order_acquire)) {
+        sched_yield();  // an unlocked edit is a few instructions long
+    }
+    pthread_mutex_lock(&mutex_);
+}
+
+void PStream::Unwatch() {
+    pthread_mutex_unlock(&mutex_);
+    watchers_.fetch_sub(1, std::memory_order_release);
 }
 
 int PStream::ReadByte(Channel& channel, unsigned char& byte) {
@@ -424,33 +498,33 @@ void PStream::ResetStatus() {
 }
 
 void PStream::PushKey(const char* key, size_t length) {
-    pthread_mutex_lock(&mutex_);
+    bool locked = BeginEdit();
     if (!marks_.empty()) {
         history_ += '.';
     }
     marks_.push_back(history_.size());
     history_.append(key, length);
-    pthread_mutex_unlock(&mutex_);
+    EndEdit(locked);
 }
 
 void PStream::ReplaceKey(const char* key, size_t length) {
-    pthread_mutex_lock(&mutex_);
+    bool locked = BeginEdit();
     if (!marks_.empty()) {
         history_.resize(marks_.back());
         history_.append(key, length);
     }
-    pthread_mutex_unlock(&mutex_);
+    EndEdit(locked);
 }
 
 void PStream::PopKey() {
-    pthread_mutex_lock(&mutex_);
+    bool locked = BeginEdit();
     if (!marks_.empty()) {
         size_t start = marks_.back();
         marks_.pop_back();
         // Below the top level the key is preceded by its joining dot, which goes with it.
         history_.resize(marks_.empty() ? 0 : start - 1);
     }
-    pthread_mutex_unlock(&mutex_);
+    EndEdit(locked);
 }
 
 const char* PStream::LoggedValue(const char* value) const {
@@ -608,6 +682,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     const bool plain = typeid(channel) == typeid(Channel);
     auto direct = [&] { return plain && Logger::log_level < Logger::Debug; };
     auto next_tag = [&](unsigned char& next) {
+        ++received_;
         const char* at = direct() ? channel.BufferedRun(1) : nullptr;
         if (at == nullptr) {
             return RecvTag(channel, next);
@@ -617,10 +692,31 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         return 0;
     };
 
+    // Nesting beyond the limit is refused before the container is entered.
+    auto too_deep = [&] {
+        if (max_recv_depth_ == 0 || stack.size() < max_recv_depth_) {
+            return false;
+        }
+        Logger::LogMsg(Logger::Error,
+                       "[ERROR] s2s_stream.cpp(%d): PStream: message nested deeper than %u "
+                       "levels refused\n",
+                       __LINE__, max_recv_depth_);
+        return true;
+    };
+
     int ret = 0;
     std::string text;
+    received_ = 0;
     for (;;) {
         bool completed = false;  // a whole value (primitive or closed container) was read
+        if (max_recv_bytes_ != 0 && received_ > max_recv_bytes_) {
+            Logger::LogMsg(Logger::Error,
+                           "[ERROR] s2s_stream.cpp(%d): PStream: message longer than %zu bytes "
+                           "refused\n",
+                           __LINE__, max_recv_bytes_);
+            ret = kStatusProtocolError;
+            break;
+        }
         if (slot != nullptr) {
             PObject& target = *slot;
             slot = nullptr;
@@ -651,13 +747,22 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                     break;
                 }
                 case kTagArray:
+                    if (too_deep()) {
+                        ret = kStatusProtocolError;
+                        break;
+                    }
                     open(&target.asArray(), nullptr);  // appends to an array already there
                     continue;
                 case kTagMap:
+                    if (too_deep()) {
+                        ret = kStatusProtocolError;
+                        break;
+                    }
                     open(nullptr, &target.asMap());  // merges into a map already there
                     continue;
                 case kTagNull: {
                     unsigned char length = 0;
+                    ++received_;
                     ret = ReadByte(channel, length);
                     if (ret < 0) {
                         ret = ChannelFailure(ret);
@@ -720,6 +825,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                     // A key buffered whole is built straight from the ring into its entry (no
                     // debug line is due on this path).
                     ResetStatus();
+                    received_ += 2 + length;
                     entry = top.map->emplace_hint(
                         top.map->end(), std::piecewise_construct,
                         std::forward_as_tuple(at + 2, strnlen(at + 2, length)),

@@ -232,13 +232,21 @@ TEST(PObjectTypeTrait, StorageTypeCodes) {
     EXPECT_EQ(PObject::type_trait<std::string>(), 4);
 }
 
-TEST(PObjectDepth, VeryDeepTreeIsReleasedWithoutRecursion) {
+TEST(PObjectDepth, VeryDeepTreeIsCopiedPrintedAndReleasedWithoutRecursion) {
+    // Each of these would overflow the stack if it recursed.
+    const int depth = 1000000;
     PObject root;
     PObject* cursor = &root;
-    for (int i = 0; i < 1000000; ++i) {
-        cursor->asArray().emplace_back();
-        cursor = &cursor->asArray().back();
+    for (int i = 0; i < depth; ++i) {
+        cursor = &(*cursor)["k"].asArray().emplace_back();
     }
-    root.clear();  // would overflow the stack if it recursed
+    *cursor = 7ULL;
+    PObject copy(root);
+    std::string text = copy.toString();
+    EXPECT_EQ(text.size(), depth * std::string("{\"k\": []}").size() + 1);
+    EXPECT_EQ(text.substr(0, 12), "{\"k\": [{\"k\":");
+    EXPECT_EQ(text.substr(depth * 7 - 4, 8), "\": [7]}]");
+    root.clear();
     EXPECT_TRUE(root.isNull());
+    EXPECT_FALSE(copy.isNull());  // the copy owns its own tree
 }

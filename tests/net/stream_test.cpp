@@ -38,7 +38,9 @@ std::string Encode(const PObject& object, unsigned int capacity = 4096) {
 }
 
 // Receives one message from `bytes` (the peer closes after them) into `object`.
-int Decode(const std::string& bytes, PObject& object, unsigned int capacity = 4096) {
+int Decode(const std::string& bytes, PObject& object, unsigned int capacity = 4096,
+           size_t max_bytes = PStream::kDefaultMaxRecvBytes,
+           unsigned int max_depth = PStream::kDefaultMaxRecvDepth) {
     SocketPair pair;
     Peer writer([&] {
         WriteAll(pair.b(), bytes);
@@ -47,6 +49,7 @@ int Decode(const std::string& bytes, PObject& object, unsigned int capacity = 40
     Channel channel(capacity);
     EXPECT_EQ(0, channel.Open(pair.ReleaseA(), true));
     PStream stream;
+    stream.SetRecvLimits(max_bytes, max_depth);
     int ret = stream.Recv(channel, object);
     writer.Join();
     return ret;
@@ -297,13 +300,31 @@ TEST(PStreamTest, GarbageNeverCrashes) {
     }
 }
 
+TEST(PStreamTest, ReceiveLimitsRefuseDeepAndLongMessages) {
+    LogCapture log(S2S::Logger::Error);
+    const unsigned int deepest = PStream::kDefaultMaxRecvDepth;
+    PObject back;
+    EXPECT_EQ(0, Decode(std::string(deepest, '\x41') + std::string(deepest, '\x40'), back));
+    EXPECT_EQ(S2S::kStatusProtocolError,
+              Decode(std::string(deepest + 1, '\x41') + std::string(deepest + 1, '\x40'), back));
+    EXPECT_TRUE(log.Contains("): PStream: message nested deeper than 512 levels refused\n"));
+
+    // 11 strings of 100 bytes: 1,139 bytes on the wire.
+    PObject strings;
+    strings.asArray().assign(11, PObject(std::string(100, 'x')));
+    const std::string bytes = Encode(strings);
+    EXPECT_EQ(0, Decode(bytes, back, 4096, bytes.size(), 0));
+    EXPECT_EQ(S2S::kStatusProtocolError, Decode(bytes, back, 4096, 1000, 0));
+    EXPECT_TRUE(log.Contains("): PStream: message longer than 1000 bytes refused\n"));
+}
+
 TEST(PStreamTest, MillionNestedArraysDecodeWithoutTheCallStack) {
     LogCapture log(S2S::Logger::Error);
-    // The format has no nesting limit; the decoder keeps depth on the heap.
+    // Without the limits the decoder keeps any depth on the heap.
     const size_t depth = 1000000;
     std::string bytes = std::string(depth, '\x41') + std::string(depth, '\x40');
     PObject back;
-    ASSERT_EQ(0, Decode(bytes, back, 81920));
+    ASSERT_EQ(0, Decode(bytes, back, 81920, 0, 0));
     const PObject* level = &back;
     size_t seen = 0;
     while (level->isArray() && !level->asArray().empty()) {
@@ -316,7 +337,7 @@ TEST(PStreamTest, MillionNestedArraysDecodeWithoutTheCallStack) {
 
     // Cut before the end tags: the peer's close ends it with a status.
     PObject partial;
-    EXPECT_EQ(S2S::kStatusIOError, Decode(std::string(depth, '\x41'), partial, 81920));
+    EXPECT_EQ(S2S::kStatusIOError, Decode(std::string(depth, '\x41'), partial, 81920, 0, 0));
     EXPECT_TRUE(partial.isArray());
 }
 
@@ -331,7 +352,7 @@ TEST(PStreamTest, DeeplyNestedMapsKeepTheWholeKeyPath) {
     }
     bytes += '\x07';
     PObject back;
-    EXPECT_EQ(S2S::kStatusProtocolError, Decode(bytes, back, 81920));
+    EXPECT_EQ(S2S::kStatusProtocolError, Decode(bytes, back, 81920, 0, 0));
     std::string path;
     for (size_t i = 0; i < depth; ++i) {
         path += i ? ".k" : "k";
