@@ -46,7 +46,8 @@ struct S2S_EXPORT DeleteLimit {
     bool percent = false;  // `value` is a percentage of the entries the receiver's copy holds
     unsigned long long value = 0;
 
-    // "N" or "N%" (decimal digits only; a percentage at most 100). False with `error` set.
+    // "N" or "N%" (decimal digits only; a count at most INT_MAX, what rsync's --max-delete
+    // takes; a percentage at most 100). False with `error` set.
     static bool Parse(const std::string& text, DeleteLimit& limit, std::string& error);
     // The deletions allowed against a copy of `entries` entries (a percentage rounds down).
     unsigned long long Allowed(unsigned long long entries) const;

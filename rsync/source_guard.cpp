@@ -6,6 +6,7 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <climits>
 #include <cstring>
 #include <string>
 #include <vector>
@@ -17,8 +18,8 @@ namespace S2S {
 
 namespace {
 
-// Well above any real tree; keeps the arithmetic of a percentage clear of overflow.
-constexpr unsigned long long kMaxDeleteCount = 1000000000000ULL;
+// rsync's --max-delete takes an int: a larger count would fail every copy.
+constexpr unsigned long long kMaxDeleteCount = INT_MAX;
 constexpr int kRsyncVanished = 24;
 
 std::string Entries(unsigned long long n) {
@@ -111,15 +112,19 @@ bool DeleteLimit::Parse(const std::string& text, DeleteLimit& limit, std::string
     if (percent) {
         digits.pop_back();
     }
-    if (digits.empty() || digits.size() > 13 ||
-        digits.find_first_not_of("0123456789") != std::string::npos) {
+    if (digits.empty() || digits.find_first_not_of("0123456789") != std::string::npos) {
         error = "deletion limit '" + text + "' is not a number of files (N) or a percentage (N%)";
         return false;
     }
-    const unsigned long long value = std::stoull(digits);
+    const size_t first = digits.find_first_not_of('0');
+    const unsigned long long value = first == std::string::npos ? 0
+                                     : digits.size() - first > 18
+                                         ? ULLONG_MAX
+                                         : std::stoull(digits.substr(first));
     if ((percent && value > 100) || value > kMaxDeleteCount) {
         error = "deletion limit '" + text + "' is out of range" +
-                (percent ? " (a percentage is at most 100%)" : "");
+                (percent ? std::string(" (a percentage is at most 100%)")
+                         : " (at most " + std::to_string(kMaxDeleteCount) + ")");
         return false;
     }
     limit.set = true;
