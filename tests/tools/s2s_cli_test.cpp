@@ -46,6 +46,7 @@ TEST_F(CliTest, CommandLinesAndTheirExitCodes) {
     struct Case {
         std::vector<std::string> args;
         int status;
+        std::string message = "";  // in the error output when given
     };
     const std::vector<Case> cases = {
         {{"--help"}, 0},
@@ -63,20 +64,23 @@ TEST_F(CliTest, CommandLinesAndTheirExitCodes) {
         {{"help", "task", "update"}, 0},
         {{}, 2},
         {{"frobnicate"}, 2},
+        {{"help", "frobnicate"}, 2, "unknown command 'frobnicate'"},
         {{"share"}, 2},
         {{"task", "frobnicate"}, 2},
         {{"sync", "--no-such-option"}, 2},
         {{"sync", "extra"}, 2},
         {{"sync", "--ssh-port", "70000", "--share", "a"}, 2},
         {{"sync", "--ssh-port", "0x10", "--share", "a"}, 2},
-        {{"sync", "--ssh-port"}, 2},
-        {{"sync", "--compress=1"}, 2},
-        {{"sync", "--compress", "--compress"}, 2},
+        {{"sync", "--ssh-port"}, 2, "option '--ssh-port' needs a value (PORT)"},
+        {{"sync", "--compress=1"}, 2, "option '--compress' takes no value"},
+        {{"sync", "--compress", "--compress"}, 2, "option '--compress' given more than once"},
+        {{"next-run", "--at=", "--count", "2"}, 2, "option '--at' needs a value"},
         {{"sync", "--task", "a.json", "--task", "b.json"}, 2},
         {{"sync", "--task", "a.json", "--server", "x"}, 2},
         {{"next-run", "--mode", "Weekly"}, 2},
         {{"next-run", "--at", "24:00"}, 2},
         {{"task", "show"}, 2},
+        {{"task", "check", "sync"}, 3, "task file 'sync'"},
         {{"task", "remove", "x1"}, 2},
         {{"task", "run", "1", "2"}, 2},
         {{"task", "update", "1"}, 2},
@@ -89,6 +93,7 @@ TEST_F(CliTest, CommandLinesAndTheirExitCodes) {
         const Result r = S2s(c.args);
         const std::string line = c.args.empty() ? "(none)" : c.args[0] + " ...";
         EXPECT_EQ(r.status, c.status) << line << " " << r.All();
+        EXPECT_NE(r.err.find(c.message), std::string::npos) << line << " " << r.err;
         if (c.status == 0 && c.args.size() > 0 && c.args[0] != "--version") {
             EXPECT_NE(r.out.find("Usage: s2s"), std::string::npos) << line << " " << r.out;
         }
@@ -213,6 +218,9 @@ TEST_F(CliTest, ShareRegistryRoundTrip) {
     r = S2s({"share", "list", "--json"});
     EXPECT_NE(r.out.find("\"encrypted\": true"), std::string::npos) << r.out;
 
+    // A share may be called like a command.
+    EXPECT_EQ(S2s({"share", "add", "list", "--path", host_.SharePath("docs")}).status, 0);
+    EXPECT_EQ(S2s({"share", "remove", "list"}).status, 0);
     EXPECT_EQ(S2s({"share", "remove", "docs"}).status, 0);
     EXPECT_EQ(S2s({"share", "remove", "docs"}).status, 11);
     EXPECT_TRUE(IsPathThere(host_.SharePath("docs")));  // the files stay
