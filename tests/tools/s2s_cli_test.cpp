@@ -408,10 +408,11 @@ TEST_F(CliTest, TaskAddSendsThePasswordBesideTheTask) {
     const std::string password = host_.Root() + "/pw";
     WriteFile(password, "secret\n");
     chmod(password.c_str(), 0600);
-    Result r = S2s({"task", "add", "--task",
-                    TaskFile("{\"name\": \"t\", \"schedule_mode\": 2, \"pswd\": \"old\"}", 0600),
-                    "--server-ip", "10.0.0.1", "--user", "u", "--share", "docs", "--compress",
-                    "--password-file", password, "--json"});
+    Result r =
+        S2s({"task", "add", "--task",
+             TaskFile("{\"name\": \"t\", \"schedule_mode\": 2, \"pswd\": \"old\"}", 0600),
+             "--server-ip", "10.0.0.1", "--user", "u", "--share", "docs", "--compress",
+             "--max-delete", "20%", "--allow-empty-source", "--password-file", password, "--json"});
     EXPECT_EQ(r.status, 0) << r.All();
     EXPECT_EQ(nlohmann::json::parse(r.out)["task_id"], 7) << r.out;
     const S2S::PObject request = service.Requests().back();
@@ -423,6 +424,8 @@ TEST_F(CliTest, TaskAddSendsThePasswordBesideTheTask) {
     EXPECT_EQ(task["schedule_mode"].asInt32(), 2);
     EXPECT_EQ(task["server_ip"].asString(), "10.0.0.1");
     EXPECT_TRUE(task["compress"].asBool());
+    EXPECT_TRUE(task["allow_empty_source"].asBool());
+    EXPECT_EQ(task["max_delete"].asString(), "20%");
     EXPECT_EQ(task["share_list"][0U].asString(), "docs");
     // The password sources are those of s2s sync, with the same exit code.
     chmod(password.c_str(), 0644);
