@@ -274,6 +274,10 @@ TEST_F(CliTest, NextRunFollowsTheScheduleInLocalTime) {
     std::vector<std::string> args = daily9;
     args.push_back("--compatible");
     EXPECT_EQ(S2s(args, berlin).out, "Sun 2024-10-27 08:00:00 CET (in 10h00m)\n");
+    // A time the clocks skip is refused, not moved.
+    r = S2s({"next-run", "--at", "09:00", "--now", "2024-03-31 02:30"}, berlin);
+    EXPECT_EQ(r.status, 2) << r.All();
+    EXPECT_NE(r.err.find("does not exist in the local time zone"), std::string::npos) << r.err;
 }
 
 // The sync service's control socket below a host's root, answering each request with the next
