@@ -98,8 +98,9 @@ class S2S_EXPORT Rsyncer {
     // Receives the overall progress (0 to 100) of RunSync's transfers, on the caller's thread
     // while the run goes on; for progress displays. Commands and key transfers report none.
     void SetProgressCallback(const boost::function<void(int)>& fn) { progressCallback = fn; }
-    // The deletion limit of RunSync's transfers (rsync's own --max-delete; the run ends with 25
-    // when it is reached); negative, the default: no limit.
+    // The deletion limit of the next RunSync's transfer (rsync's own --max-delete; the run ends
+    // with 25 when it is reached); negative, the default: no limit. RunSync uses it up: the run
+    // after it has no limit unless one is set again.
     void SetMaxDelete(long long count) { maxDelete = count; }
     // A copy, with the server address TestServer settled on.
     SyncInfo GetSyncInfo() const { return syncInfo; }

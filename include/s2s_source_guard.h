@@ -5,12 +5,16 @@
 //   - the share's folder (what rsync reads) must exist;
 //   - its volume must be mounted (host.conf's [volumes] and the mount table decide, see
 //     VURNVolumeIsMounted in s2s_platform.h);
-//   - an empty folder is refused when the receiver's copy is not empty, unless an empty source is
-//     explicitly allowed;
+//   - a folder the copy would send no file from (it holds only empty folders, or only files the
+//     exclude rules leave out) is refused when the receiver's copy is not empty, unless an empty
+//     source is explicitly allowed;
 //   - with a deletion limit (a count, or a percentage of what the receiver's copy holds), a run
 //     that would delete more is refused before it deletes anything.
-// What the receiver holds is learnt from a dry run of the very data run (same source, destination
-// and exclude rules), made only when it is needed: for an empty folder, or when a limit is set.
+// What the copy would send and what the receiver holds are learnt from a dry run of the very data
+// run (same source, destination and exclude rules), made for every share unless an empty source is
+// allowed and no limit is set. The data run then carries a deletion limit of its own even when
+// none was asked for: the deletions that listing found, so a folder emptied between the check and
+// the copy cannot empty the receiver's copy (rsync stops deleting and the run ends with 25).
 // A refused share is not copied and must not be marked complete; the other shares are unaffected.
 #ifndef S2S_SOURCE_GUARD_H
 #define S2S_SOURCE_GUARD_H
@@ -42,7 +46,8 @@ struct S2S_EXPORT DeleteLimit {
     bool percent = false;  // `value` is a percentage of the entries the receiver's copy holds
     unsigned long long value = 0;
 
-    // "N" or "N%" (decimal digits only; a percentage at most 100). False with `error` set.
+    // "N" or "N%" (decimal digits only; a count at most INT_MAX, what rsync's --max-delete
+    // takes; a percentage at most 100). False with `error` set.
     static bool Parse(const std::string& text, DeleteLimit& limit, std::string& error);
     // The deletions allowed against a copy of `entries` entries (a percentage rounds down).
     unsigned long long Allowed(unsigned long long entries) const;
@@ -60,15 +65,16 @@ struct SourceState {
     std::string folder;  // what rsync reads (an encrypted share's encrypted directory)
     std::string volume;  // the volume's mount path; "" when the folder is missing
     bool folderExists = false;
-    bool folderEmpty = false;
+    bool folderEmpty = false;  // no regular file or link anywhere below the folder
     bool volumeMounted = false;
 };
 
 // What a dry run of the data run found on the receiver.
 struct ReceiverCopy {
-    bool known = false;                // a dry run was made
-    unsigned long long entries = 0;    // entries of the receiver's copy the run looks at
-    unsigned long long deletions = 0;  // entries the run would delete
+    bool known = false;                  // a dry run was made
+    unsigned long long entries = 0;      // entries of the receiver's copy the run looks at
+    unsigned long long deletions = 0;    // entries the run would delete
+    unsigned long long sourceFiles = 0;  // regular files and links the run's file list holds
 };
 
 struct SourceGuardReport {
@@ -89,7 +95,9 @@ S2S_EXPORT int InspectShareSource(const std::string& shareName, const ShareInfo&
 S2S_EXPORT bool NeedsReceiverCopy(const SourceState& source, const SourceGuardOptions& options);
 
 // The decision on the facts alone; `receiver` is consulted only when NeedsReceiverCopy says so
-// (then an unknown copy gives kCheckFailed). On kSafe, `allowedDeletions` holds the limit's count.
+// (then an unknown copy gives kCheckFailed; a known one decides whether the copy sends nothing).
+// On kSafe, `allowedDeletions` holds the limit's count, or without a limit the deletions the
+// receiver's copy was found to need.
 S2S_EXPORT SourceGuardReport JudgeShareSource(const std::string& shareName,
                                               const SourceState& source,
                                               const SourceGuardOptions& options,

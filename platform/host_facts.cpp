@@ -190,6 +190,17 @@ std::string StripSlashes(std::string path) {
     return path;
 }
 
+// A volume as host.conf lists it, compared with resolved paths: a listed path reached through a
+// symbolic link names the directory it leads to. One that cannot be resolved is taken as written.
+std::string ListedVolume(const std::string& listed) {
+    std::string path = StripSlashes(listed);
+    char resolved[PATH_MAX];
+    if (!path.empty() && path[0] == '/' && realpath(path.c_str(), resolved) != nullptr) {
+        path = resolved;
+    }
+    return path;
+}
+
 // A [volumes] value: "internal" or "external", optionally followed by ",directory" for a volume
 // that is a plain directory of a larger file system rather than a mount point of its own.
 bool ParseVolumeValue(const std::string& value, int& type, bool& directory) {
@@ -425,7 +436,7 @@ int VolumePathParseEx(const char* path, VURNVolumeRecord* volume) {
         // of a larger file system.
         std::string listed_type;
         for (const auto& pair : conf.SectionPairs("volumes")) {
-            std::string vol = StripSlashes(pair.first);
+            std::string vol = ListedVolume(pair.first);
             if (!vol.empty() && vol[0] == '/' && Contains(vol, real) && vol.size() >= best.size()) {
                 best = vol;
                 device.clear();
@@ -437,7 +448,7 @@ int VolumePathParseEx(const char* path, VURNVolumeRecord* volume) {
             return Fail(VLIB_ERR_NOT_FOUND);
         }
         for (const auto& pair : conf.SectionPairs("volumes")) {
-            if (StripSlashes(pair.first) == best) {
+            if (ListedVolume(pair.first) == best) {
                 listed_type = s2s_platform::Trim(pair.second);
             }
         }
@@ -495,7 +506,8 @@ int VURNVolumeIsMounted(const char* volumePath) {
         // A listed volume is a mount path unless it says it is a directory; one that is not
         // listed was found in the mount table and is gone from it now.
         for (const auto& pair : conf.SectionPairs("volumes")) {
-            if (StripSlashes(pair.first) != StripSlashes(volumePath)) {
+            if (StripSlashes(pair.first) != StripSlashes(volumePath) &&
+                ListedVolume(pair.first) != volume) {
                 continue;
             }
             int type = 0;

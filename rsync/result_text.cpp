@@ -35,7 +35,9 @@ const ResultInfo kResultTable[] = {
     {22, "out-of-memory", "rsync ran out of memory"},
     {23, "partial", "some files could not be transferred"},
     {24, "vanished", "some source files vanished during the transfer"},
-    {25, "max-delete", "the deletion limit stopped deletions"},
+    {25, "max-delete",
+     "the deletion limit stopped deletions (more files were gone than the check before the "
+     "copy found)"},
     {30, "timeout", "the transfer stalled past its time limit"},
     {35, "connect-timeout", "the server's rsync daemon did not answer in time"},
     {42, "no-address", "no address of the server could be looked up"},

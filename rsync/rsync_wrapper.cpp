@@ -32,7 +32,10 @@ constexpr const char* kDefaultLogFile = "/var/log/s2s_rsync.log";
 constexpr const char* kDefaultRemoteConfig = "/usr/vurn/etc/s2s_rsyncd.conf";
 constexpr const char* kKeyModule = "@s2s-key";
 constexpr size_t kKeptErrorLines = 8;
-constexpr int kRsyncVanished = 24;  // rsync: some source files vanished during the run
+constexpr int kRsyncVanished = 24;     // rsync: some source files vanished during the run
+constexpr int kRsyncDeleteLimit = 25;  // rsync: the --max-delete limit stopped deletions
+// What rsync prints when --max-delete stopped deletions; a push to a daemon still ends with 0.
+constexpr const char kDeletionsStopped[] = "Deletions stopped due to --max-delete limit";
 // Marks the lines of a dry run's entries in rsync's merged output, apart from its messages.
 constexpr const char kItemPrefix[] = "s2s-item:";
 
@@ -373,6 +376,7 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
                             bool commandRun) {
     std::list<std::string> errors;
     bool unknownCommandModule = false;
+    bool deletionsStopped = false;
     int lastPercent = -1;
     const std::string unknownModule = "Unknown module '" + commandModule + "'";
     auto sink = [&](const std::string& raw) {
@@ -403,6 +407,9 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
         }
         if (commandRun && line.find(unknownModule) != std::string::npos) {
             unknownCommandModule = true;
+        }
+        if (line.compare(0, sizeof(kDeletionsStopped) - 1, kDeletionsStopped) == 0) {
+            deletionsStopped = true;
         }
         errors.push_back(line);
         if (errors.size() > kKeptErrorLines) {
@@ -442,6 +449,12 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
         if (unknownCommandModule) {
             return kResultNoCommands;
         }
+    }
+    if (deletionsStopped && (outcome.exit_code == 0 || outcome.exit_code == kRsyncVanished)) {
+        Logger::LogMsg(Logger::Error,
+                       "[ERROR] rsync_wrapper.cpp(%d): the deletion limit stopped deletions\n",
+                       __LINE__);
+        return kRsyncDeleteLimit;
     }
     // rsync's overall figure is the share of the tree's bytes it moved: a run that sends little
     // (or rounds its last report down) ends below 100, yet it went through the whole tree. Files

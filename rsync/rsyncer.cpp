@@ -138,6 +138,9 @@ int Rsyncer::StartSyncShare(const std::string& shareName, int& result) {
 int Rsyncer::RunSync(unsigned long long /*id*/, const std::string& shareName,
                      const std::string& relPath, const std::list<std::string>& excludes,
                      int& result) {
+    // The limit belongs to this run alone; the next one starts without it.
+    const long long limit = maxDelete;
+    maxDelete = -1;
     ShareInfo info;
     if (GetShareInfo(shareName, info) < 0) {
         Logger::LogMsg(Logger::Error, "[ERROR] s2s_rsyncer.cpp(%d): Fail to get share info\n",
@@ -153,7 +156,7 @@ int Rsyncer::RunSync(unsigned long long /*id*/, const std::string& shareName,
     if (progressCallback) {
         task.setProgressCallback(progressCallback);
     }
-    task.SetMaxDelete(maxDelete);
+    task.SetMaxDelete(limit);
 
     std::string src;
     if (relPath == "/") {

@@ -6,8 +6,10 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <climits>
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include "s2s_logger.h"
 #include "s2s_platform.h"
@@ -16,33 +18,65 @@ namespace S2S {
 
 namespace {
 
-// Well above any real tree; keeps the arithmetic of a percentage clear of overflow.
-constexpr unsigned long long kMaxDeleteCount = 1000000000000ULL;
+// rsync's --max-delete takes an int: a larger count would fail every copy.
+constexpr unsigned long long kMaxDeleteCount = INT_MAX;
 constexpr int kRsyncVanished = 24;
 
 std::string Entries(unsigned long long n) {
     return std::to_string(n) + (n == 1 ? " entry" : " entries");
 }
 
-// 1 when the directory holds nothing, 0 when it holds something, -1 when it cannot be read.
-int IsEmptyDir(const std::string& path) {
-    DIR* dir = opendir(path.c_str());
-    if (dir == nullptr) {
-        return -1;
-    }
-    int empty = 1;
-    errno = 0;
-    while (struct dirent* entry = readdir(dir)) {
-        if (std::strcmp(entry->d_name, ".") != 0 && std::strcmp(entry->d_name, "..") != 0) {
-            empty = 0;
-            break;
+bool IsContent(unsigned char type) {
+    return type == DT_REG || type == DT_LNK;
+}
+
+// 1 when no regular file or link lies anywhere below `path` (empty folders, such as a recycle
+// bin's, hold nothing a copy would keep), 0 when one does, -1 when a folder cannot be read. The
+// walk ends at the first file found; links are not followed.
+int HoldsNoFiles(const std::string& path) {
+    std::vector<std::string> folders{path};
+    while (!folders.empty()) {
+        const std::string folder = folders.back();
+        folders.pop_back();
+        DIR* dir = opendir(folder.c_str());
+        if (dir == nullptr) {
+            return -1;
+        }
+        int found = 0;
+        errno = 0;
+        while (struct dirent* entry = readdir(dir)) {
+            if (std::strcmp(entry->d_name, ".") == 0 || std::strcmp(entry->d_name, "..") == 0) {
+                continue;
+            }
+            const std::string child = folder + "/" + entry->d_name;
+            unsigned char type = entry->d_type;
+            struct stat st;
+            if (type == DT_UNKNOWN && lstat(child.c_str(), &st) == 0) {
+                type = S_ISDIR(st.st_mode)   ? DT_DIR
+                       : S_ISREG(st.st_mode) ? DT_REG
+                       : S_ISLNK(st.st_mode) ? DT_LNK
+                                             : DT_UNKNOWN;
+            }
+            if (IsContent(type)) {
+                found = 1;
+                break;
+            }
+            if (type == DT_DIR) {
+                folders.push_back(child);
+            }
+            errno = 0;
+        }
+        const int saved = errno;
+        closedir(dir);
+        if (found == 1) {
+            return 0;
+        }
+        if (saved != 0) {
+            errno = saved;
+            return -1;
         }
     }
-    if (empty == 1 && errno != 0) {
-        empty = -1;
-    }
-    closedir(dir);
-    return empty;
+    return 1;
 }
 
 SourceGuardReport Refuse(SourceGuardResult result, const std::string& message) {
@@ -78,15 +112,19 @@ bool DeleteLimit::Parse(const std::string& text, DeleteLimit& limit, std::string
     if (percent) {
         digits.pop_back();
     }
-    if (digits.empty() || digits.size() > 13 ||
-        digits.find_first_not_of("0123456789") != std::string::npos) {
+    if (digits.empty() || digits.find_first_not_of("0123456789") != std::string::npos) {
         error = "deletion limit '" + text + "' is not a number of files (N) or a percentage (N%)";
         return false;
     }
-    const unsigned long long value = std::stoull(digits);
+    const size_t first = digits.find_first_not_of('0');
+    const unsigned long long value = first == std::string::npos ? 0
+                                     : digits.size() - first > 18
+                                         ? ULLONG_MAX
+                                         : std::stoull(digits.substr(first));
     if ((percent && value > 100) || value > kMaxDeleteCount) {
         error = "deletion limit '" + text + "' is out of range" +
-                (percent ? " (a percentage is at most 100%)" : "");
+                (percent ? std::string(" (a percentage is at most 100%)")
+                         : " (at most " + std::to_string(kMaxDeleteCount) + ")");
         return false;
     }
     limit.set = true;
@@ -136,7 +174,7 @@ int InspectShareSource(const std::string& shareName, const ShareInfo& info, Sour
         return -1;
     }
     state.volumeMounted = mounted == 1;
-    const int empty = IsEmptyDir(state.folder);
+    const int empty = HoldsNoFiles(state.folder);
     if (empty < 0) {
         const int saved = errno;
         Logger::LogMsg(Logger::Error, "[ERROR] source_guard.cpp(%d): Fail to read '%s': %s\n",
@@ -151,7 +189,10 @@ bool NeedsReceiverCopy(const SourceState& source, const SourceGuardOptions& opti
     if (!source.folderExists || !source.volumeMounted) {
         return false;
     }
-    return (source.folderEmpty && !options.allowEmptySource) || options.maxDelete.set;
+    // Whether the copy would send no file only its file list tells (exclude rules apply), and the
+    // deletions it is allowed come from the same listing: it is made unless emptiness is allowed
+    // and nothing limits the deletions.
+    return !options.allowEmptySource || options.maxDelete.set;
 }
 
 SourceGuardReport JudgeShareSource(const std::string& shareName, const SourceState& source,
@@ -159,6 +200,8 @@ SourceGuardReport JudgeShareSource(const std::string& shareName, const SourceSta
                                    const ReceiverCopy& receiver) {
     const std::string share = "share '" + shareName + "'";
     const std::string kept = "; nothing was copied or deleted";
+    // The dry run's file list is what the copy sends; without one the local walk answers.
+    const bool sendsNothing = receiver.known ? receiver.sourceFiles == 0 : source.folderEmpty;
     SourceGuardReport report;
     if (!source.folderExists) {
         report = Refuse(SourceGuardResult::kFolderMissing,
@@ -173,10 +216,11 @@ SourceGuardReport JudgeShareSource(const std::string& shareName, const SourceSta
     } else if (NeedsReceiverCopy(source, options) && !receiver.known) {
         report = Refuse(SourceGuardResult::kCheckFailed,
                         share + ": what the receiver holds could not be learnt" + kept);
-    } else if (source.folderEmpty && !options.allowEmptySource && receiver.deletions > 0) {
+    } else if (sendsNothing && !options.allowEmptySource && receiver.deletions > 0) {
         report = Refuse(SourceGuardResult::kEmptySource,
                         share + ": its folder " + source.folder +
-                            " is empty while the receiver's copy holds " +
+                            " holds no file to copy (empty folders and excluded files do not "
+                            "count) while the receiver's copy holds " +
                             Entries(receiver.deletions) + ", which the run would delete" + kept);
     } else if (options.maxDelete.set &&
                receiver.deletions > options.maxDelete.Allowed(receiver.entries)) {
@@ -192,6 +236,10 @@ SourceGuardReport JudgeShareSource(const std::string& shareName, const SourceSta
     if (report.result == SourceGuardResult::kSafe && options.maxDelete.set) {
         report.allowedDeletions =
             static_cast<long long>(options.maxDelete.Allowed(receiver.entries));
+    } else if (report.result == SourceGuardResult::kSafe && receiver.known) {
+        // No limit asked for: the copy may still delete no more than the listing found, so a
+        // folder emptied after the check cannot empty the receiver's copy.
+        report.allowedDeletions = static_cast<long long>(receiver.deletions);
     }
     report.source = source;
     report.receiver = receiver;
@@ -214,11 +262,18 @@ int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
     task.SetSyncACL(true);
     unsigned long long entries = 0;
     unsigned long long deletions = 0;
+    unsigned long long files = 0;
     task.setDryRun([&](const std::string& change, const std::string& path) {
         if (change == "*deleting") {
             ++deletions;
             ++entries;
-        } else if (path != "./" && change.find("+++++++++") == std::string::npos) {
+            return;
+        }
+        // "YXcstpoguax": X is the entry's type, 'f' a regular file, 'L' a link.
+        if (change.size() > 1 && (change[1] == 'f' || change[1] == 'L')) {
+            ++files;
+        }
+        if (path != "./" && change.find("+++++++++") == std::string::npos) {
             ++entries;  // there on both sides
         }
     });
@@ -227,6 +282,7 @@ int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
         copy.known = true;
         copy.entries = entries;
         copy.deletions = deletions;
+        copy.sourceFiles = files;
     }
     return 0;
 }

@@ -8,9 +8,6 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 bash tools/deps.sh
-if ! command -v gcovr >/dev/null; then
-  DEBIAN_FRONTEND=noninteractive apt-get install -y -qq --no-install-recommends gcovr >/dev/null
-fi
 dir=${S2S_COV_DIR:-build-cov}
 cmake -S . -B "$dir" -G Ninja -DCMAKE_BUILD_TYPE=Debug -DS2S_BENCH=OFF \
   -DCMAKE_C_FLAGS=--coverage -DCMAKE_CXX_FLAGS=--coverage \

@@ -1,11 +1,12 @@
 #!/usr/bin/env bash
-# Installs the Debian packages the build, the tests and the demo need, only when one is missing.
+# Installs the Debian packages the build, the tests, the demo and the coverage report need, only when one is missing.
 set -euo pipefail
 packages=(
   build-essential cmake ninja-build g++ pkg-config clang clang-format libclang-rt-14-dev
   libgtest-dev libgmock-dev libbenchmark-dev libssl-dev openssl libboost-dev libmsgpack-cxx-dev
   rsync openssh-server openssh-client sshpass procps iproute2 util-linux nlohmann-json3-dev libcli11-dev tzdata
   libsqlite3-dev
+  gcovr
 )
 missing=()
 for p in "${packages[@]}"; do

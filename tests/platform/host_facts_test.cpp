@@ -231,6 +231,14 @@ TEST_F(HostFacts, HostFileNamesVolumesAndTheirType) {
     // A listed volume is a mount path: a plain directory there is a volume that is not mounted.
     EXPECT_EQ(VURNVolumeIsMounted(volume.c_str()), 0);
     EXPECT_EQ(VURNVolumeIsMounted("/proc"), 1);
+    // Listed through a symbolic link, it is the same volume, still not mounted.
+    const std::string link = root_ / "vlink";
+    ASSERT_EQ(symlink(volume.c_str(), link.c_str()), 0);
+    WriteHostConf("[volumes]\n\t" + link + "=\"external\"\n");
+    ASSERT_EQ(VolumePathParseEx((link + "/share").c_str(), &rec), 0);
+    EXPECT_EQ(std::string(rec.path), volume);
+    EXPECT_EQ(rec.type, VURN_VOLUME_TYPE_EXTERNAL);
+    EXPECT_EQ(VURNVolumeIsMounted(rec.path), 0);
 
     WriteHostConf("[volumes]\n\t" + volume + "=\"external, directory\"\n");
     ASSERT_EQ(VolumePathParseEx(share.c_str(), &rec), 0);

@@ -175,8 +175,9 @@ TEST_F(WrapperTest, DataRunsKeepMetadataAndFollowChanges) {
         SetMtime(src + p, 1500000000);
     }
 
-    auto run = [&]() {
+    auto run = [&](long long maxDelete = -1, int expected = 0) {
         RsyncWrapper w;
+        w.setMaxDelete(maxDelete);
         w.setDelete(true);
         w.setNumericIds(true);
         w.setVurnPseudoRoot(true);
@@ -185,7 +186,7 @@ TEST_F(WrapperTest, DataRunsKeepMetadataAndFollowChanges) {
         w.setSrcPath(src + "/");
         server_->Aim(w, "photos");
         int rc = w.execute(boost::function<bool()>());
-        EXPECT_EQ(rc, 0) << w.lastError();
+        EXPECT_EQ(rc, expected) << w.lastError();
     };
     run();
     auto expected = Snapshot(src);
@@ -213,6 +214,12 @@ TEST_F(WrapperTest, DataRunsKeepMetadataAndFollowChanges) {
     EXPECT_EQ(got.count("/keep.tmp"), 1u);
     got.erase("/keep.tmp");
     EXPECT_EQ(got, expected);
+
+    // A daemon ends a push whose deletions the limit stopped with 0; the run still reports 25.
+    unlink((src + "/new.txt").c_str());
+    unlink((src + "/plain.txt").c_str());
+    run(1, 25);
+    EXPECT_EQ(Snapshot(server_->SharePath("photos")).size(), got.size());  // one of the two stays
 }
 
 // A file rewritten with the same size within the second of the previous run, and a folder whose

@@ -46,6 +46,7 @@ TEST_F(CliTest, CommandLinesAndTheirExitCodes) {
     struct Case {
         std::vector<std::string> args;
         int status;
+        std::string message = "";  // in the error output when given
     };
     const std::vector<Case> cases = {
         {{"--help"}, 0},
@@ -63,20 +64,23 @@ TEST_F(CliTest, CommandLinesAndTheirExitCodes) {
         {{"help", "task", "update"}, 0},
         {{}, 2},
         {{"frobnicate"}, 2},
+        {{"help", "frobnicate"}, 2, "unknown command 'frobnicate'"},
         {{"share"}, 2},
         {{"task", "frobnicate"}, 2},
         {{"sync", "--no-such-option"}, 2},
         {{"sync", "extra"}, 2},
         {{"sync", "--ssh-port", "70000", "--share", "a"}, 2},
         {{"sync", "--ssh-port", "0x10", "--share", "a"}, 2},
-        {{"sync", "--ssh-port"}, 2},
-        {{"sync", "--compress=1"}, 2},
-        {{"sync", "--compress", "--compress"}, 2},
+        {{"sync", "--ssh-port"}, 2, "option '--ssh-port' needs a value (PORT)"},
+        {{"sync", "--compress=1"}, 2, "option '--compress' takes no value"},
+        {{"sync", "--compress", "--compress"}, 2, "option '--compress' given more than once"},
+        {{"next-run", "--at=", "--count", "2"}, 2, "option '--at' needs a value"},
         {{"sync", "--task", "a.json", "--task", "b.json"}, 2},
         {{"sync", "--task", "a.json", "--server", "x"}, 2},
         {{"next-run", "--mode", "Weekly"}, 2},
         {{"next-run", "--at", "24:00"}, 2},
         {{"task", "show"}, 2},
+        {{"task", "check", "sync"}, 3, "task file 'sync'"},
         {{"task", "remove", "x1"}, 2},
         {{"task", "run", "1", "2"}, 2},
         {{"task", "update", "1"}, 2},
@@ -89,6 +93,7 @@ TEST_F(CliTest, CommandLinesAndTheirExitCodes) {
         const Result r = S2s(c.args);
         const std::string line = c.args.empty() ? "(none)" : c.args[0] + " ...";
         EXPECT_EQ(r.status, c.status) << line << " " << r.All();
+        EXPECT_NE(r.err.find(c.message), std::string::npos) << line << " " << r.err;
         if (c.status == 0 && c.args.size() > 0 && c.args[0] != "--version") {
             EXPECT_NE(r.out.find("Usage: s2s"), std::string::npos) << line << " " << r.out;
         }
@@ -147,7 +152,9 @@ TEST_F(CliTest, TaskFilesAreCheckedStrictly) {
         {"{\"ssh_port\": 4294967296}", "key \"ssh_port\" must be a whole number"},
         {"{\"schedule_mode\": 2.5}", "key \"schedule_mode\" must be a whole number"},
         {"{\"compress\": 2}", "key \"compress\" must be true, false, 1 or 0"},
+        {"{\"week_schd\": \"01111102\"}", "key \"week_schd\" must be seven '0'/'1'"},
         {"{\"max_delete\": \"20%%\"}", "key \"max_delete\": deletion limit"},
+        {"{\"max_delete\": \"2147483648\"}", "'2147483648' is out of range (at most 2147483647)"},
         {"{\"share_list\": [\"a\", 1]}", "every entry must be a string"},
         {"{\"name\": \"a\", \"name\": \"b\"}", "key \"name\" appears more than once"},
         {"[1, 2]", "one JSON object"},
@@ -218,6 +225,9 @@ TEST_F(CliTest, ShareRegistryRoundTrip) {
     r = S2s({"share", "list", "--json"});
     EXPECT_NE(r.out.find("\"encrypted\": true"), std::string::npos) << r.out;
 
+    // A share may be called like a command.
+    EXPECT_EQ(S2s({"share", "add", "list", "--path", host_.SharePath("docs")}).status, 0);
+    EXPECT_EQ(S2s({"share", "remove", "list"}).status, 0);
     EXPECT_EQ(S2s({"share", "remove", "docs"}).status, 0);
     EXPECT_EQ(S2s({"share", "remove", "docs"}).status, 11);
     EXPECT_TRUE(IsPathThere(host_.SharePath("docs")));  // the files stay
@@ -271,6 +281,10 @@ TEST_F(CliTest, NextRunFollowsTheScheduleInLocalTime) {
     std::vector<std::string> args = daily9;
     args.push_back("--compatible");
     EXPECT_EQ(S2s(args, berlin).out, "Sun 2024-10-27 08:00:00 CET (in 10h00m)\n");
+    // A time the clocks skip is refused, not moved.
+    r = S2s({"next-run", "--at", "09:00", "--now", "2024-03-31 02:30"}, berlin);
+    EXPECT_EQ(r.status, 2) << r.All();
+    EXPECT_NE(r.err.find("does not exist in the local time zone"), std::string::npos) << r.err;
 }
 
 // The sync service's control socket below a host's root, answering each request with the next
@@ -405,10 +419,11 @@ TEST_F(CliTest, TaskAddSendsThePasswordBesideTheTask) {
     const std::string password = host_.Root() + "/pw";
     WriteFile(password, "secret\n");
     chmod(password.c_str(), 0600);
-    Result r = S2s({"task", "add", "--task",
-                    TaskFile("{\"name\": \"t\", \"schedule_mode\": 2, \"pswd\": \"old\"}", 0600),
-                    "--server-ip", "10.0.0.1", "--user", "u", "--share", "docs", "--compress",
-                    "--password-file", password, "--json"});
+    Result r =
+        S2s({"task", "add", "--task",
+             TaskFile("{\"name\": \"t\", \"schedule_mode\": 2, \"pswd\": \"old\"}", 0600),
+             "--server-ip", "10.0.0.1", "--user", "u", "--share", "docs", "--compress",
+             "--max-delete", "20%", "--allow-empty-source", "--password-file", password, "--json"});
     EXPECT_EQ(r.status, 0) << r.All();
     EXPECT_EQ(nlohmann::json::parse(r.out)["task_id"], 7) << r.out;
     const S2S::PObject request = service.Requests().back();
@@ -420,6 +435,8 @@ TEST_F(CliTest, TaskAddSendsThePasswordBesideTheTask) {
     EXPECT_EQ(task["schedule_mode"].asInt32(), 2);
     EXPECT_EQ(task["server_ip"].asString(), "10.0.0.1");
     EXPECT_TRUE(task["compress"].asBool());
+    EXPECT_TRUE(task["allow_empty_source"].asBool());
+    EXPECT_EQ(task["max_delete"].asString(), "20%");
     EXPECT_EQ(task["share_list"][0U].asString(), "docs");
     // The password sources are those of s2s sync, with the same exit code.
     chmod(password.c_str(), 0644);

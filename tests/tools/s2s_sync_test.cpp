@@ -160,7 +160,8 @@ TEST_F(SyncScenario, ReceiverRestartedMidTransferThenResyncedToCompletion) {
 }
 
 // An emptied folder would empty the receiver's copy: the share is refused, the other share still
-// syncs, and only an explicit override lets the emptiness through.
+// syncs, and only an explicit override lets the emptiness through. Empty folders and excluded
+// files leave nothing to copy either.
 TEST_F(SyncScenario, EmptiedFolderIsRefusedUnlessAllowed) {
     GenerateFiles(sender_->SharePath("docs"), 20, 100, 9);
     GenerateFiles(sender_->SharePath("media"), 2, 100, 10);
@@ -173,6 +174,10 @@ TEST_F(SyncScenario, EmptiedFolderIsRefusedUnlessAllowed) {
     WriteFile(sender_->SharePath("media") + "/new", "new");
     r = sender_->Sync(kUser, {"docs", "media"}, {"--json"});
     EXPECT_EQ(r.status, 12) << r.All();
+    MakeDirs(sender_->SharePath("docs") + "/#recycle/old");
+    WriteFile(sender_->SharePath("docs") + "/.DS_Store", "x");
+    EXPECT_EQ(sender_->Sync(kUser, {"docs"}, {"--exclude", ".DS_Store"}).status, 12);
+    unlink((sender_->SharePath("docs") + "/.DS_Store").c_str());
     EXPECT_NE(r.out.find("\"guard\": \"empty-source\""), std::string::npos) << r.out;
     EXPECT_NE(r.out.find("\"would_delete\": 20"), std::string::npos) << r.out;
     EXPECT_NE(r.err.find("--allow-empty-source"), std::string::npos) << r.err;

@@ -91,7 +91,9 @@ bool ParseDate(const std::string& text, int& year, int& month, int& day) {
     return true;
 }
 
-bool ParseNow(const std::string& text, long& now) {
+// `skipped` tells a well-formed local time that does not exist in the local time zone.
+bool ParseNow(const std::string& text, long& now, bool& skipped) {
+    skipped = false;
     unsigned long long seconds = 0;
     if (!text.empty() && text[0] == '@') {
         if (!ParseUnsigned(text.substr(1), 253402300799ULL, seconds)) {
@@ -121,10 +123,24 @@ bool ParseNow(const std::string& text, long& now) {
     tm.tm_hour = hour;
     tm.tm_min = minute;
     tm.tm_sec = static_cast<int>(second);
+    const struct tm asked = tm;
     tm.tm_isdst = -1;
-    const time_t t = mktime(&tm);
+    time_t t = mktime(&tm);
     if (t < 0 || tm.tm_mday != day) {
         return false;
+    }
+    // A time the clocks skip (the hour lost when they go forward) comes back moved by mktime.
+    if (tm.tm_hour != hour || tm.tm_min != minute) {
+        skipped = true;
+        return false;
+    }
+    // A time the clocks repeat is its first occurrence, in daylight-saving time.
+    struct tm summer = asked;
+    summer.tm_isdst = 1;
+    const time_t first = mktime(&summer);
+    if (first >= 0 && first < t && summer.tm_mday == day && summer.tm_hour == hour &&
+        summer.tm_min == minute) {
+        t = first;
     }
     now = static_cast<long>(t);
     return true;
@@ -251,9 +267,14 @@ int RunNextRunCommand(const Options& opts) {
         return Fail(kExitUsage, error);
     }
     long now = static_cast<long>(time(nullptr));
-    if (opts.Has("now") && !ParseNow(opts.Get("now"), now)) {
-        return Fail(kExitUsage, "--now '" + opts.Get("now") +
-                                    "' is neither YYYY-MM-DD HH:MM[:SS] nor @SECONDS");
+    bool skipped = false;
+    if (opts.Has("now") && !ParseNow(opts.Get("now"), now, skipped)) {
+        return Fail(kExitUsage,
+                    "--now '" + opts.Get("now") +
+                        (skipped ? "' does not exist in the local time zone (the clocks skip it "
+                                   "when they go forward); give a time outside the skipped hour or "
+                                   "@SECONDS"
+                                 : "' is neither YYYY-MM-DD HH:MM[:SS] nor @SECONDS"));
     }
     unsigned long long count = 1;
     if (opts.Has("count") && (!opts.GetUnsigned("count", 1000, count, error) || count == 0)) {
@@ -273,15 +294,17 @@ int RunNextRunCommand(const Options& opts) {
             schedule,
             compatible ? &S2S::Schedule::GetNextScheduledSeconds : &S2S::Schedule::NextRunAfter,
             now, count, times)) {
-        return Fail(kExitInvalidTask, "the next run cannot be computed (see the error above)");
+        return Fail(kExitInternal, "the next run cannot be computed (see the error above)");
     }
     // Where the compatible arithmetic disagrees on the runs shown, say so: other front ends show
-    // its times.
+    // its times. Its own failures are not this answer's: they stay out of the output.
     std::vector<long> other;
+    SetupLogging(-1);
     const bool differs =
         !compatible &&
         NextRuns(schedule, &S2S::Schedule::GetNextScheduledSeconds, now, count, other) &&
         other != times;
+    SetupLogging(0);
     nlohmann::json runs = nlohmann::json::array();
     for (const long next : times) {
         runs.push_back({{"time", LocalTime(next)}, {"epoch", next}, {"in_seconds", next - now}});

@@ -44,6 +44,10 @@ const std::vector<OptionSpec> kTaskFieldOptions = {
     {"no-ssh", "", false, "reach the server's rsync daemon directly"},
     {"ssh-port", "PORT", false, "the server's SSH port (also used for encryption keys)"},
     {"max-bandwidth", "N", false, "the bandwidth limit handed to rsync (0: none)"},
+    {"allow-empty-source", "", false, "sync an empty share folder even over a full copy"},
+    {"no-allow-empty-source", "", false, "refuse an empty share folder over a full copy"},
+    {"max-delete", "N|N%", false, "refuse a share's run that would delete more than N (or N%)"},
+    {"no-max-delete", "", false, "no deletion limit"},
     {"password-file", "FILE", false, "read the password from FILE (mode 600; - for stdin)"},
 };
 
@@ -120,7 +124,8 @@ bool ApplyFieldOptions(const Options& opts, S2S::PObject& map, std::string& erro
         const char* key;
     } kBits[] = {{"compress", "no-compress", "compress"},
                  {"block-level", "no-block-level", "block"},
-                 {"ssh", "no-ssh", "ssh"}};
+                 {"ssh", "no-ssh", "ssh"},
+                 {"allow-empty-source", "no-allow-empty-source", "allow_empty_source"}};
     for (const auto& bit : kBits) {
         if (opts.Has(bit.on) && opts.Has(bit.off)) {
             error = std::string("--") + bit.on + " and --" + bit.off + " contradict each other";
@@ -142,6 +147,20 @@ bool ApplyFieldOptions(const Options& opts, S2S::PObject& map, std::string& erro
             return false;
         }
         map["max_bandwidth"] = static_cast<unsigned int>(value);
+    }
+    if (opts.Has("max-delete") && opts.Has("no-max-delete")) {
+        error = "--max-delete and --no-max-delete contradict each other";
+        return false;
+    }
+    if (opts.Has("max-delete")) {
+        S2S::DeleteLimit limit;
+        if (!S2S::DeleteLimit::Parse(opts.Get("max-delete"), limit, error)) {
+            error = "--max-delete: " + error;
+            return false;
+        }
+        map["max_delete"] = limit.ToString();
+    } else if (opts.Has("no-max-delete")) {
+        map.asMap().erase("max_delete");
     }
     return true;
 }

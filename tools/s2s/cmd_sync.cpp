@@ -27,7 +27,7 @@ namespace s2s_cli {
 namespace {
 
 const std::vector<OptionSpec> kSyncOptions = {
-    {"task", "FILE", false, "the task file (JSON task map); replaces the task options below"},
+    {"task", "FILE", false, "the task file (JSON task map); replaces --name to --max-bandwidth"},
     {"name", "NAME", false, "the task's name (default \"cli\")"},
     {"id", "N", false, "the task's id (default 0)"},
     {"server", "HOST", false, "the receiving server's host name"},

@@ -39,7 +39,7 @@ const char kTaskHelp[] =
     "\"ssh\", \"ssh_port\", \"max_bandwidth\", \"schedule_mode\", \"schedule_begin_year\",\n"
     "\"schedule_begin_month\", \"schedule_begin_day\", \"schedule_begin_hour\",\n"
     "\"schedule_begin_min\", \"week_schd\", \"period_hour\", \"period_minute\",\n"
-    "\"repeat_times_in_day\". See docs/cli.md.\n";
+    "\"repeat_times_in_day\", \"allow_empty_source\", \"max_delete\". See docs/cli.md.\n";
 
 const std::vector<OptionSpec> kCheckOptions = {{"help", "", false, "show this help"}};
 
@@ -66,13 +66,19 @@ std::vector<Command> TaskFileCommands() {
 
 int ShowTaskFile(const std::string& path) {
     S2S::SyncTask task;
+    S2S::SourceGuardOptions guard;
     bool has_password = false;
     std::string error;
-    if (!LoadTask(path, task, has_password, error)) {
+    if (!LoadTask(path, task, guard, has_password, error)) {
         return Fail(kExitInvalidTask, error);
     }
     std::ostringstream text;
     text << task;
+    // The guards are the task file's own keys, beside the sync model's task map.
+    text << "\n<Source Guards>\n"
+         << "allow_empty_source: ... " << (guard.allowEmptySource ? "yes" : "no") << "\n"
+         << "max_delete: ........... "
+         << (guard.maxDelete.set ? guard.maxDelete.ToString() : std::string("none"));
     std::printf("%s\n", text.str().c_str());
     return kExitOK;
 }

@@ -1,3 +1,4 @@
+// The command tree of `s2s` on CLI11 (see command_line.h).
 #include "tools/s2s/command_line.h"
 
 #include <CLI/CLI.hpp>
@@ -95,6 +96,52 @@ const CLI::App* Reached(const CLI::App& root) {
     return app;
 }
 
+std::vector<CLI::App*> Children(CLI::App* app) {
+    return app->get_subcommands([](CLI::App*) { return true; });
+}
+
+// "unknown share command 'x' (add, remove, list)"
+std::string UnknownCommand(const CLI::App* node, const CLI::App* root, const std::string& word) {
+    const std::string group = node == root ? "" : node->get_name() + " ";
+    std::string known;
+    for (const CLI::App* command : node->get_subcommands({})) {
+        known += (known.empty() ? "" : ", ") + command->get_name();
+    }
+    return "unknown " + group + "command '" + word + "' (" + known + ")";
+}
+
+// The parser's messages about one option, in the words the rest of the program uses; others are
+// returned as they are.
+std::string OptionMessage(const CLI::App* reached, const std::string& what) {
+    auto named = [&](size_t end) {
+        std::string name = what.substr(0, end);
+        name.erase(0, name.find_first_not_of('-'));
+        const CLI::Option* option = reached->get_option_no_throw("--" + name);
+        return std::make_pair("option '--" + name + "'", option);
+    };
+    size_t at = what.find(" was given a disallowed flag override");
+    if (at != std::string::npos) {
+        return named(at).first + " takes no value";
+    }
+    at = what.find(": At Most ");
+    if (at != std::string::npos) {
+        return named(at).first + " given more than once";
+    }
+    at = what.find(": ");
+    if (at != std::string::npos && what.size() > 8 &&
+        what.compare(what.size() - 8, 8, " missing") == 0 &&
+        what.find(" required ", at) != std::string::npos) {
+        const auto option = named(at);
+        return option.first + " needs a value" +
+               (option.second != nullptr ? " (" + option.second->get_type_name() + ")" : "");
+    }
+    at = what.find(": ");
+    if (at != std::string::npos && what.find("out of range") != std::string::npos) {
+        return named(at).first + ": the value is out of range";
+    }
+    return what;
+}
+
 }  // namespace
 
 struct CommandLine::Impl {
@@ -145,8 +192,40 @@ void CommandLine::AddCommand(CLI::App* parent, const Command& command) {
     // Arguments that are not options are collected for the command to judge, so it can say what
     // it expected.
     app->add_option("args", impl_->positional[app]);
+    // Once a command is chosen, later words are its arguments, never another command: a share
+    // may be called "list", a task file "sync".
+    app->preparse_callback([app](std::size_t) {
+        for (CLI::App* up = app->get_parent(); up != nullptr; up = up->get_parent()) {
+            for (CLI::App* other : Children(up)) {
+                if (other->count() == 0) {
+                    other->disabled();
+                }
+            }
+        }
+    });
     impl_->pages[app].command = owned.get();
     impl_->commands[app] = std::move(owned);
+}
+
+int CommandLine::Help(const std::vector<std::string>& words) {
+    CLI::App* node = &impl_->root;
+    for (const std::string& word : words) {
+        if (word.rfind("-", 0) == 0) {
+            break;
+        }
+        CLI::App* next = nullptr;
+        for (CLI::App* command : Children(node)) {
+            if (command->get_name() == word) {
+                next = command;
+            }
+        }
+        if (next == nullptr) {
+            return Fail(kExitUsage, UnknownCommand(node, &impl_->root, word));
+        }
+        node = next;
+    }
+    std::fputs(node->help().c_str(), stdout);
+    return kExitOK;
 }
 
 int CommandLine::Run(const std::vector<std::string>& args) {
@@ -163,6 +242,11 @@ int CommandLine::Run(const std::vector<std::string>& args) {
             return Fail(kExitUsage,
                         "passwords are never given on the command line: use --password-file "
                         "FILE or the environment variable S2S_PASSWORD");
+        }
+        // The parser would take the next argument as the value of "--at=".
+        if (arg.size() > 3 && arg.rfind("--", 0) == 0 && arg.find('=') == arg.size() - 1) {
+            return Fail(kExitUsage,
+                        "option '" + arg.substr(0, arg.size() - 1) + "' needs a value, not ''");
         }
     }
     std::vector<std::string> reversed(args.rbegin(),
@@ -182,15 +266,9 @@ int CommandLine::Run(const std::vector<std::string>& args) {
             if (impl_->commands.count(reached) != 0 || extra.front().rfind("-", 0) == 0) {
                 return Fail(kExitUsage, "unknown option '" + extra.front() + "'");
             }
-            const std::string group = reached == &root ? "" : reached->get_name() + " ";
-            std::string known;
-            for (const CLI::App* command : reached->get_subcommands({})) {
-                known += (known.empty() ? "" : ", ") + command->get_name();
-            }
-            return Fail(kExitUsage,
-                        "unknown " + group + "command '" + extra.front() + "' (" + known + ")");
+            return Fail(kExitUsage, UnknownCommand(reached, &root, extra.front()));
         }
-        return Fail(kExitUsage, error.what());
+        return Fail(kExitUsage, OptionMessage(reached, error.what()));
     }
     const CLI::App* reached = Reached(root);
     auto it = impl_->commands.find(reached);

@@ -43,6 +43,9 @@ class CommandLine {
 
     // Parses `args` (without the program name) and runs the chosen command; the exit code.
     int Run(const std::vector<std::string>& args);
+    // "s2s help WORDS...": the --help page of the command the words name (they stop at the first
+    // option); an unknown command is a usage error.
+    int Help(const std::vector<std::string>& words);
 
   private:
     struct Impl;

@@ -73,8 +73,7 @@ int main(int argc, char** argv) {
     Args args(argv + 1, argv + argc);
     // "s2s help COMMAND..." is "s2s COMMAND... --help".
     if (!args.empty() && args[0] == "help") {
-        args.erase(args.begin());
-        args.push_back("--help");
+        return cli.Help(Args(args.begin() + 1, args.end()));
     }
     return cli.Run(args);
 }

@@ -201,6 +201,13 @@ bool ParseTaskJson(const std::string& text, S2S::PObject& map, std::string& erro
         }
         result[it.key()] = value;
     }
+    if (result.hasMember("week_schd")) {
+        const std::string days = result["week_schd"].asString();
+        if (days.size() != 7 || days.find_first_not_of("01") != std::string::npos) {
+            error = "key \"week_schd\" must be seven '0'/'1' characters, from Sunday";
+            return false;
+        }
+    }
     S2S::SourceGuardOptions guard;
     if (!GuardOptionsFromMap(result, guard, error)) {
         return false;
@@ -273,7 +280,6 @@ bool LoadTask(const std::string& path, S2S::SyncTask& task, S2S::SourceGuardOpti
     S2S::PObj2SyncTask(map, task);
     return true;
 }
-
 
 json PObjectToJson(const S2S::PObject& value) {
     if (value.isMap()) {
