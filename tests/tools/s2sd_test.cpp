@@ -223,12 +223,19 @@ class DaemonScenario : public ::testing::Test {
         history[Control::kKeyTaskId] = id;
         return daemon_->Call(history)[Control::kKeyRuns].asArray();
     }
-    // Waits until task `id` has `count` runs, the newest one ended.
+    // Waits until task `id` has `count` runs, the newest one ended, and the task is no longer
+    // running (the run is recorded a moment before its task is free to run again).
     bool WaitForRuns(const PObject& id, size_t count, std::chrono::seconds limit) {
+        PObject status = Command(Control::kStatus);
+        status[Control::kKeyTaskId] = id;
         return WaitFor(
             [&] {
                 const PObject::Array runs = Runs(id);
-                return runs.size() >= count && runs[0][Control::kKeyEnd].asUInt64() != 0;
+                const PObject reply = daemon_->Call(status);
+                const PObject::Array& tasks = reply[Control::kKeyTasks].asArray();
+                return runs.size() >= count && runs[0][Control::kKeyEnd].asUInt64() != 0 &&
+                       tasks.size() == 1 &&
+                       tasks[0][Control::kKeyState].asString() != Control::kStateRunning;
             },
             limit);
     }
