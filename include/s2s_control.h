@@ -50,6 +50,12 @@ constexpr char kKeyResult[] = "result";
 constexpr char kKeyFiles[] = "files";
 constexpr char kKeyBytes[] = "bytes";
 constexpr char kKeyReadBytes[] = "read_bytes";
+constexpr char kKeyLastMessage[] = "last_message";
+constexpr char kKeyGuard[] = "guard";
+constexpr char kKeyWouldDelete[] = "would_delete";
+// A task's guard options, beside the sync model's keys in a task map (as in task files).
+constexpr char kKeyAllowEmptySource[] = "allow_empty_source";
+constexpr char kKeyMaxDelete[] = "max_delete";
 
 // Task states.
 constexpr char kStateIdle[] = "idle";

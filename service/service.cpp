@@ -55,6 +55,8 @@ const std::map<std::string, Kind>& TaskKeys() {
         {"repeat_times_in_day", Kind::kInteger},
         {"status", Kind::kInteger},
         {"sync_result", Kind::kInteger},
+        {Control::kKeyAllowEmptySource, Kind::kInteger},
+        {Control::kKeyMaxDelete, Kind::kString},
         {Control::kKeyNextRun, Kind::kInteger},
         {Control::kKeyState, Kind::kString},
         {Control::kKeyTaskId, Kind::kInteger},
@@ -190,6 +192,7 @@ struct Service::TaskState {
     uint64_t bytes_total = 0;
     bool has_result = false;
     int last_result = 0;
+    std::string last_message;
     // Real-time changes gathered until `pending_ms`.
     Job pending;
     long pending_ms = 0;
@@ -282,6 +285,13 @@ int Service::Start(std::string& error) {
     for (const StoredTask& stored : tasks) {
         std::unique_ptr<TaskState> state(new TaskState);
         state->stored = stored;
+        // The last result shows in the status across restarts.
+        std::vector<RunRecord> last;
+        if (store_.History(stored.task.GetID(), 1, last, error) == 0 && !last.empty()) {
+            state->has_result = true;
+            state->last_result = last[0].result;
+            state->last_message = last[0].message;
+        }
         const S2S::Schedule& schedule = stored.task.GetInfo().GetSchedule();
         scheduler_.Set(stored.task.GetID(), schedule, stored.last_scheduled);
         tasks_[stored.task.GetID()] = std::move(state);
@@ -417,18 +427,18 @@ void Service::StartRuns() {
         run.id = id;
         run.done = std::make_shared<std::atomic<bool>>(false);
         std::shared_ptr<std::atomic<bool>> done = run.done;
-        run.thread = std::thread(
-            [this, id, task = state.stored.task, shares, cancel = state.cancel, done]() {
-                RunThread(id, task, shares, cancel);
-                done->store(true);
-                Wake();
-            });
+        run.thread = std::thread([this, id, task = state.stored.task, guard = state.stored.guard,
+                                  shares, cancel = state.cancel, done]() {
+            RunThread(id, task, guard, shares, cancel);
+            done->store(true);
+            Wake();
+        });
         active_.push_back(std::move(run));
     }
 }
 
-void Service::RunThread(uint64_t id, S2S::SyncTask task, std::set<std::string> shares,
-                        std::shared_ptr<std::atomic<bool>> cancel) {
+void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions guard,
+                        std::set<std::string> shares, std::shared_ptr<std::atomic<bool>> cancel) {
     std::string error;
     RunRecord record;
     record.task_id = id;
@@ -451,6 +461,9 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, std::set<std::string> s
     S2S::RunFailure failure = S2S::RunFailure::kLocal;
     Observer observer(*this, id, cancel);
     S2S::TaskRun run(&observer);
+    // Every run checks each share's source, so a scheduled, a real-time and the first run after
+    // start alike never mirror an empty or unmounted folder over the receiver's copy.
+    run.SetGuardOptions(guard);
     if (store_.Password(id, password, error) != 0) {
         record.message = error;
     } else {
@@ -469,6 +482,8 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, std::set<std::string> s
             out.bytes = share.bytes;
             out.read_bytes = share.read_bytes;
             out.message = share.message.empty() ? S2S::ShareStateName(share.state) : share.message;
+            out.guard = share.guard;
+            out.would_delete = share.would_delete;
             record.shares.push_back(out);
         }
     }
@@ -490,6 +505,7 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, std::set<std::string> s
     if (it != tasks_.end()) {
         it->second->has_result = true;
         it->second->last_result = record.result;
+        it->second->last_message = record.message;
     }
 }
 
@@ -674,6 +690,31 @@ void Service::Handle(const PObject& request, PObject& reply) {
 
 namespace {
 
+// The guard options a task map gives, written over `guard`: a key that is absent leaves its
+// option as it is; "max_delete" "" means no limit. false with the reply set.
+bool ReadGuardOptions(const PObject& map, S2S::SourceGuardOptions& guard, PObject& reply) {
+    if (map.hasMember(Control::kKeyAllowEmptySource)) {
+        const unsigned long long allow = map[Control::kKeyAllowEmptySource].asUInt64();
+        if (allow > 1) {
+            SetStatus(reply, Control::kInvalidTask,
+                      "allow_empty_source must be true or false (1 or 0)");
+            return false;
+        }
+        guard.allowEmptySource = allow == 1;
+    }
+    if (map.hasMember(Control::kKeyMaxDelete)) {
+        const std::string text = map[Control::kKeyMaxDelete].asString();
+        S2S::DeleteLimit limit;
+        std::string error;
+        if (!text.empty() && !S2S::DeleteLimit::Parse(text, limit, error)) {
+            SetStatus(reply, Control::kInvalidTask, "max_delete: " + error);
+            return false;
+        }
+        guard.maxDelete = limit;
+    }
+    return true;
+}
+
 // Reads the task and password of an add or update request; false with the reply set.
 bool ReadTask(const PObject& request, S2S::SyncTask& task, bool& has_password,
               std::string& password, PObject& reply) {
@@ -716,12 +757,14 @@ void Service::CmdAdd(const PObject& request, PObject& reply) {
     S2S::SyncTask task;
     bool has_password = false;
     std::string password;
-    if (!ReadTask(request, task, has_password, password, reply)) {
+    S2S::SourceGuardOptions guard;
+    if (!ReadTask(request, task, has_password, password, reply) ||
+        !ReadGuardOptions(request[Control::kKeyTask], guard, reply)) {
         return;
     }
     std::string error;
     const long now = clock_.Now();
-    const int rc = store_.Add(task, password, now, error);
+    const int rc = store_.Add(task, guard, password, now, error);
     std::fill(password.begin(), password.end(), '\0');
     if (rc != 0) {
         SetStatus(reply, Control::kInternal, error);
@@ -733,6 +776,7 @@ void Service::CmdAdd(const PObject& request, PObject& reply) {
         std::lock_guard<std::mutex> lock(mutex_);
         std::unique_ptr<TaskState> state(new TaskState);
         state->stored.task = task;
+        state->stored.guard = guard;
         state->stored.last_scheduled = now;
         tasks_[id] = std::move(state);
         scheduler_.Set(id, task.GetInfo().GetSchedule(), now);
@@ -782,8 +826,13 @@ void Service::CmdUpdate(const PObject& request, PObject& reply) {
                       "task " + std::to_string(id) + " is running; cancel it first");
             return;
         }
+        // Guard options the map leaves out stay as they are.
+        S2S::SourceGuardOptions guard = it->second->stored.guard;
+        if (!ReadGuardOptions(request[Control::kKeyTask], guard, reply)) {
+            return;
+        }
         std::string error;
-        const int rc = store_.Update(task, has_password ? &password : nullptr, error);
+        const int rc = store_.Update(task, guard, has_password ? &password : nullptr, error);
         const long now = clock_.Now();
         if (rc == 0) {
             store_.SetLastScheduled(id, now, error);
@@ -798,6 +847,7 @@ void Service::CmdUpdate(const PObject& request, PObject& reply) {
         realtime_change = state.stored.task.GetInfo().GetSchedule().GetMode() == kRealtime ||
                           task.GetInfo().GetSchedule().GetMode() == kRealtime;
         state.stored.task = task;
+        state.stored.guard = guard;
         state.stored.last_scheduled = now;
         scheduler_.Set(id, task.GetInfo().GetSchedule(), now);
     }
@@ -844,6 +894,8 @@ PObject Service::TaskMap(const TaskState& state) const {
     map.asMap().erase("pswd");
     const uint64_t id = state.stored.task.GetID();
     map[Control::kKeyTaskId] = static_cast<unsigned long long>(id);
+    map[Control::kKeyAllowEmptySource] = state.stored.guard.allowEmptySource;
+    map[Control::kKeyMaxDelete] = state.stored.guard.maxDelete.ToString();
     map[Control::kKeyNextRun] = static_cast<unsigned long long>(
         std::max(0L, state.pending_ms != 0 ? clock_.Now() : scheduler_.NextRun(id)));
     const char* stateName = state.running                    ? Control::kStateRunning
@@ -936,6 +988,7 @@ PObject Service::StatusMap(const TaskState& state) const {
     map[Control::kKeyNextRun] = task[Control::kKeyNextRun];
     if (state.has_result) {
         map[Control::kKeyLastResult] = static_cast<unsigned long long>(state.last_result);
+        map[Control::kKeyLastMessage] = state.last_message;
     }
     return map;
 }
@@ -996,6 +1049,13 @@ void Service::CmdHistory(const PObject& request, PObject& reply) {
             entry[Control::kKeyBytes] = static_cast<unsigned long long>(share.bytes);
             entry[Control::kKeyReadBytes] = static_cast<unsigned long long>(share.read_bytes);
             entry[Control::kKeyMessage] = share.message;
+            if (!share.guard.empty()) {
+                entry[Control::kKeyGuard] = share.guard;
+                if (share.would_delete >= 0) {
+                    entry[Control::kKeyWouldDelete] =
+                        static_cast<unsigned long long>(share.would_delete);
+                }
+            }
             shares.push_back(entry);
         }
         map[Control::kKeyShares] = shares;

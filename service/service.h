@@ -72,8 +72,8 @@ class Service {
     void OnChanges(const std::vector<ShareChange>& changes, long now_ms);
     void Queue(uint64_t id, const std::set<std::string>& shares, const std::string& why);
     void StartRuns();
-    void RunThread(uint64_t id, S2S::SyncTask task, std::set<std::string> shares,
-                   std::shared_ptr<std::atomic<bool>> cancel);
+    void RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions guard,
+                   std::set<std::string> shares, std::shared_ptr<std::atomic<bool>> cancel);
     void Reap();
     S2S::PObject TaskMap(const TaskState& state) const;
     S2S::PObject StatusMap(const TaskState& state) const;

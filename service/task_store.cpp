@@ -12,9 +12,12 @@
 #include <cstdlib>
 #include <set>
 
+#include "s2s_logger.h"
 #include "service/files.h"
 
 namespace s2sd {
+
+using S2S::Logger;
 
 namespace {
 
@@ -26,7 +29,8 @@ const char kSchema[] =
     " period INTEGER NOT NULL, repeats INTEGER NOT NULL, week TEXT NOT NULL,"
     " begin_year INTEGER NOT NULL, begin_month INTEGER NOT NULL, begin_day INTEGER NOT NULL,"
     " start_hour INTEGER NOT NULL, start_minute INTEGER NOT NULL,"
-    " paused INTEGER NOT NULL DEFAULT 0, last_scheduled INTEGER NOT NULL);"
+    " paused INTEGER NOT NULL DEFAULT 0, last_scheduled INTEGER NOT NULL,"
+    " allow_empty_source INTEGER NOT NULL DEFAULT 0, max_delete TEXT NOT NULL DEFAULT '');"
     "CREATE TABLE IF NOT EXISTS task_shares ("
     " task_id INTEGER NOT NULL, pos INTEGER NOT NULL, name TEXT NOT NULL,"
     " PRIMARY KEY (task_id, pos));"
@@ -38,8 +42,24 @@ const char kSchema[] =
     "CREATE TABLE IF NOT EXISTS run_shares ("
     " run_id INTEGER NOT NULL, pos INTEGER NOT NULL, name TEXT NOT NULL,"
     " result INTEGER NOT NULL, files INTEGER NOT NULL, bytes INTEGER NOT NULL,"
-    " read_bytes INTEGER NOT NULL, message TEXT NOT NULL, PRIMARY KEY (run_id, pos));"
+    " read_bytes INTEGER NOT NULL, message TEXT NOT NULL, guard TEXT NOT NULL DEFAULT '',"
+    " would_delete INTEGER NOT NULL DEFAULT -1, PRIMARY KEY (run_id, pos));"
     "CREATE TABLE IF NOT EXISTS settings (key TEXT PRIMARY KEY, value TEXT NOT NULL);";
+
+// Version 1 added the guard options of a task and the guard's verdict on a run's share.
+constexpr int kSchemaVersion = 1;
+
+// Columns added after the first schema, each with the default an older row takes.
+const struct {
+    const char* table;
+    const char* column;
+    const char* definition;
+} kAddedColumns[] = {
+    {"tasks", "allow_empty_source", "INTEGER NOT NULL DEFAULT 0"},
+    {"tasks", "max_delete", "TEXT NOT NULL DEFAULT ''"},
+    {"run_shares", "guard", "TEXT NOT NULL DEFAULT ''"},
+    {"run_shares", "would_delete", "INTEGER NOT NULL DEFAULT -1"},
+};
 
 }  // namespace
 
@@ -153,11 +173,58 @@ int TaskStore::Open(const std::string& db_path, const std::string& password_dir,
     chmod(db_path.c_str(), 0600);
     sqlite3_busy_timeout(db_, 5000);
     if (Exec("PRAGMA journal_mode=WAL", error) != 0 ||
-        Exec("PRAGMA synchronous=FULL", error) != 0 || Exec(kSchema, error) != 0) {
+        Exec("PRAGMA synchronous=FULL", error) != 0 || Migrate(error) != 0) {
         return -1;
     }
     RemoveOrphanPasswords();
     return 0;
+}
+
+// Brings the schema to kSchemaVersion in one transaction; a database of a newer schema is left
+// as it is and refused.
+int TaskStore::Migrate(std::string& error) {
+    Transaction txn(*this);
+    if (!txn.Begin(error)) {
+        return -1;
+    }
+    Statement version(db_, "PRAGMA user_version");
+    if (version.Step() != SQLITE_ROW) {
+        error = std::string("task store: ") + sqlite3_errmsg(db_);
+        return -1;
+    }
+    const long long found = version.Int(0);
+    if (found > kSchemaVersion) {
+        error = "the task store was written by a newer s2sd (schema " + std::to_string(found) +
+                ", this one knows " + std::to_string(kSchemaVersion) + ")";
+        return -1;
+    }
+    if (found == kSchemaVersion) {
+        return 0;
+    }
+    // A new database gets every table as it is now; an older one its missing tables and columns.
+    if (Exec(kSchema, error) != 0) {
+        return -1;
+    }
+    for (const auto& added : kAddedColumns) {
+        Statement has(db_, "SELECT COUNT(*) FROM pragma_table_info(?) WHERE name = ?");
+        has.Bind(1, std::string(added.table)).Bind(2, std::string(added.column));
+        if (has.Step() != SQLITE_ROW) {
+            error = std::string("task store: ") + sqlite3_errmsg(db_);
+            return -1;
+        }
+        if (has.Int(0) == 0) {
+            const std::string alter = std::string("ALTER TABLE ") + added.table + " ADD COLUMN " +
+                                      added.column + " " + added.definition;
+            if (Exec(alter.c_str(), error) != 0) {
+                return -1;
+            }
+        }
+    }
+    const std::string set_version = "PRAGMA user_version = " + std::to_string(kSchemaVersion);
+    if (Exec(set_version.c_str(), error) != 0) {
+        return -1;
+    }
+    return txn.Commit(error) ? 0 : -1;
 }
 
 std::string TaskStore::PasswordPath(uint64_t id) const {
@@ -206,7 +273,7 @@ namespace {
 
 // Binds the definition columns from index 1 on, in the order of the UPDATE and INSERT below.
 template <typename S>
-void BindDefinition(S& stmt, const S2S::SyncTask& task) {
+void BindDefinition(S& stmt, const S2S::SyncTask& task, const S2S::SourceGuardOptions& guard) {
     const S2S::TaskInfo& info = task.GetInfo();
     const S2S::SyncInfo& sync = info.GetSyncInfo();
     const S2S::Schedule& schedule = info.GetSchedule();
@@ -225,12 +292,15 @@ void BindDefinition(S& stmt, const S2S::SyncTask& task) {
         .Bind(13, static_cast<long long>(schedule.GetBeginMonth()))
         .Bind(14, static_cast<long long>(schedule.GetBeginDay()))
         .Bind(15, static_cast<long long>(schedule.GetStartHour()))
-        .Bind(16, static_cast<long long>(schedule.GetStartMinute()));
+        .Bind(16, static_cast<long long>(schedule.GetStartMinute()))
+        .Bind(17, guard.allowEmptySource ? 1 : 0)
+        .Bind(18, guard.maxDelete.ToString());
 }
 
 }  // namespace
 
-int TaskStore::Add(S2S::SyncTask& task, const std::string& password, long now, std::string& error) {
+int TaskStore::Add(S2S::SyncTask& task, const S2S::SourceGuardOptions& guard,
+                   const std::string& password, long now, std::string& error) {
     std::lock_guard<std::mutex> lock(mutex_);
     Transaction txn(*this);
     if (!txn.Begin(error)) {
@@ -239,10 +309,10 @@ int TaskStore::Add(S2S::SyncTask& task, const std::string& password, long now, s
     Statement insert(db_,
                      "INSERT INTO tasks (name, user, server_ip, server_name, flags, ssh_port,"
                      " max_bandwidth, mode, period, repeats, week, begin_year, begin_month,"
-                     " begin_day, start_hour, start_minute, last_scheduled)"
-                     " VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?)");
-    BindDefinition(insert, task);
-    insert.Bind(17, static_cast<long long>(now));
+                     " begin_day, start_hour, start_minute, allow_empty_source, max_delete,"
+                     " last_scheduled) VALUES (?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?,?)");
+    BindDefinition(insert, task, guard);
+    insert.Bind(19, static_cast<long long>(now));
     if (!insert.Run(error)) {
         return -1;
     }
@@ -258,7 +328,8 @@ int TaskStore::Add(S2S::SyncTask& task, const std::string& password, long now, s
     return 0;
 }
 
-int TaskStore::Update(const S2S::SyncTask& task, const std::string* password, std::string& error) {
+int TaskStore::Update(const S2S::SyncTask& task, const S2S::SourceGuardOptions& guard,
+                      const std::string* password, std::string& error) {
     std::lock_guard<std::mutex> lock(mutex_);
     Transaction txn(*this);
     if (!txn.Begin(error)) {
@@ -267,10 +338,10 @@ int TaskStore::Update(const S2S::SyncTask& task, const std::string* password, st
     Statement update(db_,
                      "UPDATE tasks SET name=?, user=?, server_ip=?, server_name=?, flags=?,"
                      " ssh_port=?, max_bandwidth=?, mode=?, period=?, repeats=?, week=?,"
-                     " begin_year=?, begin_month=?, begin_day=?, start_hour=?, start_minute=?"
-                     " WHERE id=?");
-    BindDefinition(update, task);
-    update.Bind(17, static_cast<long long>(task.GetID()));
+                     " begin_year=?, begin_month=?, begin_day=?, start_hour=?, start_minute=?,"
+                     " allow_empty_source=?, max_delete=? WHERE id=?");
+    BindDefinition(update, task, guard);
+    update.Bind(19, static_cast<long long>(task.GetID()));
     if (!update.Run(error)) {
         return -1;
     }
@@ -315,8 +386,8 @@ int TaskStore::Load(std::vector<StoredTask>& tasks, std::string& error) {
     Statement select(db_,
                      "SELECT id, name, user, server_ip, server_name, flags, ssh_port,"
                      " max_bandwidth, mode, period, repeats, week, begin_year, begin_month,"
-                     " begin_day, start_hour, start_minute, paused, last_scheduled"
-                     " FROM tasks ORDER BY id");
+                     " begin_day, start_hour, start_minute, paused, last_scheduled,"
+                     " allow_empty_source, max_delete FROM tasks ORDER BY id");
     if (!select.Ok()) {
         error = std::string("task store: ") + sqlite3_errmsg(db_);
         return -1;
@@ -359,6 +430,20 @@ int TaskStore::Load(std::vector<StoredTask>& tasks, std::string& error) {
         stored.task.SetInfo(info);
         stored.paused = select.Int(17) != 0;
         stored.last_scheduled = static_cast<long>(select.Int(18));
+        stored.guard.allowEmptySource = select.Int(19) != 0;
+        const std::string max_delete = select.Text(20);
+        std::string problem;
+        if (!max_delete.empty() &&
+            !S2S::DeleteLimit::Parse(max_delete, stored.guard.maxDelete, problem)) {
+            // Only validated limits are stored; a row changed by hand keeps the task safe.
+            stored.guard.maxDelete.set = true;
+            stored.guard.maxDelete.percent = false;
+            stored.guard.maxDelete.value = 0;
+            Logger::LogMsg(Logger::Error,
+                           "[ERROR] task_store.cpp(%d): task %lld: stored max_delete '%s' is "
+                           "invalid (%s); no deletion is allowed until the task is updated\n",
+                           __LINE__, select.Int(0), max_delete.c_str(), problem.c_str());
+        }
         tasks.push_back(stored);
     }
     if (rc != SQLITE_DONE) {
@@ -441,7 +526,8 @@ int TaskStore::EndRun(const RunRecord& run, std::string& error) {
     for (const ShareRecord& share : run.shares) {
         Statement insert(db_,
                          "INSERT OR REPLACE INTO run_shares (run_id, pos, name, result, files,"
-                         " bytes, read_bytes, message) VALUES (?,?,?,?,?,?,?,?)");
+                         " bytes, read_bytes, message, guard, would_delete)"
+                         " VALUES (?,?,?,?,?,?,?,?,?,?)");
         insert.Bind(1, run.id)
             .Bind(2, pos++)
             .Bind(3, share.name)
@@ -449,7 +535,9 @@ int TaskStore::EndRun(const RunRecord& run, std::string& error) {
             .Bind(5, static_cast<long long>(share.files))
             .Bind(6, static_cast<long long>(share.bytes))
             .Bind(7, static_cast<long long>(share.read_bytes))
-            .Bind(8, share.message);
+            .Bind(8, share.message)
+            .Bind(9, share.guard)
+            .Bind(10, share.would_delete);
         if (!insert.Run(error)) {
             return -1;
         }
@@ -485,8 +573,8 @@ int TaskStore::History(uint64_t task_id, unsigned count, std::vector<RunRecord>&
         run.result = static_cast<int>(select.Int(4));
         run.message = select.Text(5);
         Statement shares(db_,
-                         "SELECT name, result, files, bytes, read_bytes, message FROM run_shares"
-                         " WHERE run_id = ? ORDER BY pos");
+                         "SELECT name, result, files, bytes, read_bytes, message, guard,"
+                         " would_delete FROM run_shares WHERE run_id = ? ORDER BY pos");
         shares.Bind(1, run.id);
         while (shares.Step() == SQLITE_ROW) {
             ShareRecord share;
@@ -496,6 +584,8 @@ int TaskStore::History(uint64_t task_id, unsigned count, std::vector<RunRecord>&
             share.bytes = static_cast<uint64_t>(shares.Int(3));
             share.read_bytes = static_cast<uint64_t>(shares.Int(4));
             share.message = shares.Text(5);
+            share.guard = shares.Text(6);
+            share.would_delete = shares.Int(7);
             run.shares.push_back(share);
         }
         runs.push_back(run);

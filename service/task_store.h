@@ -12,6 +12,7 @@
 #include <string>
 #include <vector>
 
+#include "s2s_source_guard.h"
 #include "s2s_sync_obj.h"
 
 struct sqlite3;
@@ -20,6 +21,9 @@ namespace s2sd {
 
 struct StoredTask {
     S2S::SyncTask task;  // without its password
+    // The checks on each share's source before its data run (task map keys "allow_empty_source"
+    // and "max_delete", as in task files).
+    S2S::SourceGuardOptions guard;
     bool paused = false;
     long last_scheduled = 0;  // when the last scheduled run was due (or the task was added)
 };
@@ -31,6 +35,8 @@ struct ShareRecord {
     uint64_t bytes = 0;
     uint64_t read_bytes = 0;
     std::string message;
+    std::string guard;            // why the source check refused the share; "" when it did not
+    long long would_delete = -1;  // what the refused run would have deleted; -1: not counted
 };
 
 struct RunRecord {
@@ -59,10 +65,13 @@ class TaskStore {
     int Open(const std::string& db_path, const std::string& password_dir, std::string& error);
 
     // All calls below: 0, 1 when the task does not exist, -1 with `error` for a store failure.
-    // Stores a new task; its id is set on `task`.
-    int Add(S2S::SyncTask& task, const std::string& password, long now, std::string& error);
-    // Replaces a task's definition; the password only when `password` is not null.
-    int Update(const S2S::SyncTask& task, const std::string* password, std::string& error);
+    // Stores a new task with its guard options; its id is set on `task`.
+    int Add(S2S::SyncTask& task, const S2S::SourceGuardOptions& guard, const std::string& password,
+            long now, std::string& error);
+    // Replaces a task's definition and guard options; the password only when `password` is not
+    // null.
+    int Update(const S2S::SyncTask& task, const S2S::SourceGuardOptions& guard,
+               const std::string* password, std::string& error);
     int Remove(uint64_t id, std::string& error);
     int Load(std::vector<StoredTask>& tasks, std::string& error);
     int SetPaused(uint64_t id, bool paused, std::string& error);
@@ -85,6 +94,7 @@ class TaskStore {
     class Statement;
     class Transaction;
     int Exec(const char* sql, std::string& error);
+    int Migrate(std::string& error);
     int WriteShares(uint64_t id, const S2S::SyncTask& task, std::string& error);
     int WritePassword(uint64_t id, const std::string& password, std::string& error);
     std::string PasswordPath(uint64_t id) const;

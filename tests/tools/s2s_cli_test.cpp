@@ -506,17 +506,21 @@ TEST_F(CliTest, ServiceListingsForPeopleAndScripts) {
     run["task_id"] = 1U;
     run["start"] = 1795000000ULL;
     run["end"] = 1795000065ULL;
-    run["result"] = 0U;
+    run["result"] = 10U;
     S2S::PObject share;
     share["name"] = "docs";
     share["files"] = 12U;
     share["bytes"] = 2048U;
+    share["guard"] = "max-delete";
+    share["would_delete"] = 40U;
     run["shares"] = S2S::PObject::Array{share};
     service.Answer("history", Tasks({run}, "runs"));
     r = S2s({"task", "history", "1", "--count", "5"});
     EXPECT_EQ(r.status, 0) << r.All();
     EXPECT_NE(r.out.find("1m05s"), std::string::npos) << r.out;
+    EXPECT_NE(r.out.find("max-delete (10)"), std::string::npos) << r.out;
     EXPECT_NE(r.out.find("12 files"), std::string::npos) << r.out;
+    EXPECT_NE(r.out.find("refused: max-delete, would delete 40"), std::string::npos) << r.out;
     EXPECT_EQ(service.Requests().back()["count"].asUInt64(), 5U);
 }
 

@@ -223,12 +223,19 @@ class DaemonScenario : public ::testing::Test {
         history[Control::kKeyTaskId] = id;
         return daemon_->Call(history)[Control::kKeyRuns].asArray();
     }
-    // Waits until task `id` has `count` runs, the newest one ended.
+    // Waits until task `id` has `count` runs, the newest one ended, and the task is no longer
+    // running (the run is recorded a moment before its task is free to run again).
     bool WaitForRuns(const PObject& id, size_t count, std::chrono::seconds limit) {
+        PObject status = Command(Control::kStatus);
+        status[Control::kKeyTaskId] = id;
         return WaitFor(
             [&] {
                 const PObject::Array runs = Runs(id);
-                return runs.size() >= count && runs[0][Control::kKeyEnd].asUInt64() != 0;
+                const PObject reply = daemon_->Call(status);
+                const PObject::Array& tasks = reply[Control::kKeyTasks].asArray();
+                return runs.size() >= count && runs[0][Control::kKeyEnd].asUInt64() != 0 &&
+                       tasks.size() == 1 &&
+                       tasks[0][Control::kKeyState].asString() != Control::kStateRunning;
             },
             limit);
     }
@@ -257,6 +264,71 @@ TEST_F(DaemonScenario, RealTimeTaskFollowsChangesIncludingNewDirectories) {
     ASSERT_TRUE(WaitFor([&] { return IsPathThere(arrived); }, std::chrono::seconds(60)))
         << daemon_->Log();
     EXPECT_TRUE(WaitFor([&] { return s2s_test::ReadFile(arrived) == "written later"; }));
+}
+
+TEST_F(DaemonScenario, ATasksGuardOptionsKeepTheReceiversCopyAndTheRefusalIsRecorded) {
+    const std::string source = sender_->SharePath("docs");
+    GenerateFiles(source, 5, 100);
+    const PObject added = daemon_->Call(TaskRequest(Control::kAdd, {"docs"}, 0));
+    ASSERT_EQ(StatusOf(added), Control::kOk) << added.toString();
+    const PObject id = added[Control::kKeyTaskId];
+    PObject run = Command(Control::kRun);
+    run[Control::kKeyTaskId] = id;
+    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
+    ASSERT_TRUE(WaitForRuns(id, 1, std::chrono::seconds(60))) << daemon_->Log();
+    const auto copy = Manifest(receiver_->SharePath("docs"));
+    ASSERT_EQ(copy.size(), 5u) << daemon_->Log();
+
+    // The folder emptied: the run is refused and the receiver's copy stays whole.
+    for (int i = 0; i < 5; ++i) {
+        ASSERT_EQ(unlink((source + "/file" + std::to_string(i)).c_str()), 0);
+    }
+    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
+    ASSERT_TRUE(WaitForRuns(id, 2, std::chrono::seconds(60))) << daemon_->Log();
+    PObject last = Runs(id)[0];
+    EXPECT_EQ(last[Control::kKeyResult].asUInt64(),
+              static_cast<unsigned long long>(S2S::RunFailure::kUnsafeSource));
+    EXPECT_EQ(last[Control::kKeyShares].asArray()[0][Control::kKeyGuard].asString(), "empty-source")
+        << last.toString();
+    EXPECT_EQ(Manifest(receiver_->SharePath("docs")), copy);
+
+    // Emptiness allowed but at most 2 deletions: refused by the limit, still nothing deleted.
+    PObject update = TaskRequest(Control::kUpdate, {"docs"}, 0);
+    update[Control::kKeyTaskId] = id;
+    update[Control::kKeyTask][Control::kKeyAllowEmptySource] = true;
+    update[Control::kKeyTask][Control::kKeyMaxDelete] = "2";
+    ASSERT_EQ(StatusOf(daemon_->Call(update)), Control::kOk);
+    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
+    ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(60))) << daemon_->Log();
+    last = Runs(id)[0];
+    EXPECT_EQ(last[Control::kKeyResult].asUInt64(),
+              static_cast<unsigned long long>(S2S::RunFailure::kMaxDelete));
+    EXPECT_EQ(last[Control::kKeyShares].asArray()[0][Control::kKeyGuard].asString(), "max-delete");
+    EXPECT_EQ(last[Control::kKeyShares].asArray()[0][Control::kKeyWouldDelete].asUInt64(), 5u);
+    EXPECT_EQ(Manifest(receiver_->SharePath("docs")), copy);
+    PObject status = Command(Control::kStatus);
+    status[Control::kKeyTaskId] = id;
+    const PObject entry = daemon_->Call(status)[Control::kKeyTasks].asArray()[0];
+    EXPECT_EQ(entry[Control::kKeyLastResult].asUInt64(), last[Control::kKeyResult].asUInt64());
+    EXPECT_NE(entry[Control::kKeyLastMessage].asString().find("delete"), std::string::npos)
+        << entry.toString();
+
+    // The options survive a restart; an update that leaves them out keeps them; a bad limit is
+    // an invalid task.
+    EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
+    daemon_->Start();
+    update[Control::kKeyTask].asMap().erase(Control::kKeyAllowEmptySource);
+    update[Control::kKeyTask].asMap().erase(Control::kKeyMaxDelete);
+    ASSERT_EQ(StatusOf(daemon_->Call(update)), Control::kOk);
+    PObject show = Command(Control::kShow);
+    show[Control::kKeyTaskId] = id;
+    const PObject task = daemon_->Call(show)[Control::kKeyTask];
+    EXPECT_TRUE(task[Control::kKeyAllowEmptySource].asBool());
+    EXPECT_EQ(task[Control::kKeyMaxDelete].asString(), "2");
+    update[Control::kKeyTask][Control::kKeyMaxDelete] = "150%";
+    const PObject refused = daemon_->Call(update);
+    EXPECT_EQ(StatusOf(refused), Control::kInvalidTask);
+    EXPECT_NE(refused[Control::kKeyMessage].asString().find("max_delete"), std::string::npos);
 }
 
 TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNextRunCompletes) {

@@ -18,6 +18,7 @@
 #include "tools/s2s/password.h"
 #include "tools/s2s/service_view.h"
 #include "tools/s2s/task_file.h"
+#include "tools/s2s/task_options.h"
 
 namespace s2s_cli {
 
@@ -27,29 +28,6 @@ namespace Control = S2S::Control;
 
 const OptionSpec kHelp = {"help", "", false, "show this help"};
 const OptionSpec kJson = {"json", "", false, "print the answer as JSON"};
-
-// The options that set a task's fields, as `s2s sync` takes them, and the password sources.
-const std::vector<OptionSpec> kTaskFieldOptions = {
-    {"task", "FILE", false, "the task file (JSON task map); the options below override its keys"},
-    {"name", "NAME", false, "the task's name"},
-    {"server", "HOST", false, "the receiving server's host name"},
-    {"server-ip", "ADDRESS", false, "the receiving server's address (tried first)"},
-    {"user", "USER", false, "the user the server knows this client by"},
-    {"share", "NAME", true, "a registered share to sync (the list replaces the task's)"},
-    {"compress", "", false, "compress data on the wire"},
-    {"no-compress", "", false, "do not compress data on the wire"},
-    {"block-level", "", false, "send only the changed blocks of changed files"},
-    {"no-block-level", "", false, "send changed files whole"},
-    {"ssh", "", false, "reach the server over SSH"},
-    {"no-ssh", "", false, "reach the server's rsync daemon directly"},
-    {"ssh-port", "PORT", false, "the server's SSH port (also used for encryption keys)"},
-    {"max-bandwidth", "N", false, "the bandwidth limit handed to rsync (0: none)"},
-    {"allow-empty-source", "", false, "sync an empty share folder even over a full copy"},
-    {"no-allow-empty-source", "", false, "refuse an empty share folder over a full copy"},
-    {"max-delete", "N|N%", false, "refuse a share's run that would delete more than N (or N%)"},
-    {"no-max-delete", "", false, "no deletion limit"},
-    {"password-file", "FILE", false, "read the password from FILE (mode 600; - for stdin)"},
-};
 
 const char kTaskFieldEpilogue[] =
     "The password comes from --password-file, else the environment variable S2S_PASSWORD,\n"
@@ -98,73 +76,6 @@ void PrintJson(const nlohmann::json& doc) {
     std::printf("%s\n", doc.dump(2).c_str());
 }
 
-// The options that change a field, written over the task map `map`. false with `error` (a usage
-// error) on a value that does not parse or a contradiction.
-bool ApplyFieldOptions(const Options& opts, S2S::PObject& map, std::string& error) {
-    const struct {
-        const char* option;
-        const char* key;
-    } kStrings[] = {
-        {"name", "name"}, {"server", "server_name"}, {"server-ip", "server_ip"}, {"user", "user"}};
-    for (const auto& field : kStrings) {
-        if (opts.Has(field.option)) {
-            map[field.key] = opts.Get(field.option);
-        }
-    }
-    if (opts.Has("share")) {
-        S2S::PObject::Array shares;
-        for (const std::string& name : opts.GetAll("share")) {
-            shares.push_back(S2S::PObject(name));
-        }
-        map["share_list"] = shares;
-    }
-    const struct {
-        const char* on;
-        const char* off;
-        const char* key;
-    } kBits[] = {{"compress", "no-compress", "compress"},
-                 {"block-level", "no-block-level", "block"},
-                 {"ssh", "no-ssh", "ssh"},
-                 {"allow-empty-source", "no-allow-empty-source", "allow_empty_source"}};
-    for (const auto& bit : kBits) {
-        if (opts.Has(bit.on) && opts.Has(bit.off)) {
-            error = std::string("--") + bit.on + " and --" + bit.off + " contradict each other";
-            return false;
-        }
-        if (opts.Has(bit.on) || opts.Has(bit.off)) {
-            map[bit.key] = opts.Has(bit.on);
-        }
-    }
-    unsigned long long value = 0;
-    if (opts.Has("ssh-port")) {
-        if (!opts.GetUnsigned("ssh-port", 65535, value, error)) {
-            return false;
-        }
-        map["ssh_port"] = static_cast<unsigned int>(value);
-    }
-    if (opts.Has("max-bandwidth")) {
-        if (!opts.GetUnsigned("max-bandwidth", 0xFFFFFFFFULL, value, error)) {
-            return false;
-        }
-        map["max_bandwidth"] = static_cast<unsigned int>(value);
-    }
-    if (opts.Has("max-delete") && opts.Has("no-max-delete")) {
-        error = "--max-delete and --no-max-delete contradict each other";
-        return false;
-    }
-    if (opts.Has("max-delete")) {
-        S2S::DeleteLimit limit;
-        if (!S2S::DeleteLimit::Parse(opts.Get("max-delete"), limit, error)) {
-            error = "--max-delete: " + error;
-            return false;
-        }
-        map["max_delete"] = limit.ToString();
-    } else if (opts.Has("no-max-delete")) {
-        map.asMap().erase("max_delete");
-    }
-    return true;
-}
-
 // What add and update send: `map` (the task as the service has it, or the defaults) with the
 // task file's keys and then the options written over it, and the password when one was given.
 int BuildTask(const Options& opts, S2S::PObject& map, std::string& password, bool& has_password) {
@@ -186,7 +97,7 @@ int BuildTask(const Options& opts, S2S::PObject& map, std::string& password, boo
             }
         }
     }
-    if (!ApplyFieldOptions(opts, map, error)) {
+    if (!ApplyTaskFieldOptions(opts, map, error)) {
         return Fail(kExitUsage, error);
     }
     bool found = false;
@@ -280,7 +191,7 @@ int RunUpdate(const Options& opts) {
         return code;
     }
     bool changes = false;
-    for (const OptionSpec& option : kTaskFieldOptions) {
+    for (const OptionSpec& option : TaskFieldOptions(TaskOptionsFor::kService)) {
         changes = changes || opts.Has(option.name);
     }
     if (!changes) {
@@ -568,12 +479,14 @@ std::vector<Command> TaskServiceCommands() {
         {"add", "s2s task add (--task FILE | --server HOST --user USER --share NAME ...)",
          "Gives a task to the sync service s2sd, which runs it on its schedule, and prints\n"
          "the id the service gave it.",
-         With(kTaskFieldOptions, {{"json", "", false, "print the new task's id as JSON"}, kHelp}),
+         With(TaskFieldOptions(TaskOptionsFor::kService),
+              {{"json", "", false, "print the new task's id as JSON"}, kHelp}),
          kTaskFieldEpilogue, RunAdd},
         {"update", "s2s task update ID [--task FILE] [OPTIONS]",
          "Changes a task of the sync service: the task file's keys and the options given\n"
          "replace those of the task; the rest, and the password unless one is given, stay.",
-         With(kTaskFieldOptions, {{"json", "", false, "print the task's id as JSON"}, kHelp}),
+         With(TaskFieldOptions(TaskOptionsFor::kService),
+              {{"json", "", false, "print the task's id as JSON"}, kHelp}),
          kTaskFieldEpilogue, RunUpdate},
         {"remove", "s2s task remove ID",
          "Removes a task from the sync service (a running task must be cancelled first).",

@@ -21,35 +21,29 @@
 #include "tools/s2s/password.h"
 #include "tools/s2s/progress.h"
 #include "tools/s2s/task_file.h"
+#include "tools/s2s/task_options.h"
 
 namespace s2s_cli {
 
 namespace {
 
-const std::vector<OptionSpec> kSyncOptions = {
-    {"task", "FILE", false, "the task file (JSON task map); replaces --name to --max-bandwidth"},
-    {"name", "NAME", false, "the task's name (default \"cli\")"},
-    {"id", "N", false, "the task's id (default 0)"},
-    {"server", "HOST", false, "the receiving server's host name"},
-    {"server-ip", "ADDRESS", false, "the receiving server's address (tried first)"},
-    {"user", "USER", false, "the user the server knows this client by"},
-    {"share", "NAME", true, "a registered share to sync"},
-    {"compress", "", false, "compress data on the wire"},
-    {"block-level", "", false, "send only the changed blocks of changed files"},
-    {"ssh", "", false, "reach the server over SSH"},
-    {"ssh-port", "PORT", false, "the server's SSH port (also used for encryption keys)"},
-    {"max-bandwidth", "N", false, "limit each copy to N KiB per second (0: no limit)"},
-    {"password-file", "FILE", false, "read the password from FILE (mode 600; - for stdin)"},
-    {"exclude", "PATTERN", true, "leave out files matching an rsync exclude pattern"},
-    {"allow-empty-source", "", false, "sync an empty share folder even over a full copy"},
-    {"max-delete", "N|N%", false, "refuse a share's run that would delete more than N (or N%)"},
-    {"json", "", false, "print a JSON summary on standard output (messages go to stderr)"},
-    {"no-progress", "", false, "no progress display while copying"},
-    {"quiet", "", false, "only errors and the summary"},
-    {"verbose", "", false, "also the library's informational log lines"},
-    {"debug", "", false, "also the library's debug log lines"},
-    {"help", "", false, "show this help"},
-};
+// The task field options (shared with `s2s task add|update`), then the run's own.
+std::vector<OptionSpec> SyncOptions() {
+    std::vector<OptionSpec> options = TaskFieldOptions(TaskOptionsFor::kSync);
+    const std::vector<OptionSpec> run_options = {
+        {"exclude", "PATTERN", true, "leave out files matching an rsync exclude pattern"},
+        {"allow-empty-source", "", false, "sync an empty share folder even over a full copy"},
+        {"max-delete", "N|N%", false, "refuse a share's run that would delete more than N (or N%)"},
+        {"json", "", false, "print a JSON summary on standard output (messages go to stderr)"},
+        {"no-progress", "", false, "no progress display while copying"},
+        {"quiet", "", false, "only errors and the summary"},
+        {"verbose", "", false, "also the library's informational log lines"},
+        {"debug", "", false, "also the library's debug log lines"},
+        {"help", "", false, "show this help"},
+    };
+    options.insert(options.end(), run_options.begin(), run_options.end());
+    return options;
+}
 
 const char kSyncEpilogue[] =
     "The password comes from --password-file, else the environment variable S2S_PASSWORD,\n"
@@ -249,38 +243,13 @@ nlohmann::json Summary(const S2S::TaskRun& run) {
 
 // Builds the task from the command-line options (when there is no task file).
 bool TaskFromOptions(const Options& opts, S2S::SyncTask& task, std::string& error) {
-    S2S::TaskInfo info = task.GetInfo();
-    info.SetName(opts.Get("name", "cli"));
-    const std::vector<std::string> shares = opts.GetAll("share");
-    info.SetShareList(std::list<std::string>(shares.begin(), shares.end()));
-    S2S::SyncInfo sync = info.GetSyncInfo();
-    sync.SetServerName(opts.Get("server"));
-    sync.SetServerIP(opts.Get("server-ip"));
-    sync.SetUser(opts.Get("user"));
-    sync.SetCompression(opts.Has("compress"));
-    sync.SetBlockLevelSync(opts.Has("block-level"));
-    sync.SetSSH(opts.Has("ssh"));
-    unsigned long long value = 0;
-    if (opts.Has("ssh-port")) {
-        if (!opts.GetUnsigned("ssh-port", 65535, value, error)) {
-            return false;
-        }
-        sync.SetSSHPort(static_cast<unsigned>(value));
+    // Keys left out take the sync model's defaults.
+    S2S::PObject map;
+    map["name"] = "cli";
+    if (!ApplyTaskFieldOptions(opts, map, error)) {
+        return false;
     }
-    if (opts.Has("max-bandwidth")) {
-        if (!opts.GetUnsigned("max-bandwidth", 0xFFFFFFFFULL, value, error)) {
-            return false;
-        }
-        sync.SetMaxBandwidth(static_cast<unsigned>(value));
-    }
-    if (opts.Has("id")) {
-        if (!opts.GetUnsigned("id", ~0ULL, value, error)) {
-            return false;
-        }
-        task.SetID(value);
-    }
-    info.SetSyncInfo(sync);
-    task.SetInfo(info);
+    S2S::PObj2SyncTask(map, task);
     return true;
 }
 
@@ -305,8 +274,7 @@ int RunSyncCommand(const Options& opts) {
     S2S::SourceGuardOptions guard;
     bool task_has_password = false;
     if (opts.Has("task")) {
-        for (const char* option : {"name", "id", "server", "server-ip", "user", "share", "compress",
-                                   "block-level", "ssh", "ssh-port", "max-bandwidth"}) {
+        for (const std::string& option : TaskFieldOptionNames(TaskOptionsFor::kSync)) {
             if (opts.Has(option)) {
                 return Fail(kExitUsage, std::string("--") + option +
                                             " cannot be used with --task (edit the task file)");
@@ -397,7 +365,7 @@ Command SyncCommand() {
             "Runs one sync task once, end to end: pairs the shares with the server, copies\n"
             "each one, sends encrypted shares' keys, marks them complete and reports\n"
             "the task's status.",
-            kSyncOptions,
+            SyncOptions(),
             kSyncEpilogue,
             RunSyncCommand};
 }

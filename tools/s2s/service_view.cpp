@@ -85,6 +85,36 @@ std::string Progress(const S2S::PObject& entry) {
     return std::to_string(percent) + "% " + FormatBytes(done) + " of " + FormatBytes(total);
 }
 
+// A run's result in the history and the status (the classes of a run's first failure, see
+// docs/service.md) as "name (number)".
+std::string RunResult(const S2S::PObject& value) {
+    if (!value.isInteger()) {
+        return "-";
+    }
+    static const char* const kNames[] = {"ok",        "local",         "unreachable", "auth",
+                                         "conflict",  "refused",       "transfer",    "key-sync",
+                                         "cancelled", "unsafe-source", "max-delete"};
+    const unsigned long long code = value.asUInt64();
+    const char* name = code < sizeof(kNames) / sizeof(kNames[0]) ? kNames[code]
+                       : code == 99                              ? "interrupted"
+                                                                 : nullptr;
+    return name != nullptr ? std::string(name) + " (" + std::to_string(code) + ")"
+                           : "result " + std::to_string(code);
+}
+
+// A share of a run: its remote result, or what the source check refused it for.
+std::string ShareResult(const S2S::PObject& share) {
+    const std::string guard = share[Control::kKeyGuard].asString();
+    if (guard.empty()) {
+        return "result " + Text(share[Control::kKeyResult]);
+    }
+    std::string text = "refused: " + guard;
+    if (share.hasMember(Control::kKeyWouldDelete)) {
+        text += ", would delete " + std::to_string(share[Control::kKeyWouldDelete].asUInt64());
+    }
+    return text;
+}
+
 }  // namespace
 
 std::string FormatLocalTime(unsigned long long epoch) {
@@ -127,6 +157,9 @@ std::string TaskDetails(const S2S::PObject& entry) {
     S2S::PObj2SyncTask(entry, task);
     std::ostringstream text;
     text << task << "\n";
+    text << "allow empty source: " << (entry[Control::kKeyAllowEmptySource].asBool() ? "yes" : "no")
+         << "\n";
+    text << "max delete: " << Text(entry[Control::kKeyMaxDelete]) << "\n";
     text << "state: " << Text(entry[Control::kKeyState]) << "\n";
     text << "next run: " << NextRun(entry, &task) << "\n";
     return text.str();
@@ -137,13 +170,18 @@ std::string StatusTable(const S2S::PObject& tasks) {
         return "no tasks\n";
     }
     std::vector<Row> rows = {{"ID", "NAME", "STATE", "SHARE", "PROGRESS", "NEXT RUN", "LAST"}};
+    std::string failures;
     for (const S2S::PObject& entry : tasks.asArray()) {
         rows.push_back({std::to_string(TaskIdOf(entry)), Text(entry[Control::kKeyName]),
                         Text(entry[Control::kKeyState]), Text(entry[Control::kKeyShare]),
                         Progress(entry), NextRun(entry, nullptr),
-                        Text(entry[Control::kKeyLastResult])});
+                        RunResult(entry[Control::kKeyLastResult])});
+        const std::string message = entry[Control::kKeyLastMessage].asString();
+        if (entry[Control::kKeyLastResult].asUInt64() != 0 && !message.empty()) {
+            failures += "task " + std::to_string(TaskIdOf(entry)) + ": last run: " + message + "\n";
+        }
     }
-    return Table(rows);
+    return Table(rows) + failures;
 }
 
 std::string HistoryText(const S2S::PObject& runs) {
@@ -157,14 +195,14 @@ std::string HistoryText(const S2S::PObject& runs) {
         text += FormatLocalTime(start) + "  task " + std::to_string(TaskIdOf(run)) + "  " +
                 (end >= start && end != 0 ? FormatDuration(static_cast<double>(end - start))
                                           : "running") +
-                "  result " + Text(run[Control::kKeyResult]);
+                "  " + RunResult(run[Control::kKeyResult]);
         const std::string message = run[Control::kKeyMessage].asString();
         text += message.empty() ? "\n" : "  " + message + "\n";
         std::vector<Row> rows;
         for (const S2S::PObject& share : run[Control::kKeyShares].asArray()) {
             Row row = {"   ",
                        Text(share[Control::kKeyName]),
-                       "result " + Text(share[Control::kKeyResult]),
+                       ShareResult(share),
                        std::to_string(share[Control::kKeyFiles].asUInt64()) + " files",
                        FormatBytes(share[Control::kKeyBytes].asUInt64()),
                        "(read " + FormatBytes(share[Control::kKeyReadBytes].asUInt64()) + ")"};
