@@ -3,7 +3,10 @@
 # sending and a receiving server (each under its own temporary S2S_ROOT), starts the receiver's
 # rsync daemon on the loopback, creates two shares with a few thousand generated files (one of them
 # encrypted, with a key file), runs `s2s sync`, changes and deletes files and syncs again, shows
-# the receiver's status, checks that both trees are identical and stops everything it started.
+# the receiver's status. Then it starts the sync service `s2sd` on the sender, gives it a scheduled
+# task and a real-time task with `s2s task add`, lists them with their next runs, changes a file on
+# the sender and waits for it to arrive on the receiver by itself. Last it stops the service,
+# checks that both trees are identical and stops everything it started.
 #
 # The sending side reaches the receiver at the standard rsync port, so the demo runs in a private
 # network namespace of its own, where that port is free whatever this machine runs; it also gets
@@ -13,7 +16,8 @@
 # Usage: bash tools/demo.sh
 #   S2S_DEMO_KEEP=1 keeps the temporary directory; S2S_BUILD_DIR chooses the build directory
 #   (default build).
-# Exit status: 0 when both syncs succeeded and the trees are identical, 1 otherwise.
+# Exit status: 0 when both syncs succeeded, the real-time change arrived and the trees are
+# identical, 1 otherwise.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 repo=$(pwd)
@@ -27,7 +31,7 @@ if [ -z "${S2S_DEMO_INSIDE:-}" ]; then
   bash tools/deps.sh
   echo "== building (incremental)"
   cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
-  cmake --build "$build" -j "$(nproc)" --target s2s_cli s2s-receiver
+  cmake --build "$build" -j "$(nproc)" --target s2s_cli s2s-receiver s2sd
   exec unshare --net --mount --propagation private -- env S2S_DEMO_INSIDE=1 bash "$0" "$@"
 fi
 
@@ -42,10 +46,15 @@ work=$(mktemp -d /tmp/s2s-demo.XXXXXX)
 sender=$work/sender
 receiver=$work/receiver
 sshd_pid=
+s2sd_pid=
 
 cleanup() {
   local status=$?
   set +e
+  if [ -n "$s2sd_pid" ]; then
+    kill "$s2sd_pid" 2>/dev/null
+    wait "$s2sd_pid" 2>/dev/null
+  fi
   S2S_ROOT=$receiver "$bin/s2s-receiver" stop >/dev/null 2>&1
   if [ -n "$sshd_pid" ]; then
     kill "$sshd_pid" 2>/dev/null
@@ -202,6 +211,103 @@ echo "== next run of the task (its schedule)"
 echo "== receiver: s2s-receiver status"
 S2S_ROOT=$receiver "$bin/s2s-receiver" status
 
+# --- the sync service ----------------------------------------------------------------------------
+# s2sd runs in the foreground (as under systemd), in the background of this script, its log in a
+# file that is shown when something goes wrong. Real-time changes are gathered for one second
+# instead of the default five, so that the demo stays quick.
+s2sd_log=$work/s2sd.log
+service_failed() {  # message
+  echo "demo: $1; the service's log:" >&2
+  sed 's/^/  /' "$s2sd_log" >&2
+  return 1
+}
+start_s2sd() {
+  S2S_ROOT=$sender "$bin/s2sd" --delay 1 >"$s2sd_log" 2>&1 &
+  s2sd_pid=$!
+  local i
+  for ((i = 0; i < 200; i++)); do  # at most 10 s
+    if ! kill -0 "$s2sd_pid" 2>/dev/null; then
+      wait "$s2sd_pid" || true
+      s2sd_pid=
+      service_failed "s2sd did not start"
+      return 1
+    fi
+    [ -S "$sender/run/s2s/s2sd.sock" ] && return 0
+    sleep 0.05
+  done
+  service_failed "s2sd did not open its control socket within 10 s"
+}
+stop_s2sd() {
+  local pid=$s2sd_pid status=0
+  s2sd_pid=
+  kill -TERM "$pid" 2>/dev/null || true
+  wait "$pid" || status=$?
+  if [ "$status" -ne 0 ]; then
+    service_failed "s2sd ended with exit code $status"
+  fi
+}
+s2s_task() { S2S_ROOT=$sender "$bin/s2s" task "$@"; }
+
+# Waits until no task of the service is queued or running, for at most $1 seconds.
+wait_idle() {  # seconds
+  local deadline=$((SECONDS + $1))
+  while ((SECONDS < deadline)); do
+    if ! s2s_task status --json | grep -Eq '"state": *"(queued|running)"'; then
+      return 0
+    fi
+    sleep 0.1
+  done
+  service_failed "the service's runs did not end within $1 s"
+}
+
+run_service() {
+  echo "== sender: s2sd, the sync service (real-time changes gathered for 1 s)"
+  start_s2sd || return 1
+  echo "== s2s task add: the weekly task of task.json, and a real-time task for docs"
+  local realtime_task=$work/realtime.json
+  cat >"$realtime_task" <<EOF
+{
+  "name": "docs live",
+  "share_list": ["docs"],
+  "server_ip": "127.0.0.1",
+  "user": "$user",
+  "schedule_mode": 1
+}
+EOF
+  s2s_task add --task "$task" --password-file "$password_file" || return 1
+  s2s_task add --task "$realtime_task" --password-file "$password_file" || return 1
+  echo "== s2s task list"
+  s2s_task list || return 1
+  # A real-time task gets one full run when it is added: it ends first, so that the change below
+  # is seen on its own.
+  wait_idle 120 || return 1
+
+  echo "== changing a file on the sender; waiting for it on the receiver"
+  local name="docs/new folder/live note.txt" i written arrived=
+  written=$(date +%s.%N)
+  date "+written on the sender at %T.%N" >"$sender/volume1/$name"
+  for ((i = 0; i < 600; i++)); do  # at most 30 s
+    if cmp -s "$sender/volume1/$name" "$receiver/volume1/$name"; then
+      arrived=$(date +%s.%N)
+      break
+    fi
+    sleep 0.05
+  done
+  if [ -z "$arrived" ]; then
+    service_failed "the changed file did not arrive within 30 s"
+    return 1
+  fi
+  awk -v a="$written" -v b="$arrived" -v n="$name" \
+    'BEGIN { printf "arrived by itself: %s, %.2fs after it was written\n", n, b - a }'
+  wait_idle 60 || return 1
+  echo "== s2s task history"
+  s2s_task history --count 3 || return 1
+  echo "== stopping s2sd"
+  stop_s2sd
+}
+realtime_status=0
+run_service || realtime_status=1
+
 # --- verification --------------------------------------------------------------------------------
 # A manifest of every entry (type, path, size, mode, modification time) and a checksum of every
 # file's content, on both sides.
@@ -237,8 +343,13 @@ for run in first-sync second-sync; do
 done
 printf 'trees        %s (docs, vault ciphertext, vault key)\n' "$verdict"
 awk -v a="$started" -v b="$(date +%s.%N)" 'BEGIN { printf "demo time    %.1fs\n", b - a }'
-if [ "$verdict" != identical ] || [ "$sync_status" -ne 0 ]; then
+if [ "$realtime_status" -eq 0 ]; then
+  echo "s2sd         the real-time change arrived by itself; the service stopped cleanly"
+else
+  echo "s2sd         FAILED (see above)"
+fi
+if [ "$verdict" != identical ] || [ "$sync_status" -ne 0 ] || [ "$realtime_status" -ne 0 ]; then
   echo "verdict: FAILED"
   exit 1
 fi
-echo "verdict: OK (both syncs succeeded; the receiver's copy is identical)"
+echo "verdict: OK (both syncs and the real-time run succeeded; the receiver's copy is identical)"
