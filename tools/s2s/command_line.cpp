@@ -175,19 +175,19 @@ CLI::App* CommandLine::AddGroup(CLI::App* parent, const std::string& name,
 void CommandLine::AddCommand(CLI::App* parent, const Command& command) {
     CLI::App* app = parent->add_subcommand(command.name);
     auto owned = std::make_unique<Command>(command);
-    for (const OptionSpec& spec : owned->options) {
-        if (spec.name == "help") {
+    for (const OptionSpec& row : owned->options) {
+        if (row.name == "help") {
             continue;  // the help flag every command inherits
         }
         CLI::Option* option = nullptr;
-        if (spec.value_name.empty()) {
+        if (row.value_name.empty()) {
             // "--flag=value" is refused: a flag is set by being there.
-            option = app->add_flag("--" + spec.name, spec.help)->disable_flag_override();
+            option = app->add_flag("--" + row.name, row.help)->disable_flag_override();
         } else {
-            option = app->add_option("--" + spec.name, spec.help)->type_name(spec.value_name);
+            option = app->add_option("--" + row.name, row.help)->type_name(row.value_name);
         }
-        option->multi_option_policy(spec.repeatable ? CLI::MultiOptionPolicy::TakeAll
-                                                    : CLI::MultiOptionPolicy::Throw);
+        option->multi_option_policy(row.repeatable ? CLI::MultiOptionPolicy::TakeAll
+                                                   : CLI::MultiOptionPolicy::Throw);
     }
     // Arguments that are not options are collected for the command to judge, so it can say what
     // it expected.
