@@ -35,7 +35,17 @@
 // incomplete or malformed (also: a user name and password rsync cannot authenticate, see
 // credentialsFit); 11 when a local file (temporary directory, command file, output file, which is
 // never written through a symbolic link) could not be handled; 12 when a command's reply is
-// malformed; 14 when rsync could not be started.
+// malformed; 14 when rsync could not be started; 53 when a hook of the server's daemon could not
+// start (rsync's "@ERROR: early exec failed", or a pre-transfer hook that the shell could not
+// find or execute): rsync itself says 5 or 4 then, which would read as a refused password or
+// action.
+//
+// Over ssh, before the first run to a destination (again once ten minutes have passed), one short
+// ssh command through the same login (the password again only in SSHPASS) asks whether that
+// login can read the daemon configuration; when it cannot, execute() returns 52 without running
+// rsync, and lastError() names the login and what to do. A one-shot daemon that fails to start
+// anyway (rsync's "syntax or usage error" before any greeting) gives the same 52. A refused
+// password in that check gives 5, a server that does not answer it in time 30.
 //
 // Pointing a wrapper at a test daemon started by s2s-receiver on 127.0.0.1:<port>:
 //   w.setPort(port); w.setDestPath("127.0.0.1", user, password, "<share>", "");
@@ -64,6 +74,12 @@ class S2S_EXPORT RsyncWrapper {
         kResultSpawn = 14,       // rsync could not be started
         kResultCancelled = 20,   // the cancel predicate returned true
         kResultNoCommands = 51,  // the server has no command module
+        // Over ssh: the login cannot read the receiver's daemon configuration, so the one-shot
+        // daemon it would start cannot serve (the login must be root there).
+        kResultSshLogin = 52,
+        // A hook of the receiving server's daemon (the command module's early hook, a module's
+        // pre-transfer hook) could not start or failed; the receiver's daemon log says why.
+        kResultHookFailed = 53,
     };
 
     // rsync's daemon reads its secrets file in lines of at most 1023 bytes ("user:password"

@@ -44,6 +44,11 @@ const ResultInfo kResultTable[] = {
     {43, "unknown-command", "the server does not know the command (an old server)"},
     {44, "no-version", "the server answered, but its protocol version could not be read"},
     {51, "unknown-command", "the server does not know the command (an old server)"},
+    {52, "ssh-login",
+     "over SSH the login cannot read the receiving server's daemon configuration (it must be "
+     "root there)"},
+    {53, "hook-failed",
+     "the receiving server's command hook could not start or failed (its daemon log says why)"},
     {201, "missing-key", "the server found a required key missing"},
     {202, "attributes-refused", "the server does not accept share attributes"},
     {203, "malformed", "the server could not parse the command"},
@@ -58,7 +63,8 @@ const ResultInfo kResultTable[] = {
     {213, "not-tested", "no server address was tested"},
     {214, "conflict", "some shares are paired with another client"},
     {215, "server-internal", "the receiving server failed internally"},
-    {216, "store-full", "the receiving server's pairing store is full (a size or per-client limit)"},
+    {216, "store-full",
+     "the receiving server's pairing store is full (a size or per-client limit)"},
     {255, "remote-shell", "the remote shell (ssh) failed"},
     {300, "local-key-failure", "the share's key could not be found locally"},
 };

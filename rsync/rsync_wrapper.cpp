@@ -38,6 +38,15 @@ constexpr int kRsyncDeleteLimit = 25;  // rsync: the --max-delete limit stopped 
 constexpr const char kDeletionsStopped[] = "Deletions stopped due to --max-delete limit";
 // Marks the lines of a dry run's entries in rsync's merged output, apart from its messages.
 constexpr const char kItemPrefix[] = "s2s-item:";
+// What rsync says when the daemon's early hook failed, when a pre-transfer hook ended, and when
+// it could not even prepare one; a shell that cannot find or execute the hook program ends with
+// 127 or 126, which rsync shows as the raw wait status.
+constexpr const char kEarlyExecFailed[] = "@ERROR: early exec failed";
+constexpr const char kPreXferFailed[] = "pre-xfer exec returned failure (";
+constexpr const char kExecPreparation[] = "exec preparation failed";
+// What a client sees when the one-shot daemon started over ssh stopped before its greeting.
+constexpr const char kUsageError[] = "syntax or usage error";
+constexpr const char kNoGreeting[] = "did not see server greeting";
 
 bool HasControl(const std::string& s) {
     for (unsigned char c : s) {
@@ -329,7 +338,15 @@ void RsyncWrapper::Impl::ConnectionOptions(std::vector<std::string>* argv) const
         argv->push_back("--sockopts=TCP_NODELAY");
         return;
     }
-    // rsync splits this at blanks itself; every piece was checked to hold no blank or quote.
+    argv->push_back("--rsh=" + RemoteShell());
+    argv->push_back("--rsync-path=rsync --config=" + RemoteConfigPath());
+}
+
+std::string RsyncWrapper::Impl::RemoteConfigPath() const {
+    return remoteConfig.empty() ? DefaultRemoteConfig() : remoteConfig;
+}
+
+std::string RsyncWrapper::Impl::RemoteShell() const {
     std::string rsh;
     bool withPassword = !password.empty() && identity.empty();
     if (withPassword) {
@@ -356,9 +373,7 @@ void RsyncWrapper::Impl::ConnectionOptions(std::vector<std::string>* argv) const
     if (auth) {
         rsh += " -l " + user;
     }
-    argv->push_back("--rsh=" + rsh);
-    std::string config = remoteConfig.empty() ? DefaultRemoteConfig() : remoteConfig;
-    argv->push_back("--rsync-path=rsync --config=" + config);
+    return rsh;
 }
 
 void RsyncWrapper::Impl::Environment(ChildCommand* job) const {
@@ -377,6 +392,9 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
     std::list<std::string> errors;
     bool unknownCommandModule = false;
     bool deletionsStopped = false;
+    bool hookFailed = false;
+    bool usageError = false;
+    bool noGreeting = false;
     int lastPercent = -1;
     const std::string unknownModule = "Unknown module '" + commandModule + "'";
     auto sink = [&](const std::string& raw) {
@@ -408,6 +426,16 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
         if (commandRun && line.find(unknownModule) != std::string::npos) {
             unknownCommandModule = true;
         }
+        if (line.find(kEarlyExecFailed) != std::string::npos ||
+            line.find(kExecPreparation) != std::string::npos ||
+            line.find(std::string(kPreXferFailed) + std::to_string(126 << 8) + ")") !=
+                std::string::npos ||
+            line.find(std::string(kPreXferFailed) + std::to_string(127 << 8) + ")") !=
+                std::string::npos) {
+            hookFailed = true;
+        }
+        usageError = usageError || line.find(kUsageError) != std::string::npos;
+        noGreeting = noGreeting || line.find(kNoGreeting) != std::string::npos;
         if (line.compare(0, sizeof(kDeletionsStopped) - 1, kDeletionsStopped) == 0) {
             deletionsStopped = true;
         }
@@ -448,6 +476,19 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
                        __LINE__, outcome.exit_code, last.c_str());
         if (unknownCommandModule) {
             return kResultNoCommands;
+        }
+        if (hookFailed) {
+            lastError =
+                "the receiving server's command hook could not start or failed (its "
+                "daemon log says why)\n" +
+                lastError;
+            return kResultHookFailed;
+        }
+        if (ssh && usageError && noGreeting) {
+            ForgetSshLogin();
+            lastError = SshLoginMessage("started a daemon that could not read (or parse)") + "\n" +
+                        lastError;
+            return kResultSshLogin;
         }
     }
     if (deletionsStopped && (outcome.exit_code == 0 || outcome.exit_code == kRsyncVanished)) {
@@ -653,6 +694,13 @@ void RsyncWrapper::setDryRun(
 
 int RsyncWrapper::execute(boost::function<bool()> cancel) {
     impl_->lastError.clear();
+    // Malformed settings are reported by the run below, before anything is started.
+    if (impl_->ssh && impl_->CheckConnection().empty()) {
+        const int checked = impl_->CheckSshLogin(cancel);
+        if (checked != 0) {
+            return checked;
+        }
+    }
     if (!impl_->cmdLines.empty()) {
         return impl_->ExecuteCommand(cancel);
     }

@@ -63,6 +63,23 @@ struct RsyncWrapper::Impl {
     std::string TransferTarget(std::string* why) const;
     // Options shared by every run: time-outs, the remote shell for ssh.
     void ConnectionOptions(std::vector<std::string>* argv) const;
+    // Over ssh: the ssh command line (sshpass first when a password logs in), blank-separated;
+    // every piece was checked to hold no blank or quote, so rsync's -e splitting keeps it intact.
+    std::string RemoteShell() const;
+    // Over ssh: the receiver's daemon configuration the one-shot daemon reads.
+    std::string RemoteConfigPath() const;
+    // Over ssh, before the first run to a destination (and again once a successful check is ten
+    // minutes old): asks the server, through the same login, whether that login can read the
+    // daemon configuration. 0 when it can, or when the question itself could not be answered
+    // (rsync then reports what it meets); kResultSshLogin when it cannot; 5 when ssh refused the
+    // password; 30 when the server did not answer in time; 20 when cancelled.
+    int CheckSshLogin(const boost::function<bool()>& cancel);
+    // The message of kResultSshLogin; `why` says what was found.
+    std::string SshLoginMessage(const std::string& why) const;
+    // Drops the remembered check of this destination (its daemon failed to start after all).
+    void ForgetSshLogin() const;
+    // What a remembered check is filed under: login, server, port, configuration, identity.
+    std::string SshLoginKey() const;
     // The password and the remote shell's password in the child's environment only.
     void Environment(S2S::rsync_internal::ChildCommand* job) const;
     // Runs rsync; keeps the last error lines; maps spawn failures and cancellation.

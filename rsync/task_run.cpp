@@ -26,14 +26,16 @@ double SecondsSince(TaskRun::Clock::time_point start) {
     return std::chrono::duration<double>(TaskRun::Clock::now() - start).count();
 }
 
+// rsync's refusal of the account, or an SSH login that cannot serve as the receiver's daemon.
 bool IsAuthFailure(int code) {
-    return code == 5;
+    return code == 5 || code == VURN::Backup::RsyncWrapper::kResultSshLogin;
 }
 
 // The class of a remote command that did not answer 0.
 RunFailure ClassifyCommandResult(int code) {
     switch (code) {
         case 5:
+        case VURN::Backup::RsyncWrapper::kResultSshLogin:
             return RunFailure::kAuth;
         case 10:
         case 30:
@@ -48,6 +50,9 @@ RunFailure ClassifyCommandResult(int code) {
 
 // The class of a failed server test (Rsyncer::Initialize's result).
 RunFailure ClassifyConnectResult(int code) {
+    if (code == VURN::Backup::RsyncWrapper::kResultHookFailed) {
+        return RunFailure::kRefused;  // the server answered, but could not run the command
+    }
     return IsAuthFailure(code) ? RunFailure::kAuth : RunFailure::kUnreachable;
 }
 
@@ -220,10 +225,14 @@ bool TaskRun::Connect() {
     }
     if (rc != 0) {
         const RunFailure failure = ClassifyConnectResult(rc);
-        const std::string why =
-            failure == RunFailure::kAuth
-                ? "the server refused user '" + info.GetUser() + "' or its password"
-                : "the server did not answer";
+        std::string why = "the server did not answer";
+        if (rc == VURN::Backup::RsyncWrapper::kResultSshLogin) {
+            why = "the SSH login '" + info.GetUser() + "' cannot serve the receiving server";
+        } else if (failure == RunFailure::kAuth) {
+            why = "the server refused user '" + info.GetUser() + "' or its password";
+        } else if (failure == RunFailure::kRefused) {
+            why = "the server could not run the connection test";
+        }
         Fail(failure, why + ": " + NameAndMeaning(rc) + Because(rsyncer_.GetLastError()));
         return false;
     }

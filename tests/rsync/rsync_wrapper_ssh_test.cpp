@@ -29,9 +29,11 @@ using wrapper_test::RunProgram;
 using wrapper_test::Server;
 
 const char kPassword[] = "pw-Ssh-4e1b";
+const char kGuest[] = "s2sguest";
+const char kRootAlias[] = "s2sroot";
 
 // sshd on 127.0.0.1:<port> in a mount namespace of its own where /etc/shadow gives root the test
-// password; nothing outside that namespace changes.
+// password and /etc/passwd adds kGuest and kRootAlias; nothing outside that namespace changes.
 class Sshd {
   public:
     Sshd() : dir_("s2s-sshd"), port_(s2s_test::FreeTcpPort()) {}
@@ -65,8 +67,17 @@ class Sshd {
             }
             out += line + "\n";
         }
+        // Two more logins with the same password: an ordinary account, and one with uid 0 under
+        // another name.
+        std::string passwd = s2s_test::ReadFile("/etc/passwd");
+        for (const char* login : {kGuest, kRootAlias}) {
+            passwd += std::string(login) + (login == kGuest ? ":x:64999:64999" : ":x:0:0") +
+                      "::/:/bin/sh\n";
+            out += std::string(login) + ":" + crypted + ":19000:0:99999:7:::\n";
+        }
         s2s_test::WriteFile(d + "/shadow", out);
         chmod((d + "/shadow").c_str(), 0600);
+        s2s_test::WriteFile(d + "/passwd", passwd);
         s2s_test::WriteFile(d + "/sshd_config",
                             "Port " + std::to_string(port_) +
                                 "\nListenAddress 127.0.0.1\nHostKey " + d + "/key\nPidFile " + d +
@@ -78,7 +89,8 @@ class Sshd {
         if (pid_ == 0) {
             if (unshare(CLONE_NEWNS) != 0 ||
                 mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-                mount((d + "/shadow").c_str(), "/etc/shadow", nullptr, MS_BIND, nullptr) != 0) {
+                mount((d + "/shadow").c_str(), "/etc/shadow", nullptr, MS_BIND, nullptr) != 0 ||
+                mount((d + "/passwd").c_str(), "/etc/passwd", nullptr, MS_BIND, nullptr) != 0) {
                 _exit(3);
             }
             int log = open((d + "/sshd.log").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
@@ -131,14 +143,14 @@ class WrapperSsh : public ::testing::Test {
 
     // Aims at the receiver through ssh: ssh's port, and the receiver's configuration.
     void Aim(RsyncWrapper& w, const std::string& dest, const std::string& module = "",
-             const std::string& password = kPassword) {
+             const std::string& password = kPassword, const std::string& login = "root") {
         w.setSsh(true);
         w.setPort(sshd_.Port());
         w.setConnectTimeout(10);
         w.setVurnAuth(true, true);
         w.setSshKnownHostsFile(sshd_.KnownHosts());
         w.setRemoteConfig(server_->Root() + "/usr/vurn/etc/s2s_rsyncd.conf");
-        w.setDestPath("127.0.0.1", "root", password, dest, module);
+        w.setDestPath("127.0.0.1", login, password, dest, module);
     }
 
     Sshd sshd_;
@@ -185,6 +197,38 @@ TEST_F(WrapperSsh, WrongPasswordFailsWithoutHanging) {
     EXPECT_NE(rc, 0);
     EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(30));
     EXPECT_EQ(w.lastError().find("wrong-password"), std::string::npos);
+}
+
+// The one-shot daemon runs as the SSH login and must read root's configuration. A login that
+// cannot is refused before rsync runs, by what it can do (not by its name), and a daemon that
+// fails to start anyway is reported the same way, not as rsync's bare usage error.
+TEST_F(WrapperSsh, LoginThatCannotServeIsNamedBeforeTheTransfer) {
+    s2s_test::WriteFile(local_.path() + "/vault.key", "KEY");
+    RsyncWrapper guest;
+    guest.setSrcPath(local_.path() + "/vault.key");
+    Aim(guest, "/usr/vurn/etc/.encrypt", "vault", kPassword, kGuest);
+    EXPECT_EQ(guest.execute(boost::function<bool()>()), RsyncWrapper::kResultSshLogin);
+    EXPECT_NE(guest.lastError().find(std::string("SSH login '") + kGuest + "'"), std::string::npos)
+        << guest.lastError();
+    EXPECT_NE(guest.lastError().find("must be root"), std::string::npos);
+    EXPECT_EQ(access((server_->KeyDir() + "/vault").c_str(), F_OK), -1);
+
+    // uid 0 under another name passes the check; the rsync account (root) then decides.
+    RsyncWrapper alias;
+    alias.setSrcPath(local_.path() + "/vault.key");
+    Aim(alias, "/usr/vurn/etc/.encrypt", "vault", kPassword, kRootAlias);
+    EXPECT_EQ(alias.execute(boost::function<bool()>()), 5) << alias.lastError();
+    EXPECT_NE(alias.lastError().find("auth failed"), std::string::npos) << alias.lastError();
+
+    const std::string broken = local_.path() + "/broken.conf";
+    s2s_test::WriteFile(broken, "[unterminated\n");
+    RsyncWrapper daemon;
+    daemon.setSrcPath(local_.path() + "/vault.key");
+    Aim(daemon, "/usr/vurn/etc/.encrypt", "vault");
+    daemon.setRemoteConfig(broken);
+    EXPECT_EQ(daemon.execute(boost::function<bool()>()), RsyncWrapper::kResultSshLogin)
+        << daemon.lastError();
+    EXPECT_NE(daemon.lastError().find("syntax or usage error"), std::string::npos);
 }
 
 TEST_F(WrapperSsh, CancelLeavesNoSshBehind) {

@@ -469,6 +469,31 @@ TEST_F(WrapperTest, FailuresKeepRsyncsCodes) {
     server_->Aim(noRsync, "photos");
     EXPECT_EQ(noRsync.execute(boost::function<bool()>()), RsyncWrapper::kResultSpawn);
 
+    // Hooks the daemon's shell cannot execute (the handler gone, not executable, or unable to
+    // load its library): the server failed, which is neither a refused password (rsync's 5 for
+    // the early hook) nor a refused action (its 4 for the key module's pre-transfer hook).
+    const std::string hook = local_.path() + "/not-executable";
+    s2s_test::WriteFile(hook, "#!/bin/sh\nexit 0\n");
+    const std::string conf = server_->Root() + "/usr/vurn/etc/s2s_rsyncd.conf";
+    std::string text = s2s_test::ReadFile(conf);
+    for (size_t at = text.find("exec '"); at != std::string::npos; at = text.find("exec '", at)) {
+        at += 6;
+        text.replace(at, text.find('\'', at) - at, hook);
+    }
+    s2s_test::WriteFile(conf, text);
+    RsyncWrapper noHook;
+    server_->Aim(noHook, "");
+    noHook.setVurnCustCmdRule({"command=\"S2S_GetProtocolVer\"", "clientID=\"x\"",
+                               "outfile=\"" + local_.path() + "/out\""});
+    EXPECT_EQ(noHook.execute(boost::function<bool()>()), RsyncWrapper::kResultHookFailed);
+    EXPECT_NE(noHook.lastError().find("command hook could not start"), std::string::npos)
+        << noHook.lastError();
+    RsyncWrapper noKeyHook;
+    noKeyHook.setSrcPath(local_.path() + "/f");
+    server_->Aim(noKeyHook, "/usr/vurn/etc/.encrypt", "vault");
+    EXPECT_EQ(noKeyHook.execute(boost::function<bool()>()), RsyncWrapper::kResultHookFailed)
+        << noKeyHook.lastError();
+
     server_->Stop();
     RsyncWrapper down;
     down.setSrcPath(local_.path() + "/f");
