@@ -303,6 +303,21 @@ int RecordMultiClient(const std::string& clientID, const std::string& serverName
     return rc == 0 ? kReceiverOK : StoreWriteFailure();
 }
 
+// Brings the daemon's share modules up to date with the share registry: a share registered
+// (or removed) after the daemon was configured is served (or no longer served) from this moment
+// on, since the daemon reads its configuration afresh for every connection. Every run pairs
+// before its first dry run or data run, and every share start asks again. A failure is logged;
+// the command itself still stands.
+void RefreshModules() {
+    std::string error;
+    if (receiver_internal::RefreshShareModules(&error) != 0) {
+        Logger::LogMsg(Logger::Error,
+                       "[ERROR] receiver_commands.cpp(%d): the share modules were not brought up "
+                       "to date: %s\n",
+                       __LINE__, error.c_str());
+    }
+}
+
 class Command {
   public:
     Command(const Pairs& pairs, bool oldServer) : pairs_(pairs), oldServer_(oldServer) {}
@@ -370,6 +385,7 @@ int Pairing(const Command& c) {
     if (!multi && !single.empty() && single != c.Client()) {
         return kReceiverPairedOther;
     }
+    RefreshModules();
     if (dryRun) {
         return kReceiverOK;
     }
@@ -416,6 +432,7 @@ int PairingMultiSrc(const Command& c, ReceiverAnswer* a) {
     if (rc != kReceiverOK && rc != kReceiverShareConflict) {
         return rc == S2S_SVR_ERR_READ ? kReceiverStoreRead : kReceiverInternal;
     }
+    RefreshModules();
     a->hasOutput = true;
     for (size_t i = 0; i < refused.size(); ++i) {
         a->output += (i == 0 ? "" : ":") + refused[i];
@@ -491,15 +508,7 @@ int SyncStart(const Command& c) {
     if (withAttributes && encrypted != (c.Get("isEncrypt") == "1")) {
         return kReceiverAttrMismatch;
     }
-    // A share registered after the daemon was configured is served from this moment on: the
-    // daemon reads its configuration afresh for every connection, the data run included.
-    std::string error;
-    if (receiver_internal::RefreshShareModules(&error) != 0) {
-        Logger::LogMsg(Logger::Error,
-                       "[ERROR] receiver_commands.cpp(%d): the share modules were not brought up "
-                       "to date: %s\n",
-                       __LINE__, error.c_str());
-    }
+    RefreshModules();
     return UpdateShare(
         share,
         {{"RunningID", c.Client()}, {"CompleteID", CompleteID(share)}, {"LastStart", Now()}});

@@ -66,6 +66,22 @@ std::string NameAndMeaning(int code) {
     return RsyncResultName(code) + ", " + RsyncResultMeaning(code);
 }
 
+// A dry run or data run of one share runs after the control commands of the same run were taken
+// with the same credentials: its "auth" failure is the server refusing that share's module (not
+// registered there, or removed), never the password, and the other shares still sync.
+bool ShareNotServed(int code) {
+    return IsAuthFailure(code);
+}
+
+RunFailure ClassifyShareRunResult(int code) {
+    return ShareNotServed(code) ? RunFailure::kRefused : ClassifyTransferResult(code);
+}
+
+std::string NotServedMessage(const std::string& share, int code) {
+    return "the server does not serve share '" + share +
+           "' (is it registered there?): " + NameAndMeaning(code);
+}
+
 // rsync's own lines (or the library's local cause) as one line for a message: "" or ": a; b".
 std::string Because(const std::string& lines) {
     std::string joined;
@@ -317,6 +333,12 @@ bool TaskRun::GuardSource(ShareOutcome& share) {
     share.message = guard.message;
     if (Cancelled()) {
         share.state = ShareState::kCancelled;
+    } else if (guard.result == SourceGuardResult::kCheckFailed &&
+               ShareNotServed(guard.dryRunResult)) {
+        share.state = ShareState::kRefused;
+        share.result = guard.dryRunResult;
+        share.message = NotServedMessage(share.name, guard.dryRunResult);
+        Fail(ClassifyShareRunResult(guard.dryRunResult), share.message);
     } else if (guard.result == SourceGuardResult::kCheckFailed) {
         share.state = ShareState::kFailed;
         share.result = guard.dryRunResult;
@@ -393,13 +415,16 @@ void TaskRun::SyncShare(ShareOutcome& share) {
     // Files that vanish while they are being sent are normal on a live share; the next run takes
     // the share as it is then.
     if (rc != 0 || (result != 0 && result != kResultVanished)) {
-        share.state = ShareState::kFailed;
+        const bool notServed = rc == 0 && ShareNotServed(result);
+        share.state = notServed ? ShareState::kRefused : ShareState::kFailed;
         share.step = "copy";
         share.result = result;
         share.rsync_errors = rsyncer_.GetLastError();
-        share.message = "copying share '" + share.name + "' failed: " + NameAndMeaning(result) +
-                        Because(share.rsync_errors) + "; it is not marked complete";
-        Fail(rc != 0 ? RunFailure::kLocal : ClassifyTransferResult(result), share.message);
+        share.message =
+            (notServed ? NotServedMessage(share.name, result)
+                       : "copying share '" + share.name + "' failed: " + NameAndMeaning(result)) +
+            Because(share.rsync_errors) + "; it is not marked complete";
+        Fail(rc != 0 ? RunFailure::kLocal : ClassifyShareRunResult(result), share.message);
         return;
     }
     if (result == kResultVanished) {

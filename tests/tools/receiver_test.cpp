@@ -716,18 +716,23 @@ TEST(ReceiverTool, TheDaemonTakesOnlyWhatItShould) {
     wrapper_test::MakeDirs(src);
     s2s_test::WriteFile(src + "/f", "data");
 
+    // A run pairs before its first dry run or data run: the pairing alone brings the served
+    // shares up to date, for a share registered after start as for one removed since.
     server.AddShare("late");
+    ASSERT_EQ(VURNShareRemove("vault"), 0);
     VURN::Backup::RsyncWrapper w;
     server.Aim(w, "");
     w.setVurnCustCmdRule(
         {"command=\"S2S_Pairing\"", "clientID=\"SN1\"", "dryRun=\"no\"", "serverName=\"sender\""});
     ASSERT_EQ(w.execute(boost::function<bool()>()), 0);
-    w.setVurnCustCmdRule({"command=\"S2S_SyncStart\"", "clientID=\"SN1\"", "volumeName=\"volume1\"",
-                          "shareName=\"late\""});
-    EXPECT_EQ(w.execute(boost::function<bool()>()), 0);
     wrapper_test::Run late = rsync({"-r", src + "/", base + "late/"});
     EXPECT_EQ(late.status, 0) << "a share registered after start is served: " << late.output;
     EXPECT_EQ(s2s_test::ReadFile(server.SharePath("late") + "/f"), "data");
+    EXPECT_EQ(rsync({"-r", src + "/", base + "vault/"}).status, 5) << "a removed share is served";
+    server.AddShare("vault", true);
+    w.setVurnCustCmdRule({"command=\"S2S_SyncStart\"", "clientID=\"SN1\"", "volumeName=\"volume1\"",
+                          "shareName=\"vault\""});
+    EXPECT_EQ(w.execute(boost::function<bool()>()), 0);
 
     ASSERT_EQ(mknod((src + "/null").c_str(), S_IFCHR | 0666, makedev(1, 3)), 0);
     s2s_test::WriteFile(src + "/suid", "#!/bin/sh\n");
