@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "rsync/transfer_meter.h"
+#include "s2s_platform.h"
 
 namespace S2S {
 
@@ -370,6 +371,21 @@ void TaskRun::SyncShare(ShareOutcome& share) {
         return;
     }
     share.encrypted = info.IsEncrypted();
+    // The server files a share under its volume's name: a folder on the root file system, with
+    // no volume named for it, has none, and the server would refuse the start for a missing key.
+    VolumeInfo volume;
+    if (GetVolumeInfo(share.name, volume) == 0 && volume.GetPath().size() < 2) {
+        std::string parent = info.GetPath().substr(0, info.GetPath().rfind('/'));
+        share.state = ShareState::kRefused;
+        share.step = "start";
+        share.message = "share '" + share.name + "' lies on no named volume (its folder " +
+                        info.GetPath() + " is on the root file system): name its volume under " +
+                        "[volumes] in " + S2SPath(S2S_PATH_HOST_CONF) + ", e.g. " +
+                        (parent.empty() ? info.GetPath() : parent) + "=\"internal,directory\"";
+        share.seconds = SecondsSince(start);
+        Fail(RunFailure::kLocal, share.message);
+        return;
+    }
     const TreeSize size = MeasureTree(info.GetModulePath());
     share.files = size.files;
     share.bytes = size.bytes;
