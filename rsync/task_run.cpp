@@ -216,6 +216,14 @@ bool TaskRun::Connect() {
             ? info.GetServerName()
             : info.GetServerIP() +
                   (info.GetServerName().empty() ? "" : " (" + info.GetServerName() + ")");
+    // Every control command names this server by its client ID: without one nothing can be asked.
+    if (GetClientID().empty()) {
+        Fail(RunFailure::kLocal,
+             std::string("no client ID could be found for this server (no serial number, no "
+                         "network interface with a MAC address): set serial= under [host] in ") +
+                 S2SPath(S2S_PATH_HOST_CONF));
+        return false;
+    }
     Say("connecting to " + target + " as " + info.GetUser());
     const int rc = rsyncer_.Connect(info);
     server_version_ = rsyncer_.GetServerVersionValue();
