@@ -554,7 +554,7 @@ int UpdateTaskStatus(const Command& c) {
         return rc;
     }
     const std::string& task = c.Get("taskName");
-    if (!receiver_internal::ValidTaskName(task)) {
+    if (!ReceiverTaskNameValid(task)) {
         return kReceiverBadName;
     }
     int paired = ClientPaired(c.Client());
@@ -580,13 +580,6 @@ namespace receiver_internal {
 
 bool ValidShareName(const std::string& name) {
     return VURNShareNameIsSyncable(name.c_str()) == 1;
-}
-
-bool ValidTaskName(const std::string& name) {
-    return !name.empty() && name.size() <= VURN_SHARE_NAME_MAX && !HasControl(name) &&
-           name.find_first_of("/\"'`[]\\") == std::string::npos &&
-           name.find("..") == std::string::npos && name.front() != ' ' && name.front() != '@' &&
-           name.back() != ' ';
 }
 
 int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs) {
@@ -642,6 +635,18 @@ int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs)
 }
 
 }  // namespace receiver_internal
+
+const char kReceiverTaskNameRule[] =
+    "the task's name is not one a receiver takes: at most 255 bytes, not empty, no control "
+    "characters, quotes, brackets, slashes, backslashes or \"..\", no leading '@', no leading or "
+    "trailing blank";
+
+bool ReceiverTaskNameValid(const std::string& name) {
+    return !name.empty() && name.size() <= VURN_SHARE_NAME_MAX && !HasControl(name) &&
+           name.find_first_of("/\"'`[]\\") == std::string::npos &&
+           name.find("..") == std::string::npos && name.front() != ' ' && name.front() != '@' &&
+           name.back() != ' ';
+}
 
 ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer) {
     ReceiverAnswer answer;

@@ -7,6 +7,7 @@
 
 #include "rsync/transfer_meter.h"
 #include "s2s_platform.h"
+#include "s2s_receiver.h"
 
 namespace S2S {
 
@@ -222,6 +223,10 @@ bool TaskRun::Connect() {
              std::string("no client ID could be found for this server (no serial number, no "
                          "network interface with a MAC address): set serial= under [host] in ") +
                  S2SPath(S2S_PATH_HOST_CONF));
+        return false;
+    }
+    if (!ReceiverTaskNameValid(task_.GetInfo().GetName())) {
+        Fail(RunFailure::kLocal, kReceiverTaskNameRule);
         return false;
     }
     Say("connecting to " + target + " as " + info.GetUser());
