@@ -103,6 +103,13 @@ struct S2S_EXPORT ReceiverAnswer {
 };
 S2S_EXPORT ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer);
 
+// Whether the receiver takes `name` as a task name (the task's heartbeat): not empty, at most a
+// share name's length, no control characters, quotes, brackets, slashes, backslashes or "..", no
+// outer blanks, no leading '@'. Senders check it before a run sends anything.
+S2S_EXPORT bool ReceiverTaskNameValid(const std::string& name);
+// The rule above, for a person.
+extern S2S_EXPORT const char kReceiverTaskNameRule[];
+
 // The daemon's hooks for the command module (environment as rsync sets it for them):
 // early exec: reads the command file from `in_fd`, answers into the spool. The process exit
 // status: 0 when a reply was left.

@@ -303,6 +303,21 @@ int RecordMultiClient(const std::string& clientID, const std::string& serverName
     return rc == 0 ? kReceiverOK : StoreWriteFailure();
 }
 
+// Brings the daemon's share modules up to date with the share registry: a share registered
+// (or removed) after the daemon was configured is served (or no longer served) from this moment
+// on, since the daemon reads its configuration afresh for every connection. Every run pairs
+// before its first dry run or data run, and every share start asks again. A failure is logged;
+// the command itself still stands.
+void RefreshModules() {
+    std::string error;
+    if (receiver_internal::RefreshShareModules(&error) != 0) {
+        Logger::LogMsg(Logger::Error,
+                       "[ERROR] receiver_commands.cpp(%d): the share modules were not brought up "
+                       "to date: %s\n",
+                       __LINE__, error.c_str());
+    }
+}
+
 class Command {
   public:
     Command(const Pairs& pairs, bool oldServer) : pairs_(pairs), oldServer_(oldServer) {}
@@ -370,6 +385,7 @@ int Pairing(const Command& c) {
     if (!multi && !single.empty() && single != c.Client()) {
         return kReceiverPairedOther;
     }
+    RefreshModules();
     if (dryRun) {
         return kReceiverOK;
     }
@@ -416,6 +432,7 @@ int PairingMultiSrc(const Command& c, ReceiverAnswer* a) {
     if (rc != kReceiverOK && rc != kReceiverShareConflict) {
         return rc == S2S_SVR_ERR_READ ? kReceiverStoreRead : kReceiverInternal;
     }
+    RefreshModules();
     a->hasOutput = true;
     for (size_t i = 0; i < refused.size(); ++i) {
         a->output += (i == 0 ? "" : ":") + refused[i];
@@ -491,15 +508,7 @@ int SyncStart(const Command& c) {
     if (withAttributes && encrypted != (c.Get("isEncrypt") == "1")) {
         return kReceiverAttrMismatch;
     }
-    // A share registered after the daemon was configured is served from this moment on: the
-    // daemon reads its configuration afresh for every connection, the data run included.
-    std::string error;
-    if (receiver_internal::RefreshShareModules(&error) != 0) {
-        Logger::LogMsg(Logger::Error,
-                       "[ERROR] receiver_commands.cpp(%d): the share modules were not brought up "
-                       "to date: %s\n",
-                       __LINE__, error.c_str());
-    }
+    RefreshModules();
     return UpdateShare(
         share,
         {{"RunningID", c.Client()}, {"CompleteID", CompleteID(share)}, {"LastStart", Now()}});
@@ -545,7 +554,7 @@ int UpdateTaskStatus(const Command& c) {
         return rc;
     }
     const std::string& task = c.Get("taskName");
-    if (!receiver_internal::ValidTaskName(task)) {
+    if (!ReceiverTaskNameValid(task)) {
         return kReceiverBadName;
     }
     int paired = ClientPaired(c.Client());
@@ -571,13 +580,6 @@ namespace receiver_internal {
 
 bool ValidShareName(const std::string& name) {
     return VURNShareNameIsSyncable(name.c_str()) == 1;
-}
-
-bool ValidTaskName(const std::string& name) {
-    return !name.empty() && name.size() <= VURN_SHARE_NAME_MAX && !HasControl(name) &&
-           name.find_first_of("/\"'`[]\\") == std::string::npos &&
-           name.find("..") == std::string::npos && name.front() != ' ' && name.front() != '@' &&
-           name.back() != ' ';
 }
 
 int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs) {
@@ -633,6 +635,18 @@ int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs)
 }
 
 }  // namespace receiver_internal
+
+const char kReceiverTaskNameRule[] =
+    "the task's name is not one a receiver takes: at most 255 bytes, not empty, no control "
+    "characters, quotes, brackets, slashes, backslashes or \"..\", no leading '@', no leading or "
+    "trailing blank";
+
+bool ReceiverTaskNameValid(const std::string& name) {
+    return !name.empty() && name.size() <= VURN_SHARE_NAME_MAX && !HasControl(name) &&
+           name.find_first_of("/\"'`[]\\") == std::string::npos &&
+           name.find("..") == std::string::npos && name.front() != ' ' && name.front() != '@' &&
+           name.back() != ' ';
+}
 
 ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer) {
     ReceiverAnswer answer;

@@ -547,11 +547,11 @@ int ShareModules(std::string* text, std::vector<std::string>* notes, std::string
         }
         const bool special = (share->status & VURN_SHARE_STATUS_SPECIAL_FILES) != 0;
         devices = devices || special;
-        // Clients push; nothing is read back. Setuid and setgid bits of received files are
-        // dropped unless the share asks to keep them.
+        // Clients push; nothing is read back. Setuid and setgid bits of received files and
+        // directories are dropped unless the share asks to keep them.
         std::string module = "\tpath = " + path + "\n\twrite only = yes\n";
         if (!special) {
-            module += "\tincoming chmod = Fug-s\n";
+            module += "\tincoming chmod = Dug-s,Fug-s\n";
         }
         c << "[" << name << "]\n" << module << "\n";
         if ((share->status & VURN_SHARE_STATUS_ENCRYPTED) != 0) {

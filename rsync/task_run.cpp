@@ -6,6 +6,8 @@
 #include <utility>
 
 #include "rsync/transfer_meter.h"
+#include "s2s_platform.h"
+#include "s2s_receiver.h"
 
 namespace S2S {
 
@@ -69,6 +71,22 @@ RunFailure ClassifyTransferResult(int code) {
 
 std::string NameAndMeaning(int code) {
     return RsyncResultName(code) + ", " + RsyncResultMeaning(code);
+}
+
+// A dry run or data run of one share runs after the control commands of the same run were taken
+// with the same credentials: its "auth" failure is the server refusing that share's module (not
+// registered there, or removed), never the password, and the other shares still sync.
+bool ShareNotServed(int code) {
+    return IsAuthFailure(code);
+}
+
+RunFailure ClassifyShareRunResult(int code) {
+    return ShareNotServed(code) ? RunFailure::kRefused : ClassifyTransferResult(code);
+}
+
+std::string NotServedMessage(const std::string& share, int code) {
+    return "the server does not serve share '" + share +
+           "' (is it registered there?): " + NameAndMeaning(code);
 }
 
 // rsync's own lines (or the library's local cause) as one line for a message: "" or ": a; b".
@@ -204,6 +222,18 @@ bool TaskRun::Connect() {
             ? info.GetServerName()
             : info.GetServerIP() +
                   (info.GetServerName().empty() ? "" : " (" + info.GetServerName() + ")");
+    // Every control command names this server by its client ID: without one nothing can be asked.
+    if (GetClientID().empty()) {
+        Fail(RunFailure::kLocal,
+             std::string("no client ID could be found for this server (no serial number, no "
+                         "network interface with a MAC address): set serial= under [host] in ") +
+                 S2SPath(S2S_PATH_HOST_CONF));
+        return false;
+    }
+    if (!ReceiverTaskNameValid(task_.GetInfo().GetName())) {
+        Fail(RunFailure::kLocal, kReceiverTaskNameRule);
+        return false;
+    }
     Say("connecting to " + target + " as " + info.GetUser());
     const int rc = rsyncer_.Connect(info);
     server_version_ = rsyncer_.GetServerVersionValue();
@@ -326,6 +356,12 @@ bool TaskRun::GuardSource(ShareOutcome& share) {
     share.message = guard.message;
     if (Cancelled()) {
         share.state = ShareState::kCancelled;
+    } else if (guard.result == SourceGuardResult::kCheckFailed &&
+               ShareNotServed(guard.dryRunResult)) {
+        share.state = ShareState::kRefused;
+        share.result = guard.dryRunResult;
+        share.message = NotServedMessage(share.name, guard.dryRunResult);
+        Fail(ClassifyShareRunResult(guard.dryRunResult), share.message);
     } else if (guard.result == SourceGuardResult::kCheckFailed) {
         share.state = ShareState::kFailed;
         share.result = guard.dryRunResult;
@@ -357,6 +393,21 @@ void TaskRun::SyncShare(ShareOutcome& share) {
         return;
     }
     share.encrypted = info.IsEncrypted();
+    // The server files a share under its volume's name: a folder on the root file system, with
+    // no volume named for it, has none, and the server would refuse the start for a missing key.
+    VolumeInfo volume;
+    if (GetVolumeInfo(share.name, volume) == 0 && volume.GetPath().size() < 2) {
+        std::string parent = info.GetPath().substr(0, info.GetPath().rfind('/'));
+        share.state = ShareState::kRefused;
+        share.step = "start";
+        share.message = "share '" + share.name + "' lies on no named volume (its folder " +
+                        info.GetPath() + " is on the root file system): name its volume under " +
+                        "[volumes] in " + S2SPath(S2S_PATH_HOST_CONF) + ", e.g. " +
+                        (parent.empty() ? info.GetPath() : parent) + "=\"internal,directory\"";
+        share.seconds = SecondsSince(start);
+        Fail(RunFailure::kLocal, share.message);
+        return;
+    }
     const TreeSize size = MeasureTree(info.GetModulePath());
     share.files = size.files;
     share.bytes = size.bytes;
@@ -402,13 +453,16 @@ void TaskRun::SyncShare(ShareOutcome& share) {
     // Files that vanish while they are being sent are normal on a live share; the next run takes
     // the share as it is then.
     if (rc != 0 || (result != 0 && result != kResultVanished)) {
-        share.state = ShareState::kFailed;
+        const bool notServed = rc == 0 && ShareNotServed(result);
+        share.state = notServed ? ShareState::kRefused : ShareState::kFailed;
         share.step = "copy";
         share.result = result;
         share.rsync_errors = rsyncer_.GetLastError();
-        share.message = "copying share '" + share.name + "' failed: " + NameAndMeaning(result) +
-                        Because(share.rsync_errors) + "; it is not marked complete";
-        Fail(rc != 0 ? RunFailure::kLocal : ClassifyTransferResult(result), share.message);
+        share.message =
+            (notServed ? NotServedMessage(share.name, result)
+                       : "copying share '" + share.name + "' failed: " + NameAndMeaning(result)) +
+            Because(share.rsync_errors) + "; it is not marked complete";
+        Fail(rc != 0 ? RunFailure::kLocal : ClassifyShareRunResult(result), share.message);
         return;
     }
     if (result == kResultVanished) {

@@ -11,6 +11,7 @@
 #include "s2s_control.h"
 #include "s2s_host.h"
 #include "s2s_logger.h"
+#include "s2s_receiver.h"
 #include "s2s_sync_obj.h"
 #include "s2s_task_run.h"
 
@@ -746,6 +747,11 @@ bool ReadTask(const PObject& request, S2S::SyncTask& task, bool& has_password,
     task.SetInfo(info);
     if (!task.GetInfo().Validate()) {
         SetStatus(reply, Control::kInvalidTask, InvalidTaskMessage(task.GetInfo()));
+        return false;
+    }
+    // The receiver records every run under the task's name: a name it refuses fails each run.
+    if (!S2S::ReceiverTaskNameValid(task.GetInfo().GetName())) {
+        SetStatus(reply, Control::kInvalidTask, S2S::kReceiverTaskNameRule);
         return false;
     }
     return true;

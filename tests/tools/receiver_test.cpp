@@ -463,11 +463,12 @@ TEST(ReceiverTool, ConfigureWritesModulesAndAPrivateSecret) {
     }
     EXPECT_EQ(conf.find("[global]"), std::string::npos) << "a share named global";
     EXPECT_EQ(conf.find("pw with"), std::string::npos);
-    // Defensive modules: shares are pushed into, never read back, and drop setuid bits; keys
+    // Defensive modules: shares are pushed into, never read back, and drop setuid and setgid
+    // bits (of directories too); keys
     // arrive private, through a hook that checks the destination; connections are limited.
     for (const std::string& needle : std::vector<std::string>{
              "[photos]\n\tpath = " + server.SharePath("photos") +
-                 "\n\twrite only = yes\n\tincoming chmod = Fug-s\n",
+                 "\n\twrite only = yes\n\tincoming chmod = Dug-s,Fug-s\n",
              "\twrite only = yes\n\tincoming chmod = D700,F600\n\tpre-xfer exec = ", "hook-key\n",
              "max connections = 16\n"}) {
         EXPECT_NE(conf.find(needle), std::string::npos) << needle << "\n" << conf;
@@ -480,6 +481,11 @@ TEST(ReceiverTool, ConfigureWritesModulesAndAPrivateSecret) {
     struct stat st;
     ASSERT_EQ(stat(secrets.c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0600u);
+    // A password file with CR LF line ends gives the password the sender reads from it.
+    wrapper_test::Run crlf = server.Tool(
+        {"configure", "--user", "s2suser", "--port", std::to_string(server.Port())}, "pw crlf\r\n");
+    EXPECT_EQ(crlf.status, 0) << crlf.output;
+    EXPECT_EQ(s2s_test::ReadFile(secrets), "s2suser:pw crlf\n");
 
     EXPECT_NE(server.Tool({"configure", "--user", "bad:user"}, "pw\n").status, 0);
     EXPECT_NE(server.Tool({"configure", "--user", "u"}, "").status, 0) << "no password";
@@ -716,22 +722,29 @@ TEST(ReceiverTool, TheDaemonTakesOnlyWhatItShould) {
     wrapper_test::MakeDirs(src);
     s2s_test::WriteFile(src + "/f", "data");
 
+    // A run pairs before its first dry run or data run: the pairing alone brings the served
+    // shares up to date, for a share registered after start as for one removed since.
     server.AddShare("late");
+    ASSERT_EQ(VURNShareRemove("vault"), 0);
     VURN::Backup::RsyncWrapper w;
     server.Aim(w, "");
     w.setVurnCustCmdRule(
         {"command=\"S2S_Pairing\"", "clientID=\"SN1\"", "dryRun=\"no\"", "serverName=\"sender\""});
     ASSERT_EQ(w.execute(boost::function<bool()>()), 0);
-    w.setVurnCustCmdRule({"command=\"S2S_SyncStart\"", "clientID=\"SN1\"", "volumeName=\"volume1\"",
-                          "shareName=\"late\""});
-    EXPECT_EQ(w.execute(boost::function<bool()>()), 0);
     wrapper_test::Run late = rsync({"-r", src + "/", base + "late/"});
     EXPECT_EQ(late.status, 0) << "a share registered after start is served: " << late.output;
     EXPECT_EQ(s2s_test::ReadFile(server.SharePath("late") + "/f"), "data");
+    EXPECT_EQ(rsync({"-r", src + "/", base + "vault/"}).status, 5) << "a removed share is served";
+    server.AddShare("vault", true);
+    w.setVurnCustCmdRule({"command=\"S2S_SyncStart\"", "clientID=\"SN1\"", "volumeName=\"volume1\"",
+                          "shareName=\"vault\""});
+    EXPECT_EQ(w.execute(boost::function<bool()>()), 0);
 
     ASSERT_EQ(mknod((src + "/null").c_str(), S_IFCHR | 0666, makedev(1, 3)), 0);
     s2s_test::WriteFile(src + "/suid", "#!/bin/sh\n");
     chmod((src + "/suid").c_str(), 04755);
+    wrapper_test::MakeDirs(src + "/sgid");
+    chmod((src + "/sgid").c_str(), 02755);
     wrapper_test::Run special = rsync({"-r", "--perms", "--owner", "--group", "--devices",
                                        "--specials", src + "/", base + "photos/"});
     EXPECT_EQ(special.status, 23) << special.output;
@@ -739,6 +752,8 @@ TEST(ReceiverTool, TheDaemonTakesOnlyWhatItShould) {
     struct stat st;
     ASSERT_EQ(stat((server.SharePath("photos") + "/suid").c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 07777, 0755u);
+    ASSERT_EQ(stat((server.SharePath("photos") + "/sgid").c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0755u) << "a setgid directory arrived";
     EXPECT_NE(rsync({"-r", base + "photos/", server.Root() + "/back/"}).status, 0)
         << "a share was read back";
 

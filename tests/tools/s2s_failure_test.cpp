@@ -1,6 +1,7 @@
 // End-to-end scenarios of `s2s sync` that must fail, or cope, with a clear exit code and message:
-// a second sender pairing a share that is taken, an old server, Ctrl-C in the middle of a copy, a
-// receiver that is down, a wrong password, an unsafe temporary directory and a full disk.
+// a second sender pairing a share that is taken, a sender without a client ID, an old server,
+// Ctrl-C in the middle of a copy, a receiver that is down, a wrong password, an unsafe temporary
+// directory and a full disk.
 #include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/mount.h>
@@ -58,6 +59,14 @@ TEST_F(FailureScenario, SecondSenderPairingATakenShareIsRefusedWithTheShareNamed
     EXPECT_EQ(Manifest(receiver_->SharePath("docs")), before);
     EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-A, last sync completed"),
               std::string::npos);
+
+    // A sender with no serial number and no MAC address (only loopback here) has no client ID.
+    Sender nameless("nameless", "", kPassword);
+    nameless.AddShare("media");
+    const Result n = nameless.Sync(kUser, {"media"});
+    EXPECT_NE(n.status, 0);
+    EXPECT_NE(n.err.find("no client ID could be found"), std::string::npos) << n.err;
+    EXPECT_NE(n.err.find("set serial= under [host]"), std::string::npos) << n.err;
 }
 
 TEST_F(FailureScenario, OldServerIsSyncedWithoutMultiSourcePairing) {

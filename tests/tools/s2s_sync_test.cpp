@@ -1,7 +1,8 @@
 // End-to-end scenarios of `s2s sync` against a real receiver (s2s-receiver and its rsync daemon):
 // what arrives on the receiving server after a first sync, an incremental one, deletions, a
-// receiver restarted in the middle of a transfer, and the guards that keep an empty or unmounted
-// source and an oversized deletion from wiping the receiver's copy.
+// receiver restarted in the middle of a transfer, shares registered on the receiver late or not
+// at all, and the guards that keep an empty or unmounted source and an oversized deletion from
+// wiping the receiver's copy.
 #include <gtest/gtest.h>
 #include <sys/mount.h>
 
@@ -188,6 +189,27 @@ TEST_F(SyncScenario, EmptiedFolderIsRefusedUnlessAllowed) {
     r = sender_->Sync(kUser, {"docs"}, {"--allow-empty-source"});
     ASSERT_EQ(r.status, 0) << r.All();
     ExpectSame("docs");
+}
+
+// A share registered on the receiver after it was started is served from the run's pairing on,
+// even when it is the first share; a share the receiver does not serve is refused as such (not
+// as a password fault) and the other shares still sync.
+TEST_F(SyncScenario, LateShareSyncsAndAnUnservedShareIsRefusedAlone) {
+    for (const char* share : {"late", "gone"}) {
+        sender_->AddShare(share);
+        GenerateFiles(sender_->SharePath(share), 3, 100, 12);
+    }
+    GenerateFiles(sender_->SharePath("docs"), 3, 100, 13);
+    receiver_->AddShare("late");
+    const Result r = sender_->Sync(kUser, {"late", "gone", "docs"}, {"--json"});
+    EXPECT_NE(r.status, 0) << r.All();
+    ExpectSame("late");
+    ExpectSame("docs");
+    EXPECT_NE(r.err.find("does not serve share 'gone' (is it registered there?)"),
+              std::string::npos)
+        << r.err;
+    EXPECT_EQ(r.err.find("password"), std::string::npos) << r.err;
+    EXPECT_NE(r.out.find("\"state\": \"refused\""), std::string::npos) << r.out;
 }
 
 // A cap on deletions stops a run before it deletes anything; a count and a percentage of the

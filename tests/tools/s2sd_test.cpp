@@ -124,6 +124,8 @@ TEST_F(ControlSocket, HostileRequestsGetAClearErrorAndTheDaemonGoesOnServing) {
     PObject add_bad_key = TaskRequest(Control::kAdd, {"docs"}, 0);
     add_bad_key[Control::kKeyTask]["ssh_port"] = "22";
     PObject add_invalid = TaskRequest(Control::kAdd, {"nosuchshare"}, 0);
+    PObject add_bad_name = TaskRequest(Control::kAdd, {"docs"}, 0);
+    add_bad_name[Control::kKeyTask]["name"] = "../nightly";  // the receiver would refuse it
     PObject number_command;
     number_command[Control::kKeyCommand] = 5ULL;
     const struct {
@@ -138,6 +140,7 @@ TEST_F(ControlSocket, HostileRequestsGetAClearErrorAndTheDaemonGoesOnServing) {
         {add_text, Control::kBadRequest, "'task' must be a task map"},
         {add_bad_key, Control::kBadRequest, "'ssh_port' has the wrong type"},
         {add_invalid, Control::kInvalidTask, "share 'nosuchshare' is not valid"},
+        {add_bad_name, Control::kInvalidTask, "not one a receiver takes"},
         {Command(Control::kShow), Control::kBadRequest, "'task_id' is missing"},
         {nested, Control::kTooLarge, "nests deeper"},
     };
@@ -350,7 +353,8 @@ TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNe
     // SIGTERM: the transfer is cancelled, no rsync is left behind, the share is not complete.
     EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
     EXPECT_TRUE(ProcessesMentioning(sender_->SharePath("docs")).empty());
-    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
+    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
+              std::string::npos);
     daemon_->Start();
     ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
     // The copy is under way again (its progress shows in the status).
@@ -382,14 +386,16 @@ TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNe
     EXPECT_NE(runs[0][Control::kKeyEnd].asUInt64(), 0u);
     EXPECT_EQ(runs[1][Control::kKeyResult].asUInt64(),
               static_cast<unsigned long long>(S2S::RunFailure::kCancelled));
-    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
+    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
+              std::string::npos);
 
     ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
     ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(300))) << daemon_->Log();
     runs = Runs(id);
     EXPECT_EQ(runs[0][Control::kKeyResult].asUInt64(), 0u) << runs[0].toString();
     EXPECT_EQ(Manifest(sender_->SharePath("docs")), Manifest(receiver_->SharePath("docs")));
-    EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
+    EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
+              std::string::npos);
 }
 
 }  // namespace

@@ -109,6 +109,11 @@ int Configure(int argc, char** argv) {
         std::fputs("s2s-receiver: no password on standard input\n", stderr);
         return 1;
     }
+    // A password file written on another system may end its line with CR LF: the sender drops
+    // that one CR as well, so both ends read the same password from the same file.
+    if (!s.password.empty() && s.password.back() == '\r') {
+        s.password.pop_back();
+    }
     if (!VURN::Backup::RsyncWrapper::credentialsFit(s.user, s.password)) {
         std::fprintf(stderr,
                      "s2s-receiver: the password is too long: rsync cannot authenticate user name "
