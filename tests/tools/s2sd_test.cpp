@@ -47,6 +47,7 @@ class Daemon {
         return status;
     }
     std::string Socket() const { return host_.Root() + Control::kSocketPath; }
+    pid_t Pid() const { return child_ ? child_->Pid() : -1; }
     std::string Log() const { return log_ + (child_ ? child_->Err() : ""); }
 
     PObject Call(const PObject& request) {
@@ -197,6 +198,18 @@ TEST_F(ControlSocket, HostileRequestsGetAClearErrorAndTheDaemonGoesOnServing) {
     ASSERT_EQ(stat(password_file.c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0600u);
     EXPECT_EQ(daemon_.Log().find(kPassword), std::string::npos);
+
+    // A second daemon on the same root, in the foreground or detaching, is refused before it
+    // touches the socket; the first goes on serving.
+    for (const char* mode : {"--verbose", "--daemon"}) {
+        Child second({Tool("s2sd"), mode}, host_.Env(), host_.Root() + "/logs");
+        EXPECT_EQ(second.Wait(), 1) << mode;
+        EXPECT_NE(second.Err().find("s2sd is already running (pid " +
+                                    std::to_string(daemon_.Pid()) + ")"),
+                  std::string::npos)
+            << second.Err();
+    }
+    EXPECT_EQ(StatusOf(daemon_.Call(Command(Control::kList))), Control::kOk);
     EXPECT_EQ(daemon_.Stop(SIGTERM), 0);
 }
 
