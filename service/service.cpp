@@ -444,7 +444,10 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
     RunRecord record;
     record.task_id = id;
     record.start = clock_.Now();
+    // Why the run's history could not be written (a full disk, say): the status says so.
+    std::string history_error;
     if (store_.BeginRun(id, record.start, record.id, error) != 0) {
+        history_error = error;
         Logger::LogMsg(Logger::Error, "[ERROR] service.cpp(%d): task %llu: %s\n", __LINE__,
                        static_cast<unsigned long long>(id), error.c_str());
     }
@@ -498,6 +501,7 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
                        __LINE__, static_cast<unsigned long long>(id), record.message.c_str());
     }
     if (record.id != 0 && store_.EndRun(record, error) != 0) {
+        history_error = error;
         Logger::LogMsg(Logger::Error, "[ERROR] service.cpp(%d): task %llu: %s\n", __LINE__,
                        static_cast<unsigned long long>(id), error.c_str());
     }
@@ -506,7 +510,8 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
     if (it != tasks_.end()) {
         it->second->has_result = true;
         it->second->last_result = record.result;
-        it->second->last_message = record.message;
+        it->second->last_message =
+            history_error.empty() ? record.message : "history not recorded: " + history_error;
     }
 }
 
