@@ -15,6 +15,7 @@
 #include <string>
 
 #include "s2s_control.h"
+#include "s2s_host.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "service/files.h"
@@ -194,6 +195,14 @@ int main(int argc, char** argv) {
         S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd(%d): %s\n", __LINE__,
                             lock_error.c_str());
         return 1;
+    }
+
+    // The private temporary directory of remote commands is made now, before another user can
+    // make it first; when one stands in its way already, every run would fail, so say it now.
+    std::string temp_error;
+    if (!S2S::PrepareTempDir(temp_error)) {
+        S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd(%d): %s\n", __LINE__,
+                            temp_error.c_str());
     }
 
     s2sd::WallClock clock;
