@@ -561,6 +561,8 @@ void Service::CapLastScheduled(TaskState& state, long now) {
 }
 
 void Service::Tick(long now_ms) {
+    // Real-time shares whose folder went away are watched again once it is back.
+    OnChanges(watch_.Rewatch(now_ms), now_ms);
     std::map<uint64_t, long> due_at;
     const std::vector<uint64_t> due = scheduler_.Tick(&due_at);
     if (scheduler_.Recomputed()) {

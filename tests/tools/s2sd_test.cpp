@@ -1,5 +1,6 @@
-// s2sd as a program: the control socket under hostile clients, a real-time task on a real
-// inotify watch, and a kill -9 during a run followed by a restart.
+// s2sd as a program: the control socket under hostile clients and a second instance refused, a
+// real-time task on a real inotify watch (kept when the share's folder goes away and comes back),
+// and a kill -9 during a run followed by a restart.
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -277,6 +278,21 @@ TEST_F(DaemonScenario, RealTimeTaskFollowsChangesIncludingNewDirectories) {
     ASSERT_TRUE(WaitFor([&] { return IsPathThere(arrived); }, std::chrono::seconds(60)))
         << daemon_->Log();
     EXPECT_TRUE(WaitFor([&] { return s2s_test::ReadFile(arrived) == "written later"; }));
+
+    // The share's folder goes away and comes back (a volume unmounted and mounted again): it is
+    // watched again and what it holds then is synced.
+    const std::string folder = sender_->SharePath("docs");
+    ASSERT_TRUE(WaitForRuns(id, 1, std::chrono::seconds(60)));
+    const size_t runs = Runs(id).size();
+    s2s_test::RemoveTree(folder);
+    // The removal itself is a change; its run ends before the folder comes back.
+    ASSERT_TRUE(WaitForRuns(id, runs + 1, std::chrono::seconds(60))) << daemon_->Log();
+    MakeDirs(folder);
+    WriteFile(folder + "/back", "after the return");
+    EXPECT_TRUE(WaitFor([&] { return IsPathThere(receiver_->SharePath("docs") + "/back"); },
+                        std::chrono::seconds(60)))
+        << daemon_->Log();
+    EXPECT_NE(daemon_->Log().find("[NOTE] realtime_watch.cpp"), std::string::npos);
 }
 
 TEST_F(DaemonScenario, ATasksGuardOptionsKeepTheReceiversCopyAndTheRefusalIsRecorded) {
