@@ -151,6 +151,15 @@ bool PrepareTempDir(const std::string& dir, std::string& error) {
 
 }  // namespace
 
+bool PrepareTempDir(std::string& error) {
+    const char* dir = S2SPath(S2S_PATH_TEMP_DIR);
+    if (dir == nullptr) {
+        error = "out of memory";
+        return false;
+    }
+    return PrepareTempDir(std::string(dir), error);
+}
+
 std::string GetTempFile(std::string& error) {
     const char* dir = S2SPath(S2S_PATH_TEMP_DIR);
     const char* tmpl = S2SPath(S2S_PATH_TEMP_TEMPLATE);

@@ -59,6 +59,10 @@ class S2S_EXPORT LockFactory {
 S2S_EXPORT std::string GetTempFile();
 // The same without logging; on failure `error` says why in words, for the caller to report.
 S2S_EXPORT std::string GetTempFile(std::string& error);
+// Creates "/tmp/S2S" (under $S2S_ROOT when set) and checks it as GetTempFile does; the service
+// calls it at start, so a directory another user made first is reported at once, not at the
+// first remote command. False with `error` saying why and what to do.
+S2S_EXPORT bool PrepareTempDir(std::string& error);
 // Deletes a file from GetTempFile. An empty path does nothing.
 S2S_EXPORT void PutTempFile(const std::string& path);
 

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -257,6 +258,7 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
     }
     Fd null_fd(devnull);
 
+    const pid_t parent = getpid();
     pid_t pid = fork();
     if (pid < 0) {
         outcome.error = std::string("fork: ") + strerror(errno);
@@ -264,6 +266,13 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
     }
     if (pid == 0) {
         setpgid(0, 0);
+        // The child is told (SIGTERM) when its parent dies, even by SIGKILL, so a killed service
+        // leaves no transfer behind. The kernel ties this to the thread that forked, not the
+        // process: callers wait for the child on the thread that started it, so the thread never
+        // ends first. A parent that died before the request took effect is caught by getppid().
+        if (prctl(PR_SET_PDEATHSIG, SIGTERM) != 0 || getppid() != parent) {
+            _exit(127);
+        }
         // Default dispositions: the caller may ignore SIGPIPE or block signals.
         sigset_t none;
         sigemptyset(&none);

@@ -1,6 +1,9 @@
 // One child program run without a shell, in a process group of its own, with its standard output
 // and error merged into one pipe that the caller sees line by line. The run can be cancelled: the
-// whole group gets SIGTERM, then SIGKILL, and nothing of it survives the call.
+// whole group gets SIGTERM, then SIGKILL, and nothing of it survives the call. When the calling
+// process dies (even by SIGKILL) the child gets SIGTERM from the kernel; the kernel sends it when
+// the forking thread ends, so RunChild must return on the thread that called it (it does: it
+// waits for the child itself).
 #ifndef S2S_RSYNC_CHILD_PROCESS_H
 #define S2S_RSYNC_CHILD_PROCESS_H
 

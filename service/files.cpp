@@ -1,11 +1,13 @@
-// Directory creation and whole-file replacement for the daemon's files.
+// Directory creation, whole-file replacement and the instance lock for the daemon's files.
 #include "service/files.h"
 
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 
 namespace s2sd {
@@ -98,6 +100,48 @@ bool ReadFile(const std::string& path, std::string& content) {
         }
         content.append(buffer, static_cast<size_t>(n));
     }
+}
+
+int LockInstance(const std::string& path, long& holder, std::string& error) {
+    holder = 0;
+    const std::string dir = path.substr(0, path.rfind('/'));
+    if (!dir.empty() && MakeDirs(dir, 0700, error) != 0) {
+        return -1;
+    }
+    const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
+    if (fd < 0) {
+        error = Why("cannot open", path);
+        return -1;
+    }
+    if (flock(fd, LOCK_EX | LOCK_NB) == 0) {
+        return fd;
+    }
+    const int saved = errno;
+    if (saved == EWOULDBLOCK) {
+        char text[32] = {};
+        const ssize_t got = pread(fd, text, sizeof(text) - 1, 0);
+        if (got > 0) {
+            holder = std::strtol(text, nullptr, 10);
+        }
+        error = "s2sd is already running (pid " +
+                (holder > 0 ? std::to_string(holder) : std::string("unknown")) + ")";
+        close(fd);
+        return -2;
+    }
+    errno = saved;
+    error = Why("cannot lock", path);
+    close(fd);
+    return -1;
+}
+
+int WriteLockPid(int fd, std::string& error) {
+    const std::string text = std::to_string(static_cast<long>(getpid())) + "\n";
+    if (ftruncate(fd, 0) != 0 ||
+        pwrite(fd, text.data(), text.size(), 0) != static_cast<ssize_t>(text.size())) {
+        error = std::string("cannot write the pid into the lock file: ") + std::strerror(errno);
+        return -1;
+    }
+    return 0;
 }
 
 }  // namespace s2sd

@@ -12,7 +12,11 @@
 #include <cstring>
 #include <set>
 
+#include "s2s_logger.h"
+
 namespace s2sd {
+
+using S2S::Logger;
 
 namespace {
 
@@ -37,10 +41,69 @@ void RealtimeWatch::Reset() {
     }
     dirs_.clear();
     shares_.clear();
+    root_wd_.clear();
 }
 
-bool RealtimeWatch::AddTree(const std::string& dir, size_t share, std::string& reason) {
+bool RealtimeWatch::AddRoot(size_t i, std::string& reason) {
+    const bool ok = AddTree(shares_[i].root, i, reason, &root_wd_[i]);
+    if (ok && root_wd_[i] < 0) {
+        Logger::LogMsg(Logger::Warning,
+                       "[WARNING] realtime_watch.cpp(%d): task %llu: share '%s': its folder %s is "
+                       "missing; it is watched again when it appears\n",
+                       __LINE__, static_cast<unsigned long long>(shares_[i].task),
+                       shares_[i].share.c_str(), shares_[i].root.c_str());
+    }
+    return ok;
+}
+
+void RealtimeWatch::LoseRoot(size_t i) {
+    if (root_wd_[i] < 0) {
+        return;
+    }
+    // A folder moved away keeps its watch: dropped here, so the share's path is watched afresh.
+    inotify_rm_watch(fd_, root_wd_[i]);
+    root_wd_[i] = -1;
+    Logger::LogMsg(Logger::Warning,
+                   "[WARNING] realtime_watch.cpp(%d): task %llu: share '%s': its folder %s went "
+                   "away; it is watched again when it comes back\n",
+                   __LINE__, static_cast<unsigned long long>(shares_[i].task),
+                   shares_[i].share.c_str(), shares_[i].root.c_str());
+}
+
+std::vector<ShareChange> RealtimeWatch::Rewatch(long now_ms) {
+    std::vector<ShareChange> changes;
+    if (fd_ < 0 || now_ms - last_rewatch_ms_ < kRewatchMs) {
+        return changes;
+    }
+    last_rewatch_ms_ = now_ms;
+    for (size_t i = 0; i < shares_.size(); ++i) {
+        if (root_wd_[i] >= 0) {
+            continue;
+        }
+        struct stat st;
+        if (stat(shares_[i].root.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
+            continue;
+        }
+        std::string reason;
+        const bool ok = AddTree(shares_[i].root, i, reason, &root_wd_[i]);
+        if (root_wd_[i] < 0) {
+            continue;
+        }
+        Logger::LogMsg(Logger::Note,
+                       "[NOTE] realtime_watch.cpp(%d): task %llu: share '%s': its folder %s is "
+                       "watched again\n",
+                       __LINE__, static_cast<unsigned long long>(shares_[i].task),
+                       shares_[i].share.c_str(), shares_[i].root.c_str());
+        changes.push_back({shares_[i].task, shares_[i].share, !ok, reason});
+    }
+    return changes;
+}
+
+bool RealtimeWatch::AddTree(const std::string& dir, size_t share, std::string& reason, int* top) {
     const int wd = inotify_add_watch(fd_, dir.c_str(), kMask | IN_ONLYDIR);
+    if (top != nullptr) {
+        *top = wd;
+    }
     if (wd < 0) {
         if (errno == ENOSPC) {
             reason =
@@ -94,9 +157,10 @@ std::vector<ShareChange> RealtimeWatch::Watch(const std::vector<WatchedShare>& s
     }
     Reset();
     shares_ = shares;
+    root_wd_.assign(shares_.size(), -1);
     for (size_t i = 0; i < shares_.size(); ++i) {
         std::string reason;
-        if (!AddTree(shares_[i].root, i, reason)) {
+        if (!AddRoot(i, reason)) {
             full.push_back({shares_[i].task, shares_[i].share, true, reason});
         }
     }
@@ -131,6 +195,12 @@ std::vector<ShareChange> RealtimeWatch::Read() {
             const auto dir = dirs_.find(event->wd);
             if (dir == dirs_.end()) {
                 continue;
+            }
+            const bool gone = (event->mask & (IN_IGNORED | IN_DELETE_SELF | IN_MOVE_SELF)) != 0;
+            for (size_t i = 0; gone && i < root_wd_.size(); ++i) {
+                if (root_wd_[i] == event->wd) {
+                    LoseRoot(i);
+                }
             }
             if ((event->mask & IN_IGNORED) != 0) {
                 touched.insert(dir->second.shares.begin(), dir->second.shares.end());

@@ -2,7 +2,8 @@
 // which share of which task changed; directories created later are watched as they appear. When
 // the kernel's queue overflows, or a watch cannot be added (the max_user_watches limit), changes
 // may go unseen: the affected shares are reported with `full` set, so the caller syncs them whole
-// and logs why.
+// and logs why. A share whose folder is missing (at start, or removed or moved away later, as
+// when its volume is unmounted) is not watched until Rewatch() finds the folder again.
 #ifndef S2S_SERVICE_REALTIME_WATCH_H
 #define S2S_SERVICE_REALTIME_WATCH_H
 
@@ -42,14 +43,26 @@ class RealtimeWatch {
     std::vector<ShareChange> Read();
     // Directories watched now.
     size_t Count() const { return dirs_.size(); }
+    // Called on the caller's periodic tick: at most every kRewatchMs it tries again to watch the
+    // folders of shares that went away or were missing, and returns those it watches again as
+    // changed (their content is new to the watch). Logs a NOTE for each.
+    static constexpr long kRewatchMs = 10000;
+    std::vector<ShareChange> Rewatch(long now_ms);
 
   private:
     // Watches `dir` and every directory below it for `share`; false when a watch failed.
-    bool AddTree(const std::string& dir, size_t share, std::string& reason);
+    // `top`, when given, receives the watch of `dir` itself (-1 when it was not there).
+    bool AddTree(const std::string& dir, size_t share, std::string& reason, int* top = nullptr);
+    // Watches the folder of share `i`; its root watch stays -1 (with a WARNING) when it is missing.
+    bool AddRoot(size_t i, std::string& reason);
+    // The root of share `i` went away: its watch is dropped until Rewatch() finds it again.
+    void LoseRoot(size_t i);
     void Reset();
 
     int fd_ = -1;
     std::vector<WatchedShare> shares_;
+    std::vector<int> root_wd_;  // per share: the watch of its folder, -1 while it is missing
+    long last_rewatch_ms_ = 0;
     struct Dir {
         std::string path;
         std::vector<size_t> shares;  // indexes into shares_

@@ -40,7 +40,7 @@ void Scheduler::Set(uint64_t id, const S2S::Schedule& schedule, long last_schedu
     Entry entry;
     entry.schedule = schedule;
     if (schedule.GetMode() != S2S::SCHD_MODE(0) && schedule.GetMode() != S2S::SCHD_MODE(1)) {
-        entry.next = NextRunAfter(schedule, last_scheduled);
+        entry.next = NextRunAfter(schedule, CapAtNow(last_scheduled, clock_.Now()));
     }
     entries_[id] = entry;
 }

@@ -39,10 +39,15 @@ class Scheduler {
     // The next run of `schedule` strictly after `after` by the local wall clock; 0 when there is
     // none (or the schedule cannot give one).
     static long NextRunAfter(const S2S::Schedule& schedule, long after);
+    // `last_scheduled`, or `now` when it is later (the store keeps the capped value).
+    static long CapAtNow(long last_scheduled, long now) {
+        return last_scheduled > now ? now : last_scheduled;
+    }
 
     // Adds or replaces a task. `last_scheduled` is when its last scheduled run was due (or when
-    // it was added); a later run already past is due at the next Tick. Manual and real-time
-    // tasks have no next run.
+    // it was added); a later run already past is due at the next Tick. A `last_scheduled` later
+    // than now (stored while the clock was ahead) counts as now, so the task is not held back
+    // until that time. Manual and real-time tasks have no next run.
     void Set(uint64_t id, const S2S::Schedule& schedule, long last_scheduled);
     void Remove(uint64_t id);
     // The tasks due now, each once; their next runs move on. `due_at` receives, per task, the

@@ -294,7 +294,8 @@ int Service::Start(std::string& error) {
             state->last_message = last[0].message;
         }
         const S2S::Schedule& schedule = stored.task.GetInfo().GetSchedule();
-        scheduler_.Set(stored.task.GetID(), schedule, stored.last_scheduled);
+        CapLastScheduled(*state, now);
+        scheduler_.Set(stored.task.GetID(), schedule, state->stored.last_scheduled);
         tasks_[stored.task.GetID()] = std::move(state);
         // Changes made while the service was down were not seen: one full run.
         if (schedule.GetMode() == kRealtime && !stored.paused) {
@@ -444,7 +445,10 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
     RunRecord record;
     record.task_id = id;
     record.start = clock_.Now();
+    // Why the run's history could not be written (a full disk, say): the status says so.
+    std::string history_error;
     if (store_.BeginRun(id, record.start, record.id, error) != 0) {
+        history_error = error;
         Logger::LogMsg(Logger::Error, "[ERROR] service.cpp(%d): task %llu: %s\n", __LINE__,
                        static_cast<unsigned long long>(id), error.c_str());
     }
@@ -498,6 +502,7 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
                        __LINE__, static_cast<unsigned long long>(id), record.message.c_str());
     }
     if (record.id != 0 && store_.EndRun(record, error) != 0) {
+        history_error = error;
         Logger::LogMsg(Logger::Error, "[ERROR] service.cpp(%d): task %llu: %s\n", __LINE__,
                        static_cast<unsigned long long>(id), error.c_str());
     }
@@ -506,7 +511,8 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
     if (it != tasks_.end()) {
         it->second->has_result = true;
         it->second->last_result = record.result;
-        it->second->last_message = record.message;
+        it->second->last_message =
+            history_error.empty() ? record.message : "history not recorded: " + history_error;
     }
 }
 
@@ -536,7 +542,28 @@ void Service::Reap() {
     }
 }
 
+void Service::CapLastScheduled(TaskState& state, long now) {
+    const long capped = Scheduler::CapAtNow(state.stored.last_scheduled, now);
+    if (capped == state.stored.last_scheduled) {
+        return;
+    }
+    const uint64_t id = state.stored.task.GetID();
+    Logger::LogMsg(Logger::Warning,
+                   "[WARNING] service.cpp(%d): task %llu: its last scheduled run is recorded %ld "
+                   "seconds in the future (the clock was ahead): counted from now\n",
+                   __LINE__, static_cast<unsigned long long>(id),
+                   state.stored.last_scheduled - now);
+    state.stored.last_scheduled = capped;
+    std::string error;
+    if (store_.SetLastScheduled(id, capped, error) < 0) {
+        Logger::LogMsg(Logger::Error, "[ERROR] service.cpp(%d): task %llu: %s\n", __LINE__,
+                       static_cast<unsigned long long>(id), error.c_str());
+    }
+}
+
 void Service::Tick(long now_ms) {
+    // Real-time shares whose folder went away are watched again once it is back.
+    OnChanges(watch_.Rewatch(now_ms), now_ms);
     std::map<uint64_t, long> due_at;
     const std::vector<uint64_t> due = scheduler_.Tick(&due_at);
     if (scheduler_.Recomputed()) {
@@ -546,6 +573,14 @@ void Service::Tick(long now_ms) {
                        __LINE__);
     }
     std::lock_guard<std::mutex> lock(mutex_);
+    if (scheduler_.Recomputed()) {
+        // After the clock was set back, a stored time ahead of now would hold the task back at
+        // the next start.
+        const long now = clock_.Now();
+        for (auto& item : tasks_) {
+            CapLastScheduled(*item.second, now);
+        }
+    }
     for (uint64_t id : due) {
         std::string error;
         if (store_.SetLastScheduled(id, due_at[id], error) < 0) {

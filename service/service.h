@@ -68,6 +68,8 @@ class Service {
     void Wake();
     void DrainWake();
     void Tick(long now_ms);
+    // Brings a stored last_scheduled later than `now` back to `now`, in memory and in the store.
+    void CapLastScheduled(TaskState& state, long now);
     void RefreshWatch();
     void OnChanges(const std::vector<ShareChange>& changes, long now_ms);
     void Queue(uint64_t id, const std::set<std::string>& shares, const std::string& why);

@@ -1,7 +1,8 @@
 // TaskStore over SQLite. The schema holds the task fields as columns (shares in a table of their
 // own, in order), the runs and their per-share results. A password file is written before the
 // transaction that adds or changes its task commits, so a committed task always finds its
-// password; a file left by a transaction that did not commit is removed at the next open.
+// password; a file left by a transaction that did not commit is removed at the next open (never
+// when the task list cannot be read, nor when it is empty: that looks like a lost database).
 #include "service/task_store.h"
 
 #include <dirent.h>
@@ -9,8 +10,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdlib>
+#include <cstring>
 #include <set>
+#include <vector>
 
 #include "s2s_logger.h"
 #include "service/files.h"
@@ -232,22 +236,49 @@ std::string TaskStore::PasswordPath(uint64_t id) const {
 }
 
 void TaskStore::RemoveOrphanPasswords() {
+    // Only a task list read to its end decides which files are orphans; an empty list beside
+    // password files more likely means a lost or damaged database than removed tasks, so those
+    // files stay for the administrator to look at.
     std::set<std::string> ids;
     Statement select(db_, "SELECT id FROM tasks");
-    while (select.Step() == SQLITE_ROW) {
+    int rc = SQLITE_ROW;
+    while ((rc = select.Step()) == SQLITE_ROW) {
         ids.insert(std::to_string(select.Int(0)));
+    }
+    if (rc != SQLITE_DONE) {
+        Logger::LogMsg(Logger::Warning,
+                       "[WARNING] task_store.cpp(%d): the task list cannot be read (%s): no "
+                       "password file is removed\n",
+                       __LINE__, sqlite3_errmsg(db_));
+        return;
     }
     DIR* dir = opendir(password_dir_.c_str());
     if (dir == nullptr) {
         return;
     }
+    std::vector<std::string> orphans;
     while (struct dirent* entry = readdir(dir)) {
         const std::string name = entry->d_name;
         if (name != "." && name != ".." && ids.count(name) == 0) {
-            unlink((password_dir_ + "/" + name).c_str());
+            orphans.push_back(name);
         }
     }
     closedir(dir);
+    if (ids.empty() && !orphans.empty()) {
+        Logger::LogMsg(Logger::Warning,
+                       "[WARNING] task_store.cpp(%d): the task store holds no task but %s holds "
+                       "%zu password files: they are kept (remove them by hand if the tasks are "
+                       "really gone)\n",
+                       __LINE__, password_dir_.c_str(), orphans.size());
+        return;
+    }
+    for (const std::string& name : orphans) {
+        const std::string path = password_dir_ + "/" + name;
+        if (unlink(path.c_str()) != 0) {
+            Logger::LogMsg(Logger::Warning, "[WARNING] task_store.cpp(%d): cannot remove %s: %s\n",
+                           __LINE__, path.c_str(), std::strerror(errno));
+        }
+    }
 }
 
 int TaskStore::WritePassword(uint64_t id, const std::string& password, std::string& error) {

@@ -12,13 +12,15 @@ libdir=$(dirname "$(find "$prefix" -name 's2s.pc' | head -n 1)")/..
 export PKG_CONFIG_PATH=$libdir/pkgconfig
 export LD_LIBRARY_PATH=$libdir
 
-# The service units are installed and, where systemd's analyzer exists, pass its check (pointed at
-# the programs of this scratch prefix).
+# The service units are installed naming the programs of the prefix given at install time and,
+# where systemd's analyzer exists, pass its check; the temporary directory has its tmpfiles entry.
 for unit in s2sd.service s2s-receiver.service; do
   test -f "$prefix/lib/systemd/system/$unit"
+  grep -q "^ExecStart=$prefix/bin/" "$prefix/lib/systemd/system/$unit"
   sed -E "s#=(/[^ ]*)/(s2sd|s2s-receiver)( |\$)#=$prefix/bin/\2\3#" \
     "$prefix/lib/systemd/system/$unit" >"$scratch/$unit"
 done
+grep -q '^d /tmp/S2S 0700 root root -$' "$prefix/lib/tmpfiles.d/s2s.conf"
 if command -v systemd-analyze >/dev/null; then
   systemd-analyze verify "$scratch/s2sd.service" "$scratch/s2s-receiver.service"
 fi

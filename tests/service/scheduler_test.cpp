@@ -77,9 +77,12 @@ TEST_F(SchedulerTest, RunsMissedWhileDownRunOnceAtStart) {
     clock_.wall = At(2024, 3, 4, 10, 0);
     s2sd::Scheduler scheduler(clock_);
     scheduler.Set(7, DailyAt(2, 0), At(2024, 3, 1, 2, 0));
+    // Stored while the clock was three weeks ahead: counted from now, not from then.
+    scheduler.Set(9, DailyAt(2, 0), At(2024, 3, 25, 2, 0));
     EXPECT_EQ(scheduler.Tick(), std::vector<uint64_t>{7});
     EXPECT_TRUE(scheduler.Tick().empty());
     EXPECT_EQ(scheduler.NextRun(7), At(2024, 3, 5, 2, 0));
+    EXPECT_EQ(scheduler.NextRun(9), At(2024, 3, 5, 2, 0));
 }
 
 TEST_F(SchedulerTest, ClockJumpsAndZoneChangesRecomputeNextRuns) {

@@ -1,10 +1,13 @@
 // The task store opens a database written by the service before the guard options existed: the
 // tasks and history are kept, the new columns take their safe defaults, and what is stored in them
-// afterwards survives a reopen. A database from a newer service is refused, not altered.
+// afterwards survives a reopen. A database from a newer service is refused, not altered. Password
+// files without a task are removed at open, but not when the store holds no task at all.
 #include "service/task_store.h"
 
 #include <gtest/gtest.h>
 #include <sqlite3.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include "support/test_util.h"
 
@@ -48,10 +51,16 @@ TEST(TaskStore, ADatabaseOfTheFirstSchemaIsMigratedAndKeepsItsTasksAndHistory) {
     s2s_test::TempDir dir;
     const std::string db = dir / "s2s.db";
     RunSql(db, kFirstSchema);
+    // The password of task 1, and one left by a task that was never committed.
+    ASSERT_EQ(mkdir((dir / "passwords").c_str(), 0700), 0);
+    s2s_test::WriteFile(dir / "passwords/1", "secret");
+    s2s_test::WriteFile(dir / "passwords/7", "secret");
     std::string error;
     {
         s2sd::TaskStore store;
         ASSERT_EQ(store.Open(db, dir / "passwords", error), 0) << error;
+        EXPECT_EQ(access((dir / "passwords/1").c_str(), F_OK), 0);
+        EXPECT_NE(access((dir / "passwords/7").c_str(), F_OK), 0);
         std::vector<s2sd::StoredTask> tasks;
         ASSERT_EQ(store.Load(tasks, error), 0) << error;
         ASSERT_EQ(tasks.size(), 1u);
@@ -105,6 +114,19 @@ TEST(TaskStore, ADatabaseOfANewerSchemaIsRefusedUntouched) {
     EXPECT_NE(error.find("newer"), std::string::npos) << error;
     // No table of the store was created in it.
     RunSql(db, "CREATE TABLE tasks (x)");
+}
+
+// A zero-length database (lost or truncated) opens as an empty store; the password files of the
+// tasks it had are not deleted as orphans.
+TEST(TaskStore, AnEmptyDatabaseLeavesThePasswordFilesAlone) {
+    s2s_test::TempDir dir;
+    s2s_test::WriteFile(dir / "s2s.db", "");
+    ASSERT_EQ(mkdir((dir / "passwords").c_str(), 0700), 0);
+    s2s_test::WriteFile(dir / "passwords/1", "secret");
+    s2sd::TaskStore store;
+    std::string error;
+    ASSERT_EQ(store.Open(dir / "s2s.db", dir / "passwords", error), 0) << error;
+    EXPECT_EQ(access((dir / "passwords/1").c_str(), F_OK), 0);
 }
 
 }  // namespace

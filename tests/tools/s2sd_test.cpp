@@ -1,5 +1,6 @@
-// s2sd as a program: the control socket under hostile clients, a real-time task on a real
-// inotify watch, and a kill -9 during a run followed by a restart.
+// s2sd as a program: the control socket under hostile clients and a second instance refused, a
+// real-time task on a real inotify watch (kept when the share's folder goes away and comes back),
+// and a kill -9 during a run followed by a restart.
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -47,6 +48,7 @@ class Daemon {
         return status;
     }
     std::string Socket() const { return host_.Root() + Control::kSocketPath; }
+    pid_t Pid() const { return child_ ? child_->Pid() : -1; }
     std::string Log() const { return log_ + (child_ ? child_->Err() : ""); }
 
     PObject Call(const PObject& request) {
@@ -200,6 +202,18 @@ TEST_F(ControlSocket, HostileRequestsGetAClearErrorAndTheDaemonGoesOnServing) {
     ASSERT_EQ(stat(password_file.c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0600u);
     EXPECT_EQ(daemon_.Log().find(kPassword), std::string::npos);
+
+    // A second daemon on the same root, in the foreground or detaching, is refused before it
+    // touches the socket; the first goes on serving.
+    for (const char* mode : {"--verbose", "--daemon"}) {
+        Child second({Tool("s2sd"), mode}, host_.Env(), host_.Root() + "/logs");
+        EXPECT_EQ(second.Wait(), 1) << mode;
+        EXPECT_NE(second.Err().find("s2sd is already running (pid " +
+                                    std::to_string(daemon_.Pid()) + ")"),
+                  std::string::npos)
+            << second.Err();
+    }
+    EXPECT_EQ(StatusOf(daemon_.Call(Command(Control::kList))), Control::kOk);
     EXPECT_EQ(daemon_.Stop(SIGTERM), 0);
 }
 
@@ -267,6 +281,21 @@ TEST_F(DaemonScenario, RealTimeTaskFollowsChangesIncludingNewDirectories) {
     ASSERT_TRUE(WaitFor([&] { return IsPathThere(arrived); }, std::chrono::seconds(60)))
         << daemon_->Log();
     EXPECT_TRUE(WaitFor([&] { return s2s_test::ReadFile(arrived) == "written later"; }));
+
+    // The share's folder goes away and comes back (a volume unmounted and mounted again): it is
+    // watched again and what it holds then is synced.
+    const std::string folder = sender_->SharePath("docs");
+    ASSERT_TRUE(WaitForRuns(id, 1, std::chrono::seconds(60)));
+    const size_t runs = Runs(id).size();
+    s2s_test::RemoveTree(folder);
+    // The removal itself is a change; its run ends before the folder comes back.
+    ASSERT_TRUE(WaitForRuns(id, runs + 1, std::chrono::seconds(60))) << daemon_->Log();
+    MakeDirs(folder);
+    WriteFile(folder + "/back", "after the return");
+    EXPECT_TRUE(WaitFor([&] { return IsPathThere(receiver_->SharePath("docs") + "/back"); },
+                        std::chrono::seconds(60)))
+        << daemon_->Log();
+    EXPECT_NE(daemon_->Log().find("[NOTE] realtime_watch.cpp"), std::string::npos);
 }
 
 TEST_F(DaemonScenario, ATasksGuardOptionsKeepTheReceiversCopyAndTheRefusalIsRecorded) {

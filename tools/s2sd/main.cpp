@@ -1,7 +1,8 @@
 // s2sd: the sync service. Runs in the foreground (logging to standard error, as systemd wants
 // it) or, with --daemon, detached (logging to /var/log/s2s/s2sd.log). SIGTERM and SIGINT cancel
 // the running transfers cleanly and end the service; SIGHUP reopens the log file (after the log
-// was rotated by another program).
+// was rotated by another program). One service runs per root: a lock file beside the control
+// socket is taken before anything else and held for the life of the process.
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -14,12 +15,15 @@
 #include <string>
 
 #include "s2s_control.h"
+#include "s2s_host.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "service/files.h"
 #include "service/service.h"
 
 namespace {
+
+const char kLockPath[] = "/run/s2s/s2sd.lock";
 
 const char kUsage[] =
     "usage: s2sd [--daemon] [--log-file] [--max-runs N] [--delay SECONDS] [--verbose]\n"
@@ -151,6 +155,20 @@ int main(int argc, char** argv) {
     options.password_dir = S2SPath(S2S::Control::kPasswordDir);
     options.socket_path = S2SPath(S2S::Control::kSocketPath);
 
+    // Held open (never closed) until the process ends; a second daemon stops here, before it
+    // touches the socket, the store or the log.
+    long holder = 0;
+    std::string lock_error;
+    const int lock_fd = s2sd::LockInstance(S2SPath(kLockPath), holder, lock_error);
+    if (lock_fd == -2) {
+        std::fprintf(stderr, "%s\n", lock_error.c_str());
+        return 1;
+    }
+    if (lock_fd < 0 || s2sd::WriteLockPid(lock_fd, lock_error) != 0) {
+        std::fprintf(stderr, "s2sd: %s\n", lock_error.c_str());
+        return 1;
+    }
+
     if (daemon || log_file) {
         g_log_path = S2SPath(S2S::Control::kLogPath);
         std::string error;
@@ -172,6 +190,19 @@ int main(int argc, char** argv) {
     if (daemon && Detach() != 0) {
         std::fprintf(stderr, "s2sd: cannot detach: %s\n", std::strerror(errno));
         return 1;
+    }
+    if (daemon && s2sd::WriteLockPid(lock_fd, lock_error) != 0) {
+        S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd(%d): %s\n", __LINE__,
+                            lock_error.c_str());
+        return 1;
+    }
+
+    // The private temporary directory of remote commands is made now, before another user can
+    // make it first; when one stands in its way already, every run would fail, so say it now.
+    std::string temp_error;
+    if (!S2S::PrepareTempDir(temp_error)) {
+        S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd(%d): %s\n", __LINE__,
+                            temp_error.c_str());
     }
 
     s2sd::WallClock clock;
