@@ -4,6 +4,7 @@
 #include <sys/socket.h>
 #include <sys/un.h>
 
+#include <sstream>
 #include <thread>
 
 #include "s2s_control.h"
@@ -245,8 +246,36 @@ class DaemonScenario : public ::testing::Test {
     std::unique_ptr<Daemon> daemon_;
 };
 
-TEST_F(DaemonScenario, RealTimeTaskFollowsChangesIncludingNewDirectories) {
-    GenerateFiles(sender_->SharePath("docs"), 3, 100, 1);
+// The "total size" (of the files in its list) that the sender's rsync logged for the run whose
+// itemised lines name `path`; -1 when no such run is logged.
+long long LoggedTotalSize(const std::string& log, const std::string& path) {
+    std::istringstream in(log);
+    std::string line;
+    std::string pid;
+    long long total = -1;
+    while (std::getline(in, line)) {
+        const size_t open = line.find('[');
+        const size_t close = line.find(']', open);
+        if (open == std::string::npos || close == std::string::npos) {
+            continue;
+        }
+        const std::string id = line.substr(open, close - open);
+        if (line.size() > path.size() &&
+            line.compare(line.size() - path.size(), path.size(), path) == 0) {
+            pid = id;
+        }
+        const size_t size = line.find("total size ");
+        if (id == pid && size != std::string::npos) {
+            total = std::stoll(line.substr(size + 11));
+        }
+    }
+    return total;
+}
+
+TEST_F(DaemonScenario, RealTimeTaskSendsOnlyWhatChangedIncludingNewDirectoriesAndDeletions) {
+    const std::string source = sender_->SharePath("docs");
+    const std::string copy = receiver_->SharePath("docs");
+    GenerateFiles(source, 200, 1000);
     const PObject added = daemon_->Call(TaskRequest(Control::kAdd, {"docs"}, 1));
     ASSERT_EQ(StatusOf(added), Control::kOk) << added.toString();
     const PObject id = added[Control::kKeyTaskId];
@@ -254,16 +283,24 @@ TEST_F(DaemonScenario, RealTimeTaskFollowsChangesIncludingNewDirectories) {
     ASSERT_TRUE(WaitForRuns(id, 1, std::chrono::seconds(60))) << daemon_->Log();
     EXPECT_EQ(Runs(id)[0][Control::kKeyResult].asUInt64(), 0u) << daemon_->Log();
 
-    MakeDirs(sender_->SharePath("docs") + "/new");
-    const std::string arrived = receiver_->SharePath("docs") + "/new/later";
-    ASSERT_TRUE(WaitFor([&] { return IsPathThere(receiver_->SharePath("docs") + "/new"); },
+    MakeDirs(source + "/new");
+    ASSERT_TRUE(WaitFor([&] { return IsPathThere(copy + "/new"); }, std::chrono::seconds(60)))
+        << daemon_->Log();
+    // The directory that appeared is watched too, and the run sends that one file, not the
+    // share's 200 KB.
+    WriteFile(source + "/new/later", "written later");
+    ASSERT_TRUE(WaitFor([&] { return s2s_test::ReadFile(copy + "/new/later") == "written later"; },
                         std::chrono::seconds(60)))
         << daemon_->Log();
-    // The directory that appeared is watched too.
-    WriteFile(sender_->SharePath("docs") + "/new/later", "written later");
-    ASSERT_TRUE(WaitFor([&] { return IsPathThere(arrived); }, std::chrono::seconds(60)))
+    const std::string log = s2s_test::ReadFile(sender_->Root() + "/var/log/s2s_rsync.log");
+    EXPECT_EQ(LoggedTotalSize(log, "new/later"), 13) << log;
+
+    // A file deleted on the sender goes from the receiver; the rest stays.
+    ASSERT_EQ(unlink((source + "/file7").c_str()), 0);
+    ASSERT_TRUE(WaitFor([&] { return !IsPathThere(copy + "/file7"); }, std::chrono::seconds(60)))
         << daemon_->Log();
-    EXPECT_TRUE(WaitFor([&] { return s2s_test::ReadFile(arrived) == "written later"; }));
+    ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(60))) << daemon_->Log();
+    EXPECT_EQ(Manifest(copy), Manifest(source));
 }
 
 TEST_F(DaemonScenario, ATasksGuardOptionsKeepTheReceiversCopyAndTheRefusalIsRecorded) {
@@ -350,7 +387,8 @@ TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNe
     // SIGTERM: the transfer is cancelled, no rsync is left behind, the share is not complete.
     EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
     EXPECT_TRUE(ProcessesMentioning(sender_->SharePath("docs")).empty());
-    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
+    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
+              std::string::npos);
     daemon_->Start();
     ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
     // The copy is under way again (its progress shows in the status).
@@ -382,14 +420,16 @@ TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNe
     EXPECT_NE(runs[0][Control::kKeyEnd].asUInt64(), 0u);
     EXPECT_EQ(runs[1][Control::kKeyResult].asUInt64(),
               static_cast<unsigned long long>(S2S::RunFailure::kCancelled));
-    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
+    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
+              std::string::npos);
 
     ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
     ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(300))) << daemon_->Log();
     runs = Runs(id);
     EXPECT_EQ(runs[0][Control::kKeyResult].asUInt64(), 0u) << runs[0].toString();
     EXPECT_EQ(Manifest(sender_->SharePath("docs")), Manifest(receiver_->SharePath("docs")));
-    EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"), std::string::npos);
+    EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
+              std::string::npos);
 }
 
 }  // namespace
