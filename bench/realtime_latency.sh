@@ -102,7 +102,7 @@ fail() {  # message
 # s2sd syncs the share "live"; lsyncd mirrors the same tree from "mirror" into the receiver's share
 # of that name; "dirs" is the tree of directories.
 for root in "$sender" "$receiver"; do
-  mkdir -p "$root/etc/s2s" "$root/tmp/S2S" "$root/volume1"
+  mkdir -p "$root/etc/s2s" "$root/volume1"  # tmp/S2S is made (private) at first use
   printf '[host]\n\tserial="SN-RTBENCH-%s"\n[volumes]\n\t%s="internal,directory"\n' \
     "$(basename "$root")" "$root/volume1" >"$root/etc/s2s/host.conf"
   for share in live mirror dirs; do

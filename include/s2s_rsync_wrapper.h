@@ -154,6 +154,12 @@ class S2S_EXPORT RsyncWrapper {
     // ".d..t......") and its path as rsync prints it. An empty callback makes it a real run again.
     void setDryRun(
         boost::function<void(const std::string& change, const std::string& path)> callback);
+    // Limits a transfer to the paths listed in `listFile` (relative to the source path, separated
+    // by NUL bytes): a listed folder is sent with everything below it, and a listed path that no
+    // longer exists on this side is deleted on the server (rsync --files-from, --from0,
+    // --delete-missing-args); the deletion limit counts those deletions too. The source path
+    // must then be the folder the paths are relative to. "" (the default) sends the whole source.
+    void setFilesFrom(std::string listFile);
 
     // Runs rsync with these settings; polls `cancel` (when set) at least every 200 ms and stops
     // the run when it returns true. 0, or rsync's / the server's numeric result code.

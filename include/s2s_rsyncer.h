@@ -14,6 +14,7 @@
 #include <map>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "s2s_export.h"
 #include "s2s_host.h"
@@ -92,6 +93,11 @@ class S2S_EXPORT Rsyncer {
     // GetLastError why). Pairing must not go on then: an unknown version would be taken for an
     // old server and skip the multi-source conflict check.
     int Connect(const SyncInfo& info);
+    // Takes the address and protocol version an earlier Connect of the same task settled on
+    // instead of testing the server again (what a task that runs every few seconds does between
+    // runs): `info` with `address` as its server IP. Nothing is sent; a server that stopped
+    // answering shows in the next command's result.
+    void Adopt(const SyncInfo& info, const std::string& address, int version);
     // Keeps everything: the share cache and the server version survive re-initialisation.
     void Clear();
     void SetCancelChecker(bool (*fn)()) { cancelChecker = fn; }
@@ -158,6 +164,13 @@ class S2S_EXPORT Rsyncer {
     // at most at the task's bandwidth limit (SyncInfo::GetMaxBandwidth, KiB per second; 0 none).
     int RunSync(unsigned long long id, const std::string& shareName, const std::string& relPath,
                 const std::list<std::string>& excludes, int& result);
+    // Pushes only `paths` of the share (relative to its folder, no leading "/"): a folder with
+    // everything below it; a path gone from the share is deleted on the server, and the deletion
+    // limit (SetMaxDelete) counts those deletions too. The same options and limits as RunSync
+    // otherwise. 0 (the run's code in `result`), or -1 when the share's facts cannot be read or
+    // the list of paths cannot be written (GetLastError says why).
+    int RunSyncPaths(const std::string& shareName, const std::vector<std::string>& paths,
+                     const std::list<std::string>& excludes, int& result);
 
     // Sends an encrypted share's key file into the server's key directory, always over SSH on the
     // task's SSH port. 0 when there was nothing to send, the transfer's code, or 300 for a local
@@ -171,6 +184,10 @@ class S2S_EXPORT Rsyncer {
                                std::list<std::string>& lines);
     // The lines of GenSinglePairCmd.
     static int SinglePairLines(bool dryRun, std::list<std::string>& lines);
+    // A data run of the share from `src`, limited to the paths listed in `listFile` when it is
+    // not empty.
+    int Transfer(const std::string& shareName, const std::string& src, bool relative,
+                 const std::string& listFile, const std::list<std::string>& excludes, int& result);
     // Runs command lines as one fresh command task of this server; the run's code in `result`.
     void RunCommandLines(const std::list<std::string>& lines, bool isTest, int& result) const;
 

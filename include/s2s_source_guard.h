@@ -16,11 +16,18 @@
 // none was asked for: the deletions that listing found, so a folder emptied between the check and
 // the copy cannot empty the receiver's copy (rsync stops deleting and the run ends with 25).
 // A refused share is not copied and must not be marked complete; the other shares are unaffected.
+//
+// A copy limited to the paths that changed (a real-time run) is checked by CheckChangedPaths:
+// the folder and volume as above, and the emptiness locally (a folder that still holds a file
+// cannot be emptying the receiver's copy); when the folder holds no file, or a percentage limit
+// would need the size of the receiver's whole copy, the caller checks and copies the whole share
+// instead. A deletion limit is judged on a dry run of the limited copy.
 #ifndef S2S_SOURCE_GUARD_H
 #define S2S_SOURCE_GUARD_H
 
 #include <list>
 #include <string>
+#include <vector>
 
 #include "s2s_export.h"
 #include "s2s_host.h"
@@ -110,6 +117,13 @@ S2S_EXPORT int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
                                const std::list<std::string>& excludes, bool (*cancel)(),
                                ReceiverCopy& copy, int& result);
 
+// The same dry run limited to `paths` of the share (Rsyncer::RunSyncPaths); `copy.entries` then
+// counts only what those paths reach.
+S2S_EXPORT int DryRunSharePaths(Rsyncer& rsyncer, const std::string& shareName,
+                                const std::vector<std::string>& paths,
+                                const std::list<std::string>& excludes, bool (*cancel)(),
+                                ReceiverCopy& copy, int& result);
+
 // The whole check before RunSync of a whole share: inspects the source, makes the dry run when it
 // is needed and judges. It also sets the Rsyncer's deletion limit for the data run that follows
 // (Rsyncer::SetMaxDelete): the allowed count when the share is safe, 0 when it is refused, so that
@@ -117,6 +131,18 @@ S2S_EXPORT int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
 S2S_EXPORT SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::string& shareName,
                                               const std::list<std::string>& excludes,
                                               const SourceGuardOptions& options, bool (*cancel)());
+
+// The check before RunSyncPaths of `paths` (see above). Sets `whole` when the share must be
+// checked with CheckShareSource and copied whole instead (the report is then kSafe and says
+// nothing). Otherwise it sets the Rsyncer's deletion limit like CheckShareSource: the task's limit
+// when one is set, else the number of listed paths gone from the folder, so that a folder
+// emptied after the check deletes no more than the changes asked for (rsync then ends with 25
+// and the caller syncs the share whole).
+S2S_EXPORT SourceGuardReport CheckChangedPaths(Rsyncer& rsyncer, const std::string& shareName,
+                                               const std::vector<std::string>& paths,
+                                               const std::list<std::string>& excludes,
+                                               const SourceGuardOptions& options, bool (*cancel)(),
+                                               bool& whole);
 
 }  // namespace S2S
 

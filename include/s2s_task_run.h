@@ -14,6 +14,7 @@
 #include <chrono>
 #include <cstdint>
 #include <list>
+#include <map>
 #include <string>
 #include <vector>
 
@@ -28,14 +29,14 @@ namespace S2S {
 // their own codes (the command line's exit codes, the service's history).
 enum class RunFailure : int {
     kNone = 0,
-    kLocal,        // share facts, client identity, temporary files, a command not sent
-    kUnreachable,  // no address of the server answered
-    kAuth,         // the server refused the user name or password
-    kConflict,     // a share is already paired with another client
-    kRefused,      // the server refused a command (pairing, start, finish, status)
-    kTransfer,     // copying a share failed
-    kKeySync,      // an encrypted share's key could not be sent
-    kCancelled,    // stopped through the observer
+    kLocal,         // share facts, client identity, temporary files, a command not sent
+    kUnreachable,   // no address of the server answered
+    kAuth,          // the server refused the user name or password
+    kConflict,      // a share is already paired with another client
+    kRefused,       // the server refused a command (pairing, start, finish, status)
+    kTransfer,      // copying a share failed
+    kKeySync,       // an encrypted share's key could not be sent
+    kCancelled,     // stopped through the observer
     kUnsafeSource,  // a share's folder was missing, not mounted, or empty over a full copy
     kMaxDelete,     // a share's run would have deleted more than the deletion limit allows
 };
@@ -56,13 +57,22 @@ struct ShareOutcome {
     double copy_seconds = 0.0;
     double key_seconds = 0.0;
     double finish_seconds = 0.0;
+    size_t changed_paths = 0;  // the copy was limited to this many changed paths; 0: whole share
     ShareState state = ShareState::kNotRun;
     int result = 0;       // the remote result code of the failed step
     std::string step;     // the step that failed: pairing, source-check, start, copy, key, finish
     std::string message;  // why, for a person
-    std::string rsync_errors;  // what rsync itself said about a failed copy or key step
-    std::string guard;    // why the source check refused the share (SourceGuardResultName)
+    std::string rsync_errors;     // what rsync itself said about a failed copy or key step
+    std::string guard;            // why the source check refused the share (SourceGuardResultName)
     long long would_delete = -1;  // what a refused run would have deleted on the receiver
+};
+
+// The server a run settled on and the shares it paired, for the next run of the same task a
+// moment later (TaskRun::SetKnownServer). An empty address means none.
+struct KnownServer {
+    std::string address;
+    int version = -1;
+    std::list<std::string> paired;
 };
 
 // The caller's side of a run. Every call comes from the thread that runs the TaskRun.
@@ -107,6 +117,19 @@ class S2S_EXPORT TaskRun {
     // folder never wipes the receiver's copy; the deletion limit). Checked by default.
     void SetGuardOptions(const SourceGuardOptions& options) { guard_ = options; }
 
+    // Limits the copy of the shares named here to the paths of each that changed (relative to
+    // the share's folder): what a real-time run sends. The share is still announced and finished
+    // as always, and synced whole when the changes cannot be checked on their own (see
+    // CheckChangedPaths).
+    void SetChangedPaths(const std::map<std::string, std::vector<std::string>>& paths) {
+        changed_ = paths;
+    }
+    // Skips the server test and version query, and the pairing when `server` paired every share
+    // of the task, taking them from the task's previous run. The server still checks the pairing
+    // when each share starts; a share it refuses then is retried once after a full server test
+    // and pairing.
+    void SetKnownServer(const KnownServer& server) { known_ = server; }
+
     // Runs `task` once. The task must have passed TaskInfo::Validate. The result is Failure().
     RunFailure Run(const SyncTask& task);
 
@@ -123,6 +146,9 @@ class S2S_EXPORT TaskRun {
     int ServerVersion() const { return server_version_; }
     // The server's answer to the task's status report; -1 when none was received.
     int BeaconResult() const { return beacon_result_; }
+    // What the next run of the task may take as known (SetKnownServer): empty unless this run
+    // reached the server, paired, and no share was refused or failed to reach it.
+    KnownServer LearntServer() const;
     double Seconds() const;
     double ConnectSeconds() const { return connect_seconds_; }
     double PairSeconds() const { return pair_seconds_; }
@@ -131,8 +157,12 @@ class S2S_EXPORT TaskRun {
   private:
     bool Connect();
     bool Pair();
+    bool StartShare(ShareOutcome& share, int& result);
+    int Copy(ShareOutcome& share, const std::vector<std::string>* paths, int& result);
     void SyncShare(ShareOutcome& share);
     bool GuardSource(ShareOutcome& share);
+    bool Judge(ShareOutcome& share, const SourceGuardReport& guard);
+    bool PrepareWhole(ShareOutcome& share, const std::string& folder);
     void Fail(RunFailure failure, const std::string& message);
     void Say(const std::string& line);
     bool Cancelled();
@@ -159,6 +189,10 @@ class S2S_EXPORT TaskRun {
     double connect_seconds_ = 0.0;
     double pair_seconds_ = 0.0;
     double beacon_seconds_ = 0.0;
+    std::map<std::string, std::vector<std::string>> changed_;
+    KnownServer known_;
+    bool used_known_ = false;  // this run took the server (and maybe the pairing) as known
+    bool paired_ = false;
     CopyWatch* watch_ = nullptr;  // the copy in progress, while RunSync runs
 };
 

@@ -334,6 +334,14 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
             }
         }
         if (!reaped) {
+            siginfo_t ended = {};
+            if (cancel &&
+                waitid(P_PID, static_cast<id_t>(pid), &ended, WEXITED | WNOHANG | WNOWAIT) == 0 &&
+                ended.si_pid == pid) {
+                // The last look, while the ended child can still be examined (its counters in
+                // /proc); it has ended, so the answer no longer matters.
+                cancel();
+            }
             reaped = TryReap(pid, &status);
             if (reaped && !eof) {
                 // Output the child wrote before it ended is still in the pipe: take it. Whatever

@@ -36,7 +36,9 @@ struct ChildOutcome {
 // Lines (split at '\n' and '\r') of the child's merged output; a final unterminated line too.
 typedef std::function<void(const std::string& line)> LineSink;
 
-// Polls `cancel` (when set) at least every 200 ms while the child runs.
+// Polls `cancel` (when set) at least every 200 ms while the child runs, and once more after the
+// child has ended but before it is reaped, so the predicate can take a last look at it (the
+// bytes it read); that last answer is ignored.
 ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& cancel,
                       const LineSink& sink);
 

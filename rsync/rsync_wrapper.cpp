@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <fstream>
 #include <utility>
 #include <vector>
 
@@ -235,6 +236,18 @@ bool HoldsSparseFile(const std::string& src) {
         }
         closedir(d);
         if (found) {
+            return true;
+        }
+    }
+    return false;
+}
+
+// HoldsSparseFile over the paths a --files-from list (NUL-separated, relative to `src`) names.
+bool ListHoldsSparseFile(const std::string& src, const std::string& listFile) {
+    std::ifstream list(listFile, std::ios::binary);
+    std::string path;
+    while (std::getline(list, path, '\0')) {
+        if (!path.empty() && HoldsSparseFile(src + "/" + path)) {
             return true;
         }
     }
@@ -530,7 +543,8 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     // within the second of the last run, and a folder's time, would be taken as unchanged. A
     // negative window compares the nanoseconds too.
     a = {"--recursive", "--links", "--perms", "--times", "--modify-window=-1", "--hard-links"};
-    if (!listOnly && !dryRunItems && HoldsSparseFile(src)) {
+    if (!listOnly && !dryRunItems &&
+        (filesFrom.empty() ? HoldsSparseFile(src) : ListHoldsSparseFile(src, filesFrom))) {
         a.push_back("--sparse");
     }
     if (pseudoRoot) {
@@ -550,6 +564,9 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
         // Twice: unchanged entries are listed too, so the receiver's side can be counted.
         a.insert(a.end(), {"--dry-run", "--itemize-changes", "--itemize-changes",
                            std::string("--out-format=") + kItemPrefix + "%i %n"});
+    }
+    if (!filesFrom.empty()) {
+        a.insert(a.end(), {"--files-from=" + filesFrom, "--from0", "--delete-missing-args"});
     }
     if (compress) {
         a.push_back("--compress");
@@ -690,6 +707,9 @@ void RsyncWrapper::setMaxDelete(long long count) {
 void RsyncWrapper::setDryRun(
     boost::function<void(const std::string& change, const std::string& path)> callback) {
     impl_->dryRunItems = std::move(callback);
+}
+void RsyncWrapper::setFilesFrom(std::string listFile) {
+    impl_->filesFrom = std::move(listFile);
 }
 
 int RsyncWrapper::execute(boost::function<bool()> cancel) {

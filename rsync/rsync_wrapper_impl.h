@@ -50,6 +50,7 @@ struct RsyncWrapper::Impl {
     boost::function<void(int)> progress;
     long long maxDelete = -1;
     boost::function<void(const std::string&, const std::string&)> dryRunItems;
+    std::string filesFrom;
 
     std::string lastError;
 

@@ -3,6 +3,7 @@
 #include <list>
 #include <string>
 
+#include "rsync/path_list.h"
 #include "s2s_host.h"
 #include "s2s_logger.h"
 #include "s2s_rsyncer.h"
@@ -25,6 +26,13 @@ int Rsyncer::Initialize(const SyncInfo& info) {
     Clear();
     syncInfo = info;
     return TestServer();
+}
+
+void Rsyncer::Adopt(const SyncInfo& info, const std::string& address, int version) {
+    syncInfo = info;
+    syncInfo.SetServerIP(address);
+    serverVersion = version;
+    versionResult = 0;
 }
 
 int Rsyncer::Connect(const SyncInfo& info) {
@@ -138,13 +146,44 @@ int Rsyncer::StartSyncShare(const std::string& shareName, int& result) {
 int Rsyncer::RunSync(unsigned long long /*id*/, const std::string& shareName,
                      const std::string& relPath, const std::list<std::string>& excludes,
                      int& result) {
+    ShareInfo info;
+    if (GetShareInfo(shareName, info) < 0) {
+        maxDelete = -1;
+        Logger::LogMsg(Logger::Error, "[ERROR] s2s_rsyncer.cpp(%d): Fail to get share info\n",
+                       __LINE__);
+        return -1;
+    }
+    if (relPath == "/") {
+        // The trailing slash sends the share's contents rather than the directory itself.
+        return Transfer(shareName, info.GetModulePath() + "/", false, "", excludes, result);
+    }
+    // "/." anchors the relative path: what follows it is recreated under the share on the server.
+    return Transfer(shareName, info.GetModulePath() + "/." + relPath, true, "", excludes, result);
+}
+
+int Rsyncer::RunSyncPaths(const std::string& shareName, const std::vector<std::string>& paths,
+                          const std::list<std::string>& excludes, int& result) {
+    ShareInfo info;
+    PathList list;
+    std::string why;
+    if (GetShareInfo(shareName, info) < 0 || !list.Write(paths, why)) {
+        maxDelete = -1;
+        lastError = why.empty() ? "the facts of share '" + shareName + "' cannot be read" : why;
+        Logger::LogMsg(Logger::Error, "[ERROR] s2s_rsyncer.cpp(%d): %s\n", __LINE__,
+                       lastError.c_str());
+        return -1;
+    }
+    return Transfer(shareName, info.GetModulePath() + "/", false, list.File(), excludes, result);
+}
+
+int Rsyncer::Transfer(const std::string& shareName, const std::string& src, bool relative,
+                      const std::string& listFile, const std::list<std::string>& excludes,
+                      int& result) {
     // The limit belongs to this run alone; the next one starts without it.
     const long long limit = maxDelete;
     maxDelete = -1;
     ShareInfo info;
     if (GetShareInfo(shareName, info) < 0) {
-        Logger::LogMsg(Logger::Error, "[ERROR] s2s_rsyncer.cpp(%d): Fail to get share info\n",
-                       __LINE__);
         return -1;
     }
     RsyncTask task;
@@ -157,17 +196,8 @@ int Rsyncer::RunSync(unsigned long long /*id*/, const std::string& shareName,
         task.setProgressCallback(progressCallback);
     }
     task.SetMaxDelete(limit);
-
-    std::string src;
-    if (relPath == "/") {
-        // The trailing slash sends the share's contents rather than the directory itself.
-        src = info.GetModulePath() + "/";
-    } else {
-        // "/." anchors the relative path: what follows it is recreated under the share on the
-        // server.
-        src = info.GetModulePath() + "/." + relPath;
-        task.SetRelativePath(true);
-    }
+    task.SetRelativePath(relative);
+    task.setFilesFrom(listFile);
     // A path that vanished before it could be sent counts as done.
     if (!IsPathExist(src)) {
         lastError.clear();

@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "rsync/path_list.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 
@@ -246,9 +247,12 @@ SourceGuardReport JudgeShareSource(const std::string& shareName, const SourceSta
     return report;
 }
 
-int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
-                    const std::list<std::string>& excludes, bool (*cancel)(), ReceiverCopy& copy,
-                    int& result) {
+namespace {
+
+// The dry run of a data run of the share, limited to the paths of `listFile` when it is not empty.
+int DryRun(Rsyncer& rsyncer, const std::string& shareName, const std::string& listFile,
+           const std::list<std::string>& excludes, bool (*cancel)(), ReceiverCopy& copy,
+           int& result) {
     copy = ReceiverCopy();
     ShareInfo info;
     if (rsyncer.GetShareInfo(shareName, info) < 0) {
@@ -260,6 +264,7 @@ int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
     Rsyncer::RsyncTask task;
     rsyncer.InitRsyncTask(task, true);
     task.SetSyncACL(true);
+    task.setFilesFrom(listFile);
     unsigned long long entries = 0;
     unsigned long long deletions = 0;
     unsigned long long files = 0;
@@ -287,6 +292,28 @@ int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
     return 0;
 }
 
+}  // namespace
+
+int DryRunShareSync(Rsyncer& rsyncer, const std::string& shareName,
+                    const std::list<std::string>& excludes, bool (*cancel)(), ReceiverCopy& copy,
+                    int& result) {
+    return DryRun(rsyncer, shareName, "", excludes, cancel, copy, result);
+}
+
+int DryRunSharePaths(Rsyncer& rsyncer, const std::string& shareName,
+                     const std::vector<std::string>& paths, const std::list<std::string>& excludes,
+                     bool (*cancel)(), ReceiverCopy& copy, int& result) {
+    PathList list;
+    std::string error;
+    if (!list.Write(paths, error)) {
+        copy = ReceiverCopy();
+        Logger::LogMsg(Logger::Error, "[ERROR] source_guard.cpp(%d): %s\n", __LINE__,
+                       error.c_str());
+        return -1;
+    }
+    return DryRun(rsyncer, shareName, list.File(), excludes, cancel, copy, result);
+}
+
 SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::string& shareName,
                                    const std::list<std::string>& excludes,
                                    const SourceGuardOptions& options, bool (*cancel)()) {
@@ -312,6 +339,66 @@ SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::string& shareNam
             report = JudgeShareSource(shareName, source, options, receiver);
         }
     }
+    rsyncer.SetMaxDelete(report.result == SourceGuardResult::kSafe ? report.allowedDeletions : 0);
+    if (report.result != SourceGuardResult::kSafe) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] source_guard.cpp(%d): %s\n", __LINE__,
+                       report.message.c_str());
+    }
+    return report;
+}
+
+SourceGuardReport CheckChangedPaths(Rsyncer& rsyncer, const std::string& shareName,
+                                    const std::vector<std::string>& paths,
+                                    const std::list<std::string>& excludes,
+                                    const SourceGuardOptions& options, bool (*cancel)(),
+                                    bool& whole) {
+    whole = false;
+    SourceGuardReport report;
+    ShareInfo info;
+    SourceState source;
+    if (rsyncer.GetShareInfo(shareName, info) < 0 ||
+        InspectShareSource(shareName, info, source) < 0) {
+        report = Refuse(SourceGuardResult::kCheckFailed,
+                        "share '" + shareName + "': its folder or volume could not be examined");
+    } else if (!source.folderExists || !source.volumeMounted) {
+        report = JudgeShareSource(shareName, source, options, ReceiverCopy());
+    } else if (source.folderEmpty) {
+        // Whether the receiver's copy is empty too only the whole share's dry run tells.
+        whole = true;
+        return report;
+    } else if (options.maxDelete.set) {
+        ReceiverCopy receiver;
+        int result = 0;
+        if (DryRunSharePaths(rsyncer, shareName, paths, excludes, cancel, receiver, result) < 0 ||
+            !receiver.known) {
+            report = Refuse(
+                SourceGuardResult::kCheckFailed,
+                "share '" + shareName + "': the dry run that counts the receiver's files failed");
+            report.dryRunResult = result;
+        } else if (receiver.deletions > 0 && options.maxDelete.percent) {
+            whole = true;  // a share of the whole copy: only the whole share's dry run counts it
+            return report;
+        } else if (receiver.deletions > options.maxDelete.value) {
+            report = Refuse(SourceGuardResult::kTooManyDeletions,
+                            "share '" + shareName + "': the run would delete " +
+                                Entries(receiver.deletions) + ", more than the limit of " +
+                                options.maxDelete.ToString() + "; nothing was copied or deleted");
+        } else {
+            report.allowedDeletions =
+                static_cast<long long>(options.maxDelete.percent ? 0 : options.maxDelete.value);
+        }
+        report.receiver = receiver;
+    } else {
+        long long gone = 0;
+        for (const std::string& path : paths) {
+            struct stat st;
+            if (lstat((source.folder + "/" + path).c_str(), &st) != 0) {
+                ++gone;
+            }
+        }
+        report.allowedDeletions = gone;
+    }
+    report.source = source;
     rsyncer.SetMaxDelete(report.result == SourceGuardResult::kSafe ? report.allowedDeletions : 0);
     if (report.result != SourceGuardResult::kSafe) {
         Logger::LogMsg(Logger::Warning, "[WARNING] source_guard.cpp(%d): %s\n", __LINE__,

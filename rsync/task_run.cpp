@@ -3,6 +3,9 @@
 // only after its copy (and its key, when it is encrypted) succeeded and no cancel was seen.
 #include "s2s_task_run.h"
 
+#include <sys/stat.h>
+
+#include <algorithm>
 #include <utility>
 
 #include "rsync/transfer_meter.h"
@@ -215,6 +218,19 @@ void TaskRun::PollCopy() {
     observer_->OnCopyProgress(*watch_->share, done);
 }
 
+KnownServer TaskRun::LearntServer() const {
+    KnownServer server;
+    if (!paired_ || settled_address_.empty() || failure_ == RunFailure::kUnreachable ||
+        failure_ == RunFailure::kAuth || failure_ == RunFailure::kConflict ||
+        failure_ == RunFailure::kRefused) {
+        return server;
+    }
+    server.address = settled_address_;
+    server.version = server_version_;
+    server.paired = task_.GetInfo().GetShareList();
+    return server;
+}
+
 bool TaskRun::Connect() {
     const SyncInfo& info = task_.GetInfo().GetSyncInfo();
     const std::string target =
@@ -343,8 +359,11 @@ bool TaskRun::Pair() {
 // Before anything is sent: a share whose folder is missing, not mounted or (against a full copy)
 // empty, or whose run would delete more than allowed, is refused and never marked complete.
 bool TaskRun::GuardSource(ShareOutcome& share) {
-    const SourceGuardReport guard =
-        CheckShareSource(rsyncer_, share.name, excludes_, guard_, &TaskRun::PollCurrent);
+    return Judge(share,
+                 CheckShareSource(rsyncer_, share.name, excludes_, guard_, &TaskRun::PollCurrent));
+}
+
+bool TaskRun::Judge(ShareOutcome& share, const SourceGuardReport& guard) {
     if (guard.result == SourceGuardResult::kSafe) {
         return true;
     }
@@ -382,6 +401,64 @@ bool TaskRun::GuardSource(ShareOutcome& share) {
     return false;
 }
 
+// Measures the whole share and checks its source; false when the share is refused.
+bool TaskRun::PrepareWhole(ShareOutcome& share, const std::string& folder) {
+    const TreeSize size = MeasureTree(folder);
+    share.files = size.files;
+    share.bytes = size.bytes;
+    share.changed_paths = 0;
+    return GuardSource(share);
+}
+
+bool TaskRun::StartShare(ShareOutcome& share, int& result) {
+    int started = rsyncer_.StartSyncShare(share.name, result);
+    if ((started != 0 || result != 0) && used_known_ && !Cancelled()) {
+        // The server or its pairing taken from the previous run no longer holds: test and pair
+        // afresh, then ask once more.
+        used_known_ = false;
+        Say("share " + share.name + ": the server answered " + RsyncResultName(result) +
+            "; testing the server and pairing again");
+        if (!Connect() || !Pair()) {
+            if (share.state == ShareState::kNotRun) {
+                share.state = Cancelled() ? ShareState::kCancelled : ShareState::kFailed;
+                share.step = "start";
+                share.message = message_;
+            }
+            return false;
+        }
+        started = rsyncer_.StartSyncShare(share.name, result);
+    }
+    if (started != 0 || result != 0) {
+        share.step = "start";
+        share.result = result;
+        share.state = Cancelled() ? ShareState::kCancelled : ShareState::kRefused;
+        share.message =
+            "the server refused to start share '" + share.name + "': " + NameAndMeaning(result);
+        if (!Cancelled()) {
+            Fail(result == 0 ? RunFailure::kLocal : ClassifyCommandResult(result), share.message);
+        }
+        return false;
+    }
+    return true;
+}
+
+int TaskRun::Copy(ShareOutcome& share, const std::vector<std::string>* paths, int& result) {
+    CopyWatch watch;
+    watch.share = &share;
+    observer_->OnCopyStart(share);
+    watch_ = &watch;
+    const Clock::time_point step = Clock::now();
+    const int rc = paths != nullptr
+                       ? rsyncer_.RunSyncPaths(share.name, *paths, excludes_, result)
+                       : rsyncer_.RunSync(task_.GetID(), share.name, "/", excludes_, result);
+    share.copy_seconds += SecondsSince(step);
+    watch.meter.Poll();
+    share.read_bytes += watch.meter.Bytes();
+    watch_ = nullptr;
+    observer_->OnCopyEnd(share);
+    return rc;
+}
+
 void TaskRun::SyncShare(ShareOutcome& share) {
     const Clock::time_point start = Clock::now();
     ShareInfo info;
@@ -408,41 +485,61 @@ void TaskRun::SyncShare(ShareOutcome& share) {
         Fail(RunFailure::kLocal, share.message);
         return;
     }
-    const TreeSize size = MeasureTree(info.GetModulePath());
-    share.files = size.files;
-    share.bytes = size.bytes;
-    if (!GuardSource(share)) {
-        share.seconds = SecondsSince(start);
-        return;
+    const auto changed = changed_.find(share.name);
+    const std::vector<std::string>* paths =
+        changed != changed_.end() && !changed->second.empty() ? &changed->second : nullptr;
+    bool whole = paths == nullptr;
+    if (paths != nullptr) {
+        // Only the changed paths are measured, checked and sent.
+        const SourceGuardReport guard = CheckChangedPaths(rsyncer_, share.name, *paths, excludes_,
+                                                          guard_, &TaskRun::PollCurrent, whole);
+        if (!whole && !Judge(share, guard)) {
+            share.seconds = SecondsSince(start);
+            return;
+        }
+        if (!whole) {
+            share.changed_paths = paths->size();
+            Say("share " + share.name + ": sending " + std::to_string(paths->size()) +
+                " changed path" + (paths->size() == 1 ? "" : "s"));
+            for (const std::string& path : *paths) {
+                struct stat st;
+                if (lstat((info.GetModulePath() + "/" + path).c_str(), &st) == 0 &&
+                    S_ISREG(st.st_mode)) {
+                    ++share.files;
+                    share.bytes += static_cast<uint64_t>(st.st_size);
+                }
+            }
+        }
+    }
+    if (whole) {
+        paths = nullptr;
+        if (!PrepareWhole(share, info.GetModulePath())) {
+            share.seconds = SecondsSince(start);
+            return;
+        }
     }
 
     int result = 0;
     Clock::time_point step = Clock::now();
-    const int started = rsyncer_.StartSyncShare(share.name, result);
+    const bool started = StartShare(share, result);
     share.start_seconds = SecondsSince(step);
-    if (started != 0 || result != 0) {
-        share.step = "start";
-        share.result = result;
-        share.state = Cancelled() ? ShareState::kCancelled : ShareState::kRefused;
-        share.message =
-            "the server refused to start share '" + share.name + "': " + NameAndMeaning(result);
-        if (!Cancelled()) {
-            Fail(result == 0 ? RunFailure::kLocal : ClassifyCommandResult(result), share.message);
-        }
+    if (!started) {
         return;
     }
 
-    CopyWatch watch;
-    watch.share = &share;
-    observer_->OnCopyStart(share);
-    watch_ = &watch;
-    step = Clock::now();
-    const int rc = rsyncer_.RunSync(task_.GetID(), share.name, "/", excludes_, result);
-    share.copy_seconds = SecondsSince(step);
-    watch.meter.Poll();
-    share.read_bytes = watch.meter.Bytes();
-    watch_ = nullptr;
-    observer_->OnCopyEnd(share);
+    int rc = Copy(share, paths, result);
+    if (paths != nullptr && rc == 0 && result == kResultMaxDelete && !guard_.maxDelete.set &&
+        !Cancelled()) {
+        // More vanished than the changes named (the folder emptied meanwhile, a volume went):
+        // the whole share's check decides, as for any full run.
+        Say("share " + share.name +
+            ": more is gone than the changes named; checking and syncing the whole share");
+        if (!PrepareWhole(share, info.GetModulePath())) {
+            share.seconds = SecondsSince(start);
+            return;
+        }
+        rc = Copy(share, nullptr, result);
+    }
     share.seconds = SecondsSince(start);
     if (Cancelled()) {
         share.state = ShareState::kCancelled;
@@ -512,6 +609,9 @@ void TaskRun::SyncShare(ShareOutcome& share) {
 RunFailure TaskRun::Run(const SyncTask& task) {
     task_ = task;
     started_ = Clock::now();
+    failure_ = RunFailure::kNone;
+    message_.clear();
+    paired_ = false;
     const SyncInfo& info = task_.GetInfo().GetSyncInfo();
     given_address_ = info.GetServerIP().empty() ? info.GetServerName() : info.GetServerIP();
     shares_.clear();
@@ -534,17 +634,32 @@ RunFailure TaskRun::Run(const SyncTask& task) {
         });
     }
     Clock::time_point step = Clock::now();
-    const bool connected = Connect();
+    used_known_ = !known_.address.empty();
+    bool connected = true;
+    if (used_known_) {
+        rsyncer_.Adopt(info, known_.address, known_.version);
+        server_version_ = known_.version;
+        settled_address_ = known_.address;
+    } else {
+        connected = Connect();
+    }
     connect_seconds_ = SecondsSince(step);
     if (!connected) {
         return failure_;
     }
     step = Clock::now();
-    const bool paired = Pair();
+    bool paired = used_known_;
+    for (const std::string& name : task_.GetInfo().GetShareList()) {
+        if (std::find(known_.paired.begin(), known_.paired.end(), name) == known_.paired.end()) {
+            paired = false;
+        }
+    }
+    paired = paired || Pair();
     pair_seconds_ = SecondsSince(step);
     if (!paired) {
         return failure_;
     }
+    paired_ = true;
     for (ShareOutcome& share : shares_) {
         if (Cancelled()) {
             break;

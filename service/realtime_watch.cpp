@@ -70,6 +70,18 @@ void RealtimeWatch::LoseRoot(size_t i) {
                    shares_[i].share.c_str(), shares_[i].root.c_str());
 }
 
+long RealtimeWatch::NextRewatchMs(long now_ms) const {
+    if (fd_ < 0) {
+        return -1;
+    }
+    for (int wd : root_wd_) {
+        if (wd < 0) {
+            return std::max(0L, last_rewatch_ms_ + kRewatchMs - now_ms);
+        }
+    }
+    return -1;
+}
+
 std::vector<ShareChange> RealtimeWatch::Rewatch(long now_ms) {
     std::vector<ShareChange> changes;
     if (fd_ < 0 || now_ms - last_rewatch_ms_ < kRewatchMs) {
@@ -94,7 +106,9 @@ std::vector<ShareChange> RealtimeWatch::Rewatch(long now_ms) {
                        "watched again\n",
                        __LINE__, static_cast<unsigned long long>(shares_[i].task),
                        shares_[i].share.c_str(), shares_[i].root.c_str());
-        changes.push_back({shares_[i].task, shares_[i].share, !ok, reason});
+        // Whatever the folder holds now is synced whole.
+        changes.push_back(
+            {shares_[i].task, shares_[i].share, true, ok ? std::string() : reason, {}});
     }
     return changes;
 }
@@ -151,7 +165,7 @@ std::vector<ShareChange> RealtimeWatch::Watch(const std::vector<WatchedShare>& s
     std::vector<ShareChange> full;
     if (fd_ < 0) {
         for (const WatchedShare& share : shares) {
-            full.push_back({share.task, share.share, true, "inotify is not available"});
+            full.push_back({share.task, share.share, true, "inotify is not available", {}});
         }
         return full;
     }
@@ -161,7 +175,7 @@ std::vector<ShareChange> RealtimeWatch::Watch(const std::vector<WatchedShare>& s
     for (size_t i = 0; i < shares_.size(); ++i) {
         std::string reason;
         if (!AddRoot(i, reason)) {
-            full.push_back({shares_[i].task, shares_[i].share, true, reason});
+            full.push_back({shares_[i].task, shares_[i].share, true, reason, {}});
         }
     }
     return full;
@@ -172,9 +186,31 @@ std::vector<ShareChange> RealtimeWatch::Read() {
     if (fd_ < 0) {
         return changes;
     }
-    std::set<size_t> touched;
+    std::map<size_t, std::set<std::string>> touched;
+    std::set<size_t> whole;
     std::set<size_t> lost;
     std::string lost_reason;
+    // Records `dir` (absolute) and, when not empty, the entry `name` in it as changed in `share`.
+    const auto note = [&](size_t share, const std::string& dir, const std::string& name) {
+        std::set<std::string>& paths = touched[share];
+        const std::string& root = shares_[share].root;
+        std::string rel;
+        if (dir.size() > root.size() && dir.compare(0, root.size(), root) == 0 &&
+            dir[root.size()] == '/') {
+            rel = dir.substr(root.size() + 1);
+        } else if (dir != root) {
+            whole.insert(share);  // not below the share's folder as it was named: be safe
+            return;
+        }
+        if (!name.empty()) {
+            rel = rel.empty() ? name : rel + "/" + name;
+        }
+        if (rel.empty() || paths.size() >= kMaxPaths) {
+            whole.insert(share);  // the share's own folder, or too many to list
+            return;
+        }
+        paths.insert(rel);
+    };
     alignas(struct inotify_event) char buffer[64 * 1024];
     for (;;) {
         const ssize_t n = read(fd_, buffer, sizeof(buffer));
@@ -196,6 +232,9 @@ std::vector<ShareChange> RealtimeWatch::Read() {
             if (dir == dirs_.end()) {
                 continue;
             }
+            const std::vector<size_t> owners = dir->second.shares;
+            const std::string path = dir->second.path;
+            const std::string name = event->len > 0 ? std::string(event->name) : std::string();
             const bool gone = (event->mask & (IN_IGNORED | IN_DELETE_SELF | IN_MOVE_SELF)) != 0;
             for (size_t i = 0; gone && i < root_wd_.size(); ++i) {
                 if (root_wd_[i] == event->wd) {
@@ -203,18 +242,22 @@ std::vector<ShareChange> RealtimeWatch::Read() {
                 }
             }
             if ((event->mask & IN_IGNORED) != 0) {
-                touched.insert(dir->second.shares.begin(), dir->second.shares.end());
+                for (size_t share : owners) {
+                    note(share, path, "");
+                }
                 dirs_.erase(dir);
                 continue;
             }
-            const std::vector<size_t> owners = dir->second.shares;
-            touched.insert(owners.begin(), owners.end());
+            for (size_t share : owners) {
+                note(share, path, name);
+            }
+            // A directory that appears, or moves in, is watched with all it holds (a watched
+            // directory moved within the share keeps its watches, renamed here).
             if ((event->mask & IN_ISDIR) != 0 && (event->mask & (IN_CREATE | IN_MOVED_TO)) != 0 &&
-                event->len > 0) {
-                const std::string path = dir->second.path + "/" + event->name;
+                !name.empty()) {
                 for (size_t share : owners) {
                     std::string reason;
-                    if (!AddTree(path, share, reason)) {
+                    if (!AddTree(path + "/" + name, share, reason)) {
                         lost.insert(share);
                         lost_reason = reason;
                     }
@@ -222,13 +265,21 @@ std::vector<ShareChange> RealtimeWatch::Read() {
             }
         }
     }
-    for (size_t i : touched) {
-        if (lost.count(i) == 0) {
-            changes.push_back({shares_[i].task, shares_[i].share, false, ""});
+    for (auto& item : touched) {
+        if (lost.count(item.first) == 0) {
+            ShareChange change{shares_[item.first].task,
+                               shares_[item.first].share,
+                               whole.count(item.first) != 0,
+                               "",
+                               {}};
+            if (!change.full) {
+                change.paths = std::move(item.second);
+            }
+            changes.push_back(std::move(change));
         }
     }
     for (size_t i : lost) {
-        changes.push_back({shares_[i].task, shares_[i].share, true, lost_reason});
+        changes.push_back({shares_[i].task, shares_[i].share, true, lost_reason, {}});
     }
     return changes;
 }

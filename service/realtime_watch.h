@@ -1,5 +1,8 @@
 // RealtimeWatch: a recursive inotify watch over the folders of real-time tasks' shares. It tells
-// which share of which task changed; directories created later are watched as they appear. When
+// which share of which task changed and which paths in it (relative to the share's folder: the
+// entry an event names, or the folder whose own attributes changed); directories created later
+// are watched as they appear, and a directory moved within the share is found under its new name.
+// A path may be named that no longer exists: syncing it deletes it on the receiver. When
 // the kernel's queue overflows, or a watch cannot be added (the max_user_watches limit), changes
 // may go unseen: the affected shares are reported with `full` set, so the caller syncs them whole
 // and logs why. A share whose folder is missing (at start, or removed or moved away later, as
@@ -9,6 +12,7 @@
 
 #include <cstdint>
 #include <map>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -23,12 +27,16 @@ struct WatchedShare {
 struct ShareChange {
     uint64_t task = 0;
     std::string share;
-    bool full = false;   // events may have been lost: sync the whole share
-    std::string reason;  // why, for the log, when `full`
+    bool full = false;   // sync the whole share (events may have been lost, or too many paths)
+    std::string reason;  // why, for the log, when events may have been lost
+    std::set<std::string> paths;  // what changed, when not `full`
 };
 
 class RealtimeWatch {
   public:
+    // More changed paths than this in one read make a share's change a whole-share one.
+    static constexpr size_t kMaxPaths = 10000;
+
     RealtimeWatch();
     ~RealtimeWatch();
     RealtimeWatch(const RealtimeWatch&) = delete;
@@ -48,6 +56,9 @@ class RealtimeWatch {
     // changed (their content is new to the watch). Logs a NOTE for each.
     static constexpr long kRewatchMs = 10000;
     std::vector<ShareChange> Rewatch(long now_ms);
+    // How long until Rewatch() should look again (0 when it is due), or -1 while every share's
+    // folder is watched: the caller's wait is bounded by it, so no tick is needed otherwise.
+    long NextRewatchMs(long now_ms) const;
 
   private:
     // Watches `dir` and every directory below it for `share`; false when a watch failed.

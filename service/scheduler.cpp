@@ -54,6 +54,16 @@ long Scheduler::NextRun(uint64_t id) const {
     return it == entries_.end() ? 0 : it->second.next;
 }
 
+long Scheduler::Earliest() const {
+    long earliest = 0;
+    for (const auto& item : entries_) {
+        if (item.second.next > 0 && (earliest == 0 || item.second.next < earliest)) {
+            earliest = item.second.next;
+        }
+    }
+    return earliest;
+}
+
 bool Scheduler::ClockChanged() {
     const long wall = clock_.Now();
     const long mono = clock_.Monotonic();

@@ -55,6 +55,8 @@ class Scheduler {
     std::vector<uint64_t> Tick(std::map<uint64_t, long>* due_at = nullptr);
     // 0 when the task has no next run.
     long NextRun(uint64_t id) const;
+    // The earliest next run of all tasks; 0 when none has one.
+    long Earliest() const;
     // True when the last Tick recomputed every next run.
     bool Recomputed() const { return recomputed_; }
 

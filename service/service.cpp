@@ -3,6 +3,7 @@
 
 #include <fcntl.h>
 #include <poll.h>
+#include <sys/timerfd.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -157,26 +158,66 @@ bool RequiredInteger(const PObject& request, const char* key, unsigned long long
     return present;
 }
 
-std::string Shares(const std::set<std::string>& shares) {
-    std::string text;
-    for (const std::string& share : shares) {
-        text += (text.empty() ? "" : ", ") + share;
-    }
-    return text.empty() ? "all shares" : text;
-}
+// How long a task's next run may take the server and pairing of its last run as known: a
+// real-time task that runs every few seconds is spared the server test and the pairing, a task
+// that runs now and then is not.
+constexpr long kKnownServerMs = 60 * 1000;
+// The loop sleeps until something happens, at most this long.
+constexpr long kZoneCheckMs = 60 * 1000;
 
 }  // namespace
 
-// A run's wish: the shares to sync (empty: all of the task's).
+// A run's wish: every share of the task whole, or some of its shares, each whole or limited to
+// the paths that changed in it.
 struct Service::Job {
     bool all = false;
-    std::set<std::string> shares;
-    void Merge(bool all_shares, const std::set<std::string>& more) {
-        all = all || all_shares || more.empty();
-        shares.insert(more.begin(), more.end());
+    std::map<std::string, std::set<std::string>> shares;  // an empty set: the whole share
+
+    static Job All() {
+        Job job;
+        job.all = true;
+        return job;
+    }
+    // `paths` empty: the whole share.
+    void Add(const std::string& share, const std::set<std::string>& paths) {
         if (all) {
+            return;
+        }
+        const auto it = shares.find(share);
+        if (it == shares.end()) {
+            shares[share] = paths;
+        } else if (it->second.empty() || paths.empty()) {
+            it->second.clear();
+        } else {
+            it->second.insert(paths.begin(), paths.end());
+            if (it->second.size() > RealtimeWatch::kMaxPaths) {
+                it->second.clear();
+            }
+        }
+    }
+    void Merge(const Job& more) {
+        if (more.all) {
+            all = true;
             shares.clear();
         }
+        for (const auto& item : more.shares) {
+            Add(item.first, item.second);
+        }
+    }
+    // For the log: "all shares", or "docs (3 changed paths), photos".
+    std::string Describe() const {
+        if (all) {
+            return "all shares";
+        }
+        std::string text;
+        for (const auto& item : shares) {
+            text += (text.empty() ? "" : ", ") + item.first;
+            if (!item.second.empty()) {
+                text += " (" + std::to_string(item.second.size()) + " changed path" +
+                        (item.second.size() == 1 ? ")" : "s)");
+            }
+        }
+        return text;
     }
 };
 
@@ -197,6 +238,9 @@ struct Service::TaskState {
     // Real-time changes gathered until `pending_ms`.
     Job pending;
     long pending_ms = 0;
+    // The server and pairing of the last run, when it vouched for them, and when it ended.
+    S2S::KnownServer known;
+    long known_ms = 0;
 };
 
 // Reports a run's progress into its task's state and the log; stops it when asked.
@@ -262,11 +306,19 @@ Service::~Service() {
             close(fd);
         }
     }
+    if (timer_ >= 0) {
+        close(timer_);
+    }
 }
 
 int Service::Start(std::string& error) {
     if (pipe2(wake_, O_NONBLOCK | O_CLOEXEC) != 0) {
         error = std::string("pipe: ") + std::strerror(errno);
+        return -1;
+    }
+    timer_ = timerfd_create(CLOCK_REALTIME, TFD_NONBLOCK | TFD_CLOEXEC);
+    if (timer_ < 0) {
+        error = std::string("timerfd: ") + std::strerror(errno);
         return -1;
     }
     if (store_.Open(options_.db_path, options_.password_dir, error) != 0) {
@@ -299,7 +351,7 @@ int Service::Start(std::string& error) {
         tasks_[stored.task.GetID()] = std::move(state);
         // Changes made while the service was down were not seen: one full run.
         if (schedule.GetMode() == kRealtime && !stored.paused) {
-            Queue(stored.task.GetID(), {}, "real-time task at start");
+            Queue(stored.task.GetID(), Job::All(), "real-time task at start");
         }
     }
     RefreshWatch();
@@ -371,21 +423,21 @@ void Service::OnChanges(const std::vector<ShareChange>& changes, long now_ms) {
             continue;
         }
         TaskState& state = *it->second;
-        if (change.full) {
+        if (change.full && !change.reason.empty()) {
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] service.cpp(%d): task %llu: share '%s': %s; syncing the "
                            "whole share\n",
                            __LINE__, static_cast<unsigned long long>(change.task),
                            change.share.c_str(), change.reason.c_str());
         }
-        state.pending.Merge(false, {change.share});
+        state.pending.Add(change.share, change.full ? std::set<std::string>() : change.paths);
         if (state.pending_ms == 0) {
             state.pending_ms = now_ms + options_.realtime_delay_ms;
         }
     }
 }
 
-void Service::Queue(uint64_t id, const std::set<std::string>& shares, const std::string& why) {
+void Service::Queue(uint64_t id, const Job& job, const std::string& why) {
     // Callers hold mutex_ or run before any run thread exists.
     const auto it = tasks_.find(id);
     if (it == tasks_.end()) {
@@ -394,16 +446,16 @@ void Service::Queue(uint64_t id, const std::set<std::string>& shares, const std:
     TaskState& state = *it->second;
     if (state.running) {
         state.again = true;
-        state.again_job.Merge(false, shares);
+        state.again_job.Merge(job);
         return;
     }
-    state.queued_job.Merge(false, shares);
+    state.queued_job.Merge(job);
     if (!state.queued) {
         state.queued = true;
         queue_.push_back(id);
         Logger::LogMsg(Logger::Info, "[INFO] service.cpp(%d): task %llu queued (%s): %s\n",
                        __LINE__, static_cast<unsigned long long>(id), why.c_str(),
-                       Shares(state.queued_job.shares).c_str());
+                       state.queued_job.Describe().c_str());
     }
 }
 
@@ -423,15 +475,17 @@ void Service::StartRuns() {
         state.bytes_done = 0;
         state.bytes_total = 0;
         state.cancel = std::make_shared<std::atomic<bool>>(false);
-        const std::set<std::string> shares = state.queued_job.shares;
+        const Job job = state.queued_job;
         state.queued_job = Job();
+        const S2S::KnownServer known =
+            NowMs() - state.known_ms <= kKnownServerMs ? state.known : S2S::KnownServer();
         Active run;
         run.id = id;
         run.done = std::make_shared<std::atomic<bool>>(false);
         std::shared_ptr<std::atomic<bool>> done = run.done;
         run.thread = std::thread([this, id, task = state.stored.task, guard = state.stored.guard,
-                                  shares, cancel = state.cancel, done]() {
-            RunThread(id, task, guard, shares, cancel);
+                                  job, known, cancel = state.cancel, done]() {
+            RunThread(id, task, guard, job, known, cancel);
             done->store(true);
             Wake();
         });
@@ -440,7 +494,8 @@ void Service::StartRuns() {
 }
 
 void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions guard,
-                        std::set<std::string> shares, std::shared_ptr<std::atomic<bool>> cancel) {
+                        const Job& job, const S2S::KnownServer& known,
+                        std::shared_ptr<std::atomic<bool>> cancel) {
     std::string error;
     RunRecord record;
     record.task_id = id;
@@ -453,11 +508,16 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
                        static_cast<unsigned long long>(id), error.c_str());
     }
     S2S::TaskInfo info = task.GetInfo();
-    if (!shares.empty()) {
+    std::map<std::string, std::vector<std::string>> changed;
+    if (!job.all) {
         std::list<std::string> chosen;
         for (const std::string& name : info.GetShareList()) {
-            if (shares.count(name) != 0) {
+            const auto wish = job.shares.find(name);
+            if (wish != job.shares.end()) {
                 chosen.push_back(name);
+                if (!wish->second.empty()) {
+                    changed[name].assign(wish->second.begin(), wish->second.end());
+                }
             }
         }
         info.SetShareList(chosen);
@@ -469,6 +529,9 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
     // Every run checks each share's source, so a scheduled, a real-time and the first run after
     // start alike never mirror an empty or unmounted folder over the receiver's copy.
     run.SetGuardOptions(guard);
+    // A real-time run sends only what changed, to the server its task's last run settled on.
+    run.SetChangedPaths(changed);
+    run.SetKnownServer(known);
     if (store_.Password(id, password, error) != 0) {
         record.message = error;
     } else {
@@ -509,6 +572,8 @@ void Service::RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions
     std::lock_guard<std::mutex> lock(mutex_);
     const auto it = tasks_.find(id);
     if (it != tasks_.end()) {
+        it->second->known = run.LearntServer();
+        it->second->known_ms = NowMs();
         it->second->has_result = true;
         it->second->last_result = record.result;
         it->second->last_message =
@@ -537,7 +602,7 @@ void Service::Reap() {
             state.again = false;
             const Job job = state.again_job;
             state.again_job = Job();
-            Queue(id, job.shares, "changes during the last run");
+            Queue(id, job, "changes during the last run");
         }
     }
 }
@@ -591,7 +656,7 @@ void Service::Tick(long now_ms) {
             continue;
         }
         it->second->stored.last_scheduled = due_at[id];
-        Queue(id, {}, "scheduled");
+        Queue(id, Job::All(), "scheduled");
     }
     for (auto& item : tasks_) {
         TaskState& state = *item.second;
@@ -599,9 +664,26 @@ void Service::Tick(long now_ms) {
             const Job job = state.pending;
             state.pending = Job();
             state.pending_ms = 0;
-            Queue(item.first, job.shares, "changes");
+            Queue(item.first, job, "changes");
         }
     }
+}
+
+void Service::ArmTimer() {
+    const long at = scheduler_.Earliest();
+    if (at == timer_at_) {
+        return;
+    }
+    struct itimerspec spec = {};
+    spec.it_value.tv_sec = at;  // 0 disarms; a time already past fires at once
+    // Setting the clock also ends the wait, so a jump is noticed without polling for it.
+    if (timerfd_settime(timer_, TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET, &spec, nullptr) != 0) {
+        Logger::LogMsg(Logger::Error, "[ERROR] service.cpp(%d): timerfd_settime: %s\n", __LINE__,
+                       std::strerror(errno));
+        timer_at_ = -1;
+        return;
+    }
+    timer_at_ = at;
 }
 
 void Service::Serve() {
@@ -631,21 +713,11 @@ void Service::Serve() {
             }
         }
         const long now_ms = NowMs();
-        if (!stopping_ && now_ms - last_tick_ms_ >= 1000) {
+        if (!stopping_) {
+            // Cheap: due runs, a jump of the clock, a new time zone, real-time deadlines.
             last_tick_ms_ = now_ms;
             Tick(now_ms);
-        } else if (!stopping_) {
-            // Real-time deadlines fall between the once-a-second ticks.
-            std::lock_guard<std::mutex> lock(mutex_);
-            for (auto& item : tasks_) {
-                TaskState& state = *item.second;
-                if (state.pending_ms != 0 && state.pending_ms <= now_ms) {
-                    const Job job = state.pending;
-                    state.pending = Job();
-                    state.pending_ms = 0;
-                    Queue(item.first, job.shares, "changes");
-                }
-            }
+            ArmTimer();
         }
         StartRuns();
 
@@ -655,10 +727,16 @@ void Service::Serve() {
             fds.push_back({watch_.Fd(), POLLIN, 0});
         }
         control_.AddPollFds(fds);
-        long wait = 1000 - (NowMs() - last_tick_ms_);
+        fds.push_back({timer_, POLLIN, 0});
+        // Nothing else wakes the loop when the time zone changes: a look once a minute.
+        long wait = kZoneCheckMs - (NowMs() - last_tick_ms_);
         const long client_wait = control_.NextDeadline(now_ms);
         if (client_wait >= 0) {
             wait = std::min(wait, client_wait);
+        }
+        const long rewatch_wait = watch_.NextRewatchMs(now_ms);
+        if (rewatch_wait >= 0) {
+            wait = std::min(wait, rewatch_wait);
         }
         {
             std::lock_guard<std::mutex> lock(mutex_);
@@ -674,6 +752,11 @@ void Service::Serve() {
                            std::strerror(errno));
         }
         DrainWake();
+        uint64_t expirations = 0;
+        // Fired, or cancelled by a setting of the clock (ECANCELED): either way it is re-armed.
+        if (read(timer_, &expirations, sizeof(expirations)) < 0 && errno == ECANCELED) {
+            timer_at_ = -1;
+        }
         if (watch_.Fd() >= 0) {
             OnChanges(watch_.Read(), NowMs());
         }
@@ -822,7 +905,7 @@ void Service::CmdAdd(const PObject& request, PObject& reply) {
         tasks_[id] = std::move(state);
         scheduler_.Set(id, task.GetInfo().GetSchedule(), now);
         if (realtime) {
-            Queue(id, {}, "new real-time task");
+            Queue(id, Job::All(), "new real-time task");
         }
     }
     if (realtime) {
@@ -890,6 +973,7 @@ void Service::CmdUpdate(const PObject& request, PObject& reply) {
         state.stored.task = task;
         state.stored.guard = guard;
         state.stored.last_scheduled = now;
+        state.known = S2S::KnownServer();  // the server or the password may have changed
         scheduler_.Set(id, task.GetInfo().GetSchedule(), now);
     }
     if (realtime_change) {
@@ -985,7 +1069,7 @@ void Service::CmdRun(const PObject& request, PObject& reply) {
         SetStatus(reply, Control::kBusy, "task " + std::to_string(id) + " is running already");
         return;
     }
-    Queue(id, {}, "asked to run now");
+    Queue(id, Job::All(), "asked to run now");
 }
 
 void Service::CmdCancel(const PObject& request, PObject& reply) {

@@ -23,6 +23,7 @@
 #include <vector>
 
 #include "s2s_pobject.h"
+#include "s2s_task_run.h"
 #include "service/control_server.h"
 #include "service/realtime_watch.h"
 #include "service/scheduler.h"
@@ -70,12 +71,13 @@ class Service {
     void Tick(long now_ms);
     // Brings a stored last_scheduled later than `now` back to `now`, in memory and in the store.
     void CapLastScheduled(TaskState& state, long now);
+    void ArmTimer();
     void RefreshWatch();
     void OnChanges(const std::vector<ShareChange>& changes, long now_ms);
-    void Queue(uint64_t id, const std::set<std::string>& shares, const std::string& why);
+    void Queue(uint64_t id, const Job& job, const std::string& why);
     void StartRuns();
-    void RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions guard,
-                   std::set<std::string> shares, std::shared_ptr<std::atomic<bool>> cancel);
+    void RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions guard, const Job& job,
+                   const S2S::KnownServer& known, std::shared_ptr<std::atomic<bool>> cancel);
     void Reap();
     S2S::PObject TaskMap(const TaskState& state) const;
     S2S::PObject StatusMap(const TaskState& state) const;
@@ -99,6 +101,9 @@ class Service {
     ControlServer control_;
     std::function<void()> on_hangup_;
     int wake_[2] = {-1, -1};
+    // Fires at the earliest scheduled run by the wall clock, and when the wall clock is set.
+    int timer_ = -1;
+    long timer_at_ = -1;  // what it is armed for (epoch seconds, 0 disarmed)
     std::atomic<bool> stopping_{false};
     std::atomic<bool> hangup_{false};
     bool paused_ = false;  // the whole service

@@ -5,6 +5,7 @@
 #include <sys/socket.h>
 #include <sys/un.h>
 
+#include <sstream>
 #include <thread>
 
 #include "s2s_control.h"
@@ -262,8 +263,36 @@ class DaemonScenario : public ::testing::Test {
     std::unique_ptr<Daemon> daemon_;
 };
 
-TEST_F(DaemonScenario, RealTimeTaskFollowsChangesIncludingNewDirectories) {
-    GenerateFiles(sender_->SharePath("docs"), 3, 100, 1);
+// The "total size" (of the files in its list) that the sender's rsync logged for the run whose
+// itemised lines name `path`; -1 when no such run is logged.
+long long LoggedTotalSize(const std::string& log, const std::string& path) {
+    std::istringstream in(log);
+    std::string line;
+    std::string pid;
+    long long total = -1;
+    while (std::getline(in, line)) {
+        const size_t open = line.find('[');
+        const size_t close = line.find(']', open);
+        if (open == std::string::npos || close == std::string::npos) {
+            continue;
+        }
+        const std::string id = line.substr(open, close - open);
+        if (line.size() > path.size() &&
+            line.compare(line.size() - path.size(), path.size(), path) == 0) {
+            pid = id;
+        }
+        const size_t size = line.find("total size ");
+        if (id == pid && size != std::string::npos) {
+            total = std::stoll(line.substr(size + 11));
+        }
+    }
+    return total;
+}
+
+TEST_F(DaemonScenario, RealTimeTaskSendsOnlyWhatChangedIncludingNewDirectoriesAndDeletions) {
+    const std::string source = sender_->SharePath("docs");
+    const std::string copy = receiver_->SharePath("docs");
+    GenerateFiles(source, 200, 1000);
     const PObject added = daemon_->Call(TaskRequest(Control::kAdd, {"docs"}, 1));
     ASSERT_EQ(StatusOf(added), Control::kOk) << added.toString();
     const PObject id = added[Control::kKeyTaskId];
@@ -271,21 +300,32 @@ TEST_F(DaemonScenario, RealTimeTaskFollowsChangesIncludingNewDirectories) {
     ASSERT_TRUE(WaitForRuns(id, 1, std::chrono::seconds(60))) << daemon_->Log();
     EXPECT_EQ(Runs(id)[0][Control::kKeyResult].asUInt64(), 0u) << daemon_->Log();
 
-    MakeDirs(sender_->SharePath("docs") + "/new");
-    const std::string arrived = receiver_->SharePath("docs") + "/new/later";
-    ASSERT_TRUE(WaitFor([&] { return IsPathThere(receiver_->SharePath("docs") + "/new"); },
+    MakeDirs(source + "/new");
+    ASSERT_TRUE(WaitFor([&] { return IsPathThere(copy + "/new"); }, std::chrono::seconds(60)))
+        << daemon_->Log();
+    // The directory that appeared is watched too, and the run sends that one file, not the
+    // share's 200 KB.
+    WriteFile(source + "/new/later", "written later");
+    ASSERT_TRUE(WaitFor([&] { return s2s_test::ReadFile(copy + "/new/later") == "written later"; },
                         std::chrono::seconds(60)))
         << daemon_->Log();
-    // The directory that appeared is watched too.
-    WriteFile(sender_->SharePath("docs") + "/new/later", "written later");
-    ASSERT_TRUE(WaitFor([&] { return IsPathThere(arrived); }, std::chrono::seconds(60)))
+    const std::string log = s2s_test::ReadFile(sender_->Root() + "/var/log/s2s_rsync.log");
+    EXPECT_EQ(LoggedTotalSize(log, "new/later"), 13) << log;
+    // What rsync read for so short a run is counted once it has ended.
+    ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(60))) << daemon_->Log();
+    EXPECT_GE(Runs(id)[0][Control::kKeyShares].asArray()[0][Control::kKeyReadBytes].asUInt64(), 13u)
+        << Runs(id)[0].toString();
+
+    // A file deleted on the sender goes from the receiver; the rest stays.
+    ASSERT_EQ(unlink((source + "/file7").c_str()), 0);
+    ASSERT_TRUE(WaitFor([&] { return !IsPathThere(copy + "/file7"); }, std::chrono::seconds(60)))
         << daemon_->Log();
-    EXPECT_TRUE(WaitFor([&] { return s2s_test::ReadFile(arrived) == "written later"; }));
+    ASSERT_TRUE(WaitForRuns(id, 4, std::chrono::seconds(60))) << daemon_->Log();
+    EXPECT_EQ(Manifest(copy), Manifest(source));
 
     // The share's folder goes away and comes back (a volume unmounted and mounted again): it is
     // watched again and what it holds then is synced.
-    const std::string folder = sender_->SharePath("docs");
-    ASSERT_TRUE(WaitForRuns(id, 1, std::chrono::seconds(60)));
+    const std::string folder = source;
     const size_t runs = Runs(id).size();
     s2s_test::RemoveTree(folder);
     // The removal itself is a change; its run ends before the folder comes back.
