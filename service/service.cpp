@@ -674,10 +674,10 @@ void Service::ArmTimer() {
     if (at == timer_at_) {
         return;
     }
-    struct itimerspec spec = {};
-    spec.it_value.tv_sec = at;  // 0 disarms; a time already past fires at once
+    struct itimerspec when = {};
+    when.it_value.tv_sec = at;  // 0 disarms; a time already past fires at once
     // Setting the clock also ends the wait, so a jump is noticed without polling for it.
-    if (timerfd_settime(timer_, TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET, &spec, nullptr) != 0) {
+    if (timerfd_settime(timer_, TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET, &when, nullptr) != 0) {
         Logger::LogMsg(Logger::Error, "[ERROR] service.cpp(%d): timerfd_settime: %s\n", __LINE__,
                        std::strerror(errno));
         timer_at_ = -1;
