@@ -940,18 +940,17 @@ void Service::CmdUpdate(const PObject& request, PObject& reply) {
     bool realtime_change = false;
     {
         std::lock_guard<std::mutex> lock(mutex_);
-        const auto it = tasks_.find(id);
-        if (it == tasks_.end()) {
-            SetStatus(reply, Control::kNoSuchTask, "no task " + std::to_string(id));
+        TaskState* found = FindTask(id, reply);
+        if (found == nullptr) {
             return;
         }
-        if (it->second->running) {
+        if (found->running) {
             SetStatus(reply, Control::kBusy,
                       "task " + std::to_string(id) + " is running; cancel it first");
             return;
         }
         // Guard options the map leaves out stay as they are.
-        S2S::SourceGuardOptions guard = it->second->stored.guard;
+        S2S::SourceGuardOptions guard = found->stored.guard;
         if (!ReadGuardOptions(request[Control::kKeyTask], guard, reply)) {
             return;
         }
@@ -967,7 +966,7 @@ void Service::CmdUpdate(const PObject& request, PObject& reply) {
                       rc == 1 ? "no task " + std::to_string(id) : error);
             return;
         }
-        TaskState& state = *it->second;
+        TaskState& state = *found;
         realtime_change = state.stored.task.GetInfo().GetSchedule().GetMode() == kRealtime ||
                           task.GetInfo().GetSchedule().GetMode() == kRealtime;
         state.stored.task = task;
@@ -982,6 +981,15 @@ void Service::CmdUpdate(const PObject& request, PObject& reply) {
     reply[Control::kKeyTaskId] = id;
 }
 
+Service::TaskState* Service::FindTask(uint64_t id, PObject& reply) {
+    const auto it = tasks_.find(id);
+    if (it == tasks_.end()) {
+        SetStatus(reply, Control::kNoSuchTask, "no task " + std::to_string(id));
+        return nullptr;
+    }
+    return it->second.get();
+}
+
 void Service::CmdRemove(const PObject& request, PObject& reply) {
     unsigned long long id = 0;
     if (!RequiredInteger(request, Control::kKeyTaskId, id, reply)) {
@@ -989,12 +997,11 @@ void Service::CmdRemove(const PObject& request, PObject& reply) {
     }
     {
         std::lock_guard<std::mutex> lock(mutex_);
-        const auto it = tasks_.find(id);
-        if (it == tasks_.end()) {
-            SetStatus(reply, Control::kNoSuchTask, "no task " + std::to_string(id));
+        TaskState* found = FindTask(id, reply);
+        if (found == nullptr) {
             return;
         }
-        if (it->second->running) {
+        if (found->running) {
             SetStatus(reply, Control::kBusy,
                       "task " + std::to_string(id) + " is running; cancel it first");
             return;
@@ -1004,7 +1011,7 @@ void Service::CmdRemove(const PObject& request, PObject& reply) {
             SetStatus(reply, Control::kInternal, error);
             return;
         }
-        tasks_.erase(it);
+        tasks_.erase(id);
         queue_.erase(std::remove(queue_.begin(), queue_.end(), id), queue_.end());
         scheduler_.Remove(id);
     }
@@ -1046,12 +1053,11 @@ void Service::CmdShow(const PObject& request, PObject& reply) {
         return;
     }
     std::lock_guard<std::mutex> lock(mutex_);
-    const auto it = tasks_.find(id);
-    if (it == tasks_.end()) {
-        SetStatus(reply, Control::kNoSuchTask, "no task " + std::to_string(id));
+    TaskState* found = FindTask(id, reply);
+    if (found == nullptr) {
         return;
     }
-    reply[Control::kKeyTask] = TaskMap(*it->second);
+    reply[Control::kKeyTask] = TaskMap(*found);
 }
 
 void Service::CmdRun(const PObject& request, PObject& reply) {
@@ -1060,12 +1066,11 @@ void Service::CmdRun(const PObject& request, PObject& reply) {
         return;
     }
     std::lock_guard<std::mutex> lock(mutex_);
-    const auto it = tasks_.find(id);
-    if (it == tasks_.end()) {
-        SetStatus(reply, Control::kNoSuchTask, "no task " + std::to_string(id));
+    TaskState* found = FindTask(id, reply);
+    if (found == nullptr) {
         return;
     }
-    if (it->second->running) {
+    if (found->running) {
         SetStatus(reply, Control::kBusy, "task " + std::to_string(id) + " is running already");
         return;
     }
@@ -1078,12 +1083,11 @@ void Service::CmdCancel(const PObject& request, PObject& reply) {
         return;
     }
     std::lock_guard<std::mutex> lock(mutex_);
-    const auto it = tasks_.find(id);
-    if (it == tasks_.end()) {
-        SetStatus(reply, Control::kNoSuchTask, "no task " + std::to_string(id));
+    TaskState* found = FindTask(id, reply);
+    if (found == nullptr) {
         return;
     }
-    TaskState& state = *it->second;
+    TaskState& state = *found;
     if (state.queued) {
         state.queued = false;
         state.queued_job = Job();
@@ -1209,16 +1213,15 @@ void Service::CmdPause(const PObject& request, PObject& reply, bool pause) {
     }
     {
         std::lock_guard<std::mutex> lock(mutex_);
-        const auto it = tasks_.find(id);
-        if (it == tasks_.end()) {
-            SetStatus(reply, Control::kNoSuchTask, "no task " + std::to_string(id));
+        TaskState* found = FindTask(id, reply);
+        if (found == nullptr) {
             return;
         }
         if (store_.SetPaused(id, pause, error) != 0) {
             SetStatus(reply, Control::kInternal, error);
             return;
         }
-        it->second->stored.paused = pause;
+        found->stored.paused = pause;
     }
     RefreshWatch();
 }

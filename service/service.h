@@ -79,6 +79,8 @@ class Service {
     void RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions guard, const Job& job,
                    const S2S::KnownServer& known, std::shared_ptr<std::atomic<bool>> cancel);
     void Reap();
+    // The task `id`, or null with the reply set to no-such-task. Holds no lock: call with mutex_.
+    TaskState* FindTask(uint64_t id, S2S::PObject& reply);
     S2S::PObject TaskMap(const TaskState& state) const;
     S2S::PObject StatusMap(const TaskState& state) const;
 
