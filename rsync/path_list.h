@@ -9,6 +9,12 @@
 
 namespace S2S {
 
+// `paths` (relative to `root`) as they stand now: a path below a component that is gone or is no
+// longer a directory (a folder replaced by a file) is replaced by that component, so rsync is
+// never asked for a path it cannot even look up; duplicates go. The order is sorted.
+std::vector<std::string> SettledPaths(const std::string& root,
+                                      const std::vector<std::string>& paths);
+
 class PathList {
   public:
     PathList() = default;

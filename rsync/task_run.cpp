@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <utility>
 
+#include "rsync/path_list.h"
 #include "rsync/transfer_meter.h"
 #include "s2s_platform.h"
 #include "s2s_receiver.h"
@@ -489,7 +490,10 @@ void TaskRun::SyncShare(ShareOutcome& share) {
     const std::vector<std::string>* paths =
         changed != changed_.end() && !changed->second.empty() ? &changed->second : nullptr;
     bool whole = paths == nullptr;
+    std::vector<std::string> settled;
     if (paths != nullptr) {
+        settled = SettledPaths(info.GetModulePath(), *paths);
+        paths = &settled;
         // Only the changed paths are measured, checked and sent.
         const SourceGuardReport guard = CheckChangedPaths(rsyncer_, share.name, *paths, excludes_,
                                                           guard_, &TaskRun::PollCurrent, whole);
