@@ -67,16 +67,15 @@ int Logger::Initialize(Type type, int level, const std::string& path, int count)
 }
 
 void Logger::LogMsg(Level level, const char* format, ...) {
-    if (log_type != Syslog && log_fp == nullptr) {
-        return;
-    }
     // log_level only changes in Initialize/Destroy, which never run while another thread logs, so
     // a filtered message can be dropped before the lock: the answer under the lock is the same.
     if (level > log_level) {
         return;
     }
     pthread_mutex_lock(&log_mutex);
-    if (level > log_level) {
+    // The stream is looked at under the lock only: a rotation in another thread closes it and
+    // opens the next one while holding the lock, and a line that saw it closed in between was lost.
+    if (level > log_level || (log_type != Syslog && log_fp == nullptr)) {
         pthread_mutex_unlock(&log_mutex);
         return;
     }
