@@ -82,7 +82,9 @@ TEST_F(FailureScenario, CtrlCStopsTheCopyLeavesNoRsyncAndNothingComplete) {
     StartReceiver();
     const std::string big = sender_->SharePath("docs") + "/big.bin";
     WriteRandomFile(big, 48u << 20);
-    auto sync = sender_->StartSync(kUser, {"docs", "media"}, {"--compress", "--json"});
+    // Limited to 16 MiB/s, the copy cannot end before its partial file has been seen.
+    auto sync = sender_->StartSync(kUser, {"docs", "media"},
+                                   {"--compress", "--json", "--max-bandwidth", "16384"});
     ASSERT_TRUE(WaitFor([&] { return HasPartialFile(receiver_->SharePath("docs")); },
                         std::chrono::seconds(60)))
         << sync->Err();

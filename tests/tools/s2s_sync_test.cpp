@@ -130,9 +130,10 @@ TEST_F(SyncScenario, ReceiverRestartedMidTransferThenResyncedToCompletion) {
     MakeDirs(receiver_->SharePath("docs"));
     WriteFile(receiver_->SharePath("docs") + "/big.bin", "old complete copy");
 
-    // Compression of random data keeps the transfer slow; the sending rsync is then frozen so the
-    // receiver is stopped while the file is surely half-way.
-    auto sync = sender_->StartSync(kUser, {"docs"}, {"--compress"});
+    // A bandwidth limit (16 MiB/s) keeps the transfer slow enough for its partial file to be
+    // seen; the sending rsync is then frozen so the receiver is stopped while the file is surely
+    // half-way.
+    auto sync = sender_->StartSync(kUser, {"docs"}, {"--compress", "--max-bandwidth", "16384"});
     ASSERT_TRUE(WaitFor([&] { return HasPartialFile(receiver_->SharePath("docs")); },
                         std::chrono::seconds(60)))
         << sync->Err();
