@@ -18,7 +18,7 @@
 #include <vector>
 
 #include "gtest/gtest.h"
-#include "rsync/receiver_internal.h"
+#include "receiver/internal.h"
 #include "rsync/wrapper_fixture.h"
 #include "s2s_receiver.h"
 #include "s2s_rsync_wrapper.h"

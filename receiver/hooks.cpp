@@ -33,7 +33,7 @@
 #include <vector>
 
 #include "rsync/command_reply.h"
-#include "rsync/receiver_internal.h"
+#include "receiver/internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_receiver.h"

@@ -35,7 +35,7 @@
 #include <vector>
 
 #include "rsync/child_process.h"
-#include "rsync/receiver_internal.h"
+#include "receiver/internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_receiver.h"
