@@ -6,6 +6,7 @@
 #include <new>
 #include <string>
 
+#include "core/protocol.h"
 #include "platform/platform_internal.h"
 #include "platform/section_file.h"
 #include "s2s_logger.h"
@@ -28,82 +29,16 @@ std::string RegistryPath() {
     return path == nullptr ? std::string() : path;
 }
 
-// Decodes one UTF-8 sequence at `p`; its length, or 0 when it is not valid UTF-8.
-size_t Utf8Length(const unsigned char* p) {
-    unsigned char c = p[0];
-    size_t len;
-    unsigned int code;
-    if (c < 0x80) {
-        return 1;
-    } else if ((c & 0xE0) == 0xC0) {
-        len = 2;
-        code = c & 0x1F;
-    } else if ((c & 0xF0) == 0xE0) {
-        len = 3;
-        code = c & 0x0F;
-    } else if ((c & 0xF8) == 0xF0) {
-        len = 4;
-        code = c & 0x07;
-    } else {
-        return 0;
-    }
-    for (size_t i = 1; i < len; ++i) {
-        if ((p[i] & 0xC0) != 0x80) {
-            return 0;
-        }
-        code = (code << 6) | (p[i] & 0x3F);
-    }
-    // Overlong forms, surrogates and code points past U+10FFFF are not valid.
-    static const unsigned int kMin[] = {0, 0, 0x80, 0x800, 0x10000};
-    if (code < kMin[len] || code > 0x10FFFF || (code >= 0xD800 && code <= 0xDFFF)) {
-        return 0;
-    }
-    return len;
-}
+// The share-name rules are the exchange's own: the receiving daemon serves each share as a
+// module of its name, so the registry and both ends of a sync share one rule.
+static_assert(VURN_SHARE_NAME_MAX == S2S::protocol::kShareNameMax, "one share name length");
 
 bool ValidShareName(const char* name) {
-    if (name == nullptr) {
-        return false;
-    }
-    size_t len = std::strlen(name);
-    if (len == 0 || len > VURN_SHARE_NAME_MAX || std::strcmp(name, ".") == 0 ||
-        std::strcmp(name, "..") == 0 || name[0] == ' ' || name[len - 1] == ' ') {
-        return false;
-    }
-    const unsigned char* p = reinterpret_cast<const unsigned char*>(name);
-    while (*p != 0) {
-        if (*p < 0x20 || *p == 0x7F || std::strchr("/\\[]", *p) != nullptr) {
-            return false;
-        }
-        size_t step = Utf8Length(p);
-        if (step == 0) {
-            return false;
-        }
-        p += step;
-    }
-    return true;
+    return name != nullptr && S2S::protocol::ShareNameValid(name);
 }
 
-// The module name the receiving daemon's configuration reader makes of `name`: it ignores ASCII
-// letter case and every blank when it matches a section header against the ones before it.
 std::string ModuleKey(const std::string& name) {
-    std::string key;
-    for (char c : name) {
-        if (c != ' ' && c != '\t') {
-            key += static_cast<char>(c >= 'A' && c <= 'Z' ? c - 'A' + 'a' : c);
-        }
-    }
-    return key;
-}
-
-bool SyncableShareName(const char* name) {
-    if (!ValidShareName(name)) {
-        return false;
-    }
-    std::string text = name;
-    return text[0] != '@' && text.find_first_of("\"'`%") == std::string::npos &&
-           text.find("..") == std::string::npos && text.find("  ") == std::string::npos &&
-           ModuleKey(text) != "global";
+    return S2S::protocol::ShareModuleKey(name);
 }
 
 // The registered share, other than `name` itself, that would be served as the same module.
@@ -279,7 +214,7 @@ int VURNShareNameIsValid(const char* name) {
 
 int VURNShareNameIsSyncable(const char* name) {
     try {
-        return SyncableShareName(name) ? 1 : 0;
+        return name != nullptr && S2S::protocol::ShareNameSyncable(name) ? 1 : 0;
     } catch (const std::bad_alloc&) {
         return 0;
     }
