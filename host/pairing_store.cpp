@@ -20,11 +20,14 @@
 #include <ctime>
 #include <memory>
 #include <new>
+#include <optional>
 #include <string>
+#include <unordered_map>
+#include <utility>
 #include <vector>
 
+#include "core/protocol.h"
 #include "host/pairing_store.h"
-#include "platform/section_file.h"
 #include "s2s_platform.h"
 
 namespace S2S {
@@ -33,7 +36,6 @@ namespace {
 
 constexpr const char* kLineFormat = "\t%s=\"%s\"\n";
 constexpr const char* kPairSection = "PairedClientInfo";
-constexpr const char* kMultiClientMarker = "S2SMULTI-SRC-SUPPORT";
 constexpr int kPairTableSize = 1024;
 constexpr int kUpdateTableSize = 512;
 // Client IDs are read into buffers of this size; a longer stored ID cannot be read.
@@ -41,7 +43,29 @@ constexpr int kIdBufferSize = 36;
 // A task counts as running while its last heartbeat is younger than this.
 constexpr long kHeartbeatWindowSeconds = 120;
 
-enum SharePairStatus { kShareRunning = 0, kShareCompleted = 1, kShareFree = 2 };
+// The store's results are the exchange's own numbers: the receiver passes them on as answers.
+static_assert(S2S_SVR_OK == protocol::kOK, "");
+static_assert(S2S_SVR_ERR_ALLOC == protocol::kStoreAlloc, "");
+static_assert(S2S_SVR_ERR_ARGUMENT == protocol::kMissingKey, "");
+static_assert(S2S_SVR_ERR_KEY == protocol::kUnknownKey, "");
+static_assert(S2S_SVR_ERR_WRITE == protocol::kStoreWrite, "");
+static_assert(S2S_SVR_ERR_READ == protocol::kStoreRead, "");
+static_assert(S2S_SVR_ERR_SHARE_PAIRED == protocol::kShareConflict, "");
+
+// Sections and keys of the store.
+constexpr const char* kClientPrefix = kClientSectionPrefix;
+constexpr const char* kSharePrefix = "SHARE_";
+constexpr const char* kTaskPrefix = kTaskSectionPrefix;
+constexpr const char* kClientID = "clientID";
+constexpr const char* kServerName = "serverName";
+constexpr const char* kClientServerName = "ServerName";
+constexpr const char* kCompleteID = "CompleteID";
+constexpr const char* kRunningID = "RunningID";
+constexpr const char* kLastStart = "LastStart";
+constexpr const char* kLastResult = "LastResult";
+constexpr const char* kLastTime = "LastTime";
+constexpr const char* kTaskStatus = "status";
+constexpr const char* kTaskIdle = "idle";
 
 std::atomic<MessageSink> g_sink{nullptr};
 
@@ -181,42 +205,84 @@ char* SectionName(const char* prefix, const char* name) {
     return VLIBCStrGet("%s%s", prefix, name);
 }
 
+typedef std::vector<std::pair<std::string, std::string>> Pairs;
+
+// The value of `key` in `pairs`, unset when the section lacks it.
+std::optional<std::string> ValueOf(const Pairs& pairs, const char* key) {
+    for (const auto& pair : pairs) {
+        if (pair.first == key) {
+            return pair.second;
+        }
+    }
+    return std::nullopt;
+}
+
+ShareFields ShareFieldsOf(const Pairs& pairs) {
+    ShareFields fields;
+    fields.completeID = ValueOf(pairs, kCompleteID);
+    fields.runningID = ValueOf(pairs, kRunningID);
+    fields.lastStart = ValueOf(pairs, kLastStart);
+    fields.lastResult = ValueOf(pairs, kLastResult);
+    fields.lastTime = ValueOf(pairs, kLastTime);
+    return fields;
+}
+
+// An ID the store's readers cannot take: they read IDs into kIdBufferSize bytes.
+bool TooLong(const std::optional<std::string>& id) {
+    return id && id->size() >= static_cast<size_t>(kIdBufferSize);
+}
+
+// A share is running while its running ID is set and differs from a non-empty completed ID (or
+// the completed ID is empty), completed when both are equal and non-empty, and free otherwise,
+// also without a record or without a completed ID.
+ShareBinding BindingOf(const ShareFields& fields) {
+    if (!fields.completeID) {
+        return ShareBinding::kFree;
+    }
+    if (TooLong(fields.completeID) || !fields.runningID || TooLong(fields.runningID)) {
+        return ShareBinding::kUnreadable;
+    }
+    const std::string& complete = *fields.completeID;
+    const std::string& running = *fields.runningID;
+    if (complete.empty()) {
+        return running.empty() ? ShareBinding::kFree : ShareBinding::kRunning;
+    }
+    if (running.empty()) {
+        return ShareBinding::kFree;
+    }
+    return running != complete ? ShareBinding::kRunning : ShareBinding::kCompleted;
+}
+
 // One read of the store for a whole decision over many sections. Reading each share or task
 // section on its own would read (or at least check) the whole file once per section; here every
 // section is taken from the one version of the file read first, which is also the version a quick
 // enough series of single reads would have seen. Lookups report what VLIBCFileGetSection would:
-// the same results and platform errors, and a failed read is logged once, by the platform.
+// the same results and platform errors, and a failed read is logged once, by the platform. Only
+// the sections whose names start with `prefix` are kept.
 class StoreSnapshot {
   public:
-    explicit StoreSnapshot(const char* file) : file_(file) {}
+    StoreSnapshot(const char* file, const char* prefix) : file_(file), prefix_(prefix) {}
 
-    // -1 (platform error set), or 0 with the file's document read.
+    // -1 (platform error set), or 0 with the file's sections read.
     int Load() {
         if (!loaded_) {
             loaded_ = true;
             if (file_ == nullptr || *file_ == '\0') {
                 error_ = VLIB_ERR_BAD_PARAMETER;
             } else {
-                try {
-                    error_ = s2s_platform::LoadSectionFileShared(file_, doc_) == 0 ? VLIB_ERR_NONE
-                                                                                   : VLIBCErrGet();
-                } catch (const std::bad_alloc&) {
-                    error_ = VLIB_ERR_OUT_OF_MEMORY;
-                }
+                const int rc = VLIBCFileVisitSections(file_, prefix_, &StoreSnapshot::Keep, this);
+                error_ =
+                    rc == 0 ? VLIB_ERR_NONE : (rc < 0 ? VLIBCErrGet() : VLIB_ERR_OUT_OF_MEMORY);
             }
         }
         VLIBCErrSet(error_);
         return error_ == VLIB_ERR_NONE ? 0 : -1;
     }
 
-    // Like VLIBCFileGetSection on `section`, keeping only the `count` keys of `keys`: -1 on a
-    // failed read, 0 when the section is absent, 1 when found, with values[i] set and present[i]
-    // true where the section has keys[i].
-    int GetSection(const char* section, int count, const char* const* keys, std::string* values,
-                   bool* present) {
-        for (int i = 0; i < count; ++i) {
-            present[i] = false;
-        }
+    // Like VLIBCFileGetSection on `section`: -1 on a failed read, 0 when the section is absent,
+    // 1 when found, with `*pairs` pointing at its pairs.
+    int GetSection(const char* section, const Pairs** pairs) {
+        *pairs = nullptr;
         if (section == nullptr || *section == '\0') {
             VLIBCErrSet(VLIB_ERR_BAD_PARAMETER);
             return -1;
@@ -224,35 +290,49 @@ class StoreSnapshot {
         if (Load() != 0) {
             return -1;
         }
-        try {
-            if (!doc_->HasSection(section)) {
-                VLIBCErrSet(VLIB_ERR_NOT_FOUND);
-                return 0;
-            }
-            for (int i = 0; i < count; ++i) {
-                present[i] = doc_->GetValue(section, keys[i], values[i]);
-            }
-        } catch (const std::bad_alloc&) {
-            VLIBCErrSet(VLIB_ERR_OUT_OF_MEMORY);
-            return -1;
+        auto it = sections_.find(section);
+        if (it == sections_.end()) {
+            VLIBCErrSet(VLIB_ERR_NOT_FOUND);
+            return 0;
         }
+        *pairs = &it->second;
         VLIBCErrSet(VLIB_ERR_NONE);
         return 1;
     }
 
-    const s2s_platform::SectionDoc& doc() const { return *doc_; }
+    // The section names in file order, a name repeated by hand once per header.
+    const std::vector<std::string>& names() const { return names_; }
 
   private:
+    static int Keep(void* arg, const char* section, int count, const char* const* keys,
+                    const char* const* values) {
+        StoreSnapshot* self = static_cast<StoreSnapshot*>(arg);
+        try {
+            self->names_.push_back(section);
+            auto added = self->sections_.emplace(section, Pairs());
+            if (added.second) {
+                for (int i = 0; i < count; ++i) {
+                    added.first->second.emplace_back(keys[i], values[i]);
+                }
+            }
+        } catch (const std::bad_alloc&) {
+            return 1;
+        }
+        return 0;
+    }
+
     const char* file_;
+    const char* prefix_;
     bool loaded_ = false;
     int error_ = VLIB_ERR_NONE;
-    std::shared_ptr<const s2s_platform::SectionDoc> doc_;
+    std::vector<std::string> names_;
+    std::unordered_map<std::string, Pairs> sections_;
 };
 
-// Why a share cannot be paired by some client: its status and the client bound to it.
+// Why a share cannot be paired by some client: its binding and the client bound to it.
 struct ShareState {
-    int status = kShareFree;
-    char owner[kIdBufferSize] = "";
+    ShareBinding binding = ShareBinding::kFree;
+    std::string owner;
 };
 
 // Reads the share's binding from `store` into `state`. 0; 206 when its section cannot be read;
@@ -265,40 +345,26 @@ int GetSharePairStatus(const char* share, StoreSnapshot* store, ShareState* stat
         Message("Parameter error on getSharePairStatus.");
         return 0;
     }
-    PlatformString section(SectionName("SHARE_", share));
+    PlatformString section(SectionName(kSharePrefix, share));
     if (section.get() == nullptr) {
         return S2S_SVR_ERR_ALLOC;
     }
-    static const char* const kKeys[] = {"CompleteID", "RunningID"};
-    std::string ids[2];
-    bool present[2];
-    const int found = store->GetSection(section.get(), 2, kKeys, ids, present);
-    const char* complete = found > 0 && present[0] ? ids[0].c_str() : nullptr;
-    const char* running = found > 0 && present[1] ? ids[1].c_str() : nullptr;
-    // IDs live in buffers of kIdBufferSize bytes; a longer one cannot be read.
-    if (found < 0 || (complete != nullptr && strlen(complete) >= sizeof(ShareState::owner))) {
+    const Pairs* pairs = nullptr;
+    const int found = store->GetSection(section.get(), &pairs);
+    const ShareFields fields = pairs != nullptr ? ShareFieldsOf(*pairs) : ShareFields();
+    if (found < 0 || TooLong(fields.completeID)) {
         Message("Failed to get section [%s] CompleteID value.", section.get());
         Message("getSharePairStatus error");
         return S2S_SVR_ERR_READ;
     }
-    if (complete == nullptr) {  // no section or no completed ID: nobody holds the share
-        state->status = kShareFree;
-        state->owner[0] = '\0';
-        return 0;
-    }
-    if (running == nullptr || strlen(running) >= sizeof(ShareState::owner)) {
+    const ShareBinding binding = BindingOf(fields);
+    if (binding == ShareBinding::kUnreadable) {
         Message("Failed to get section [%s] RunningID value.", section.get());
         Message("getSharePairStatus error");
         return S2S_SVR_ERR_READ;
     }
-    snprintf(state->owner, sizeof(state->owner), "%s", running);
-    if (*complete == '\0') {
-        state->status = *running != '\0' ? kShareRunning : kShareFree;
-    } else if (*running == '\0') {
-        state->status = kShareFree;
-    } else {
-        state->status = strcmp(running, complete) != 0 ? kShareRunning : kShareCompleted;
-    }
+    state->binding = binding;
+    state->owner = binding == ShareBinding::kFree ? std::string() : *fields.runningID;
     return 0;
 }
 
@@ -307,11 +373,11 @@ bool CanClientPairTheShare(const ShareState& state, const char* clientId) {
         Message("Parameter error on canClientPairTheShare.");
         return false;
     }
-    switch (state.status) {
-        case kShareRunning:
-        case kShareCompleted:
-            return strcmp(state.owner, clientId) == 0;
-        case kShareFree:
+    switch (state.binding) {
+        case ShareBinding::kRunning:
+        case ShareBinding::kCompleted:
+            return state.owner == clientId;
+        case ShareBinding::kFree:
             return true;
         default:
             Message("ShareStatus does not match any cases on canClientPairTheShare.");
@@ -320,40 +386,30 @@ bool CanClientPairTheShare(const ShareState& state, const char* clientId) {
 }
 
 // Whether some task sent a heartbeat within the window. Any failure reads as not busy. The
-// section names and every task section come from one read of the file.
+// section names and every task section come from one read of the file; the walk stops at the
+// first busy task.
 int AnyTaskBusy(const char* file) {
-    StoreSnapshot store(file);
-    std::vector<std::string> names;
-    try {
-        if (store.Load() != 0) {
-            return 0;
-        }
-        names = store.doc().SectionNames();
-    } catch (const std::bad_alloc&) {
+    if (file == nullptr || *file == '\0') {
         return 0;
     }
-    const time_t now = time(nullptr);
-    static const char* const kKeys[] = {"status"};
-    for (const std::string& name : names) {
-        if (name.compare(0, 5, "TASK_") != 0) {
-            continue;
-        }
-        std::string value;
-        bool present = false;
-        const int found = store.GetSection(name.c_str(), 1, kKeys, &value, &present);
-        if (found < 0) {
+    struct Scan {
+        time_t now;
+        static int Visit(void* arg, const char*, int count, const char* const* keys,
+                         const char* const* values) {
+            const Scan* scan = static_cast<const Scan*>(arg);
+            for (int i = 0; i < count; ++i) {
+                if (strcmp(keys[i], kTaskStatus) != 0) {
+                    continue;
+                }
+                // A future timestamp counts as busy: the clocks of the two servers need not
+                // agree.
+                return strcmp(values[i], kTaskIdle) != 0 &&
+                       scan->now - strtol(values[i], nullptr, 10) < kHeartbeatWindowSeconds;
+            }
             return 0;
         }
-        const char* status = present ? value.c_str() : nullptr;
-        if (found == 0 || status == nullptr || strcmp(status, "idle") == 0) {
-            continue;
-        }
-        // A future timestamp counts as busy: the clocks of the two servers need not agree.
-        if (now - strtol(status, nullptr, 10) < kHeartbeatWindowSeconds) {
-            return 1;
-        }
-    }
-    return 0;
+    } scan{time(nullptr)};
+    return VLIBCFileVisitSections(file, kTaskPrefix, &Scan::Visit, &scan) == 1 ? 1 : 0;
 }
 
 // The update itself; the caller holds the semaphore. Sets the keys of `values` in `section`,
@@ -413,6 +469,122 @@ MessageSink SetMessageSink(MessageSink sink) {
     return g_sink.exchange(sink);
 }
 
+bool ShareFields::Holds(const ShareFields& wanted) const {
+    auto same = [](const std::optional<std::string>& have, const std::optional<std::string>& want) {
+        return !want || have == want;
+    };
+    return same(completeID, wanted.completeID) && same(runningID, wanted.runningID) &&
+           same(lastStart, wanted.lastStart) && same(lastResult, wanted.lastResult) &&
+           same(lastTime, wanted.lastTime);
+}
+
+const StoreClient* StoreContents::FindClient(const std::string& clientID) const {
+    for (const StoreClient& client : clients) {
+        if (client.clientID == clientID) {
+            return &client;
+        }
+    }
+    return nullptr;
+}
+
+const StoreShare* StoreContents::FindShare(const std::string& name) const {
+    for (const StoreShare& share : shares) {
+        if (share.name == name) {
+            return &share;
+        }
+    }
+    return nullptr;
+}
+
+const StoreTask* StoreContents::FindTask(const std::string& key) const {
+    for (const StoreTask& task : tasks) {
+        if (task.key == key) {
+            return &task;
+        }
+    }
+    return nullptr;
+}
+
+int StoreContents::CountTasks(const std::string& prefix) const {
+    int count = 0;
+    for (const StoreTask& task : tasks) {
+        count += task.key.compare(0, prefix.size(), prefix) == 0;
+    }
+    return count;
+}
+
+int ReadStore(StoreContents* contents) {
+    *contents = StoreContents();
+    EnsureFile();
+    StoreSnapshot store(StorePath(), "");
+    if (store.Load() != 0) {
+        return -1;
+    }
+    auto starts = [](const std::string& name, const char* prefix) {
+        return name.compare(0, strlen(prefix), prefix) == 0;
+    };
+    try {
+        for (const std::string& name : store.names()) {
+            const Pairs* pairs = nullptr;
+            if (store.GetSection(name.c_str(), &pairs) <= 0) {
+                continue;
+            }
+            if (name == kPairSection) {
+                contents->pairedClientID = ValueOf(*pairs, kClientID).value_or("");
+                contents->pairedServerName = ValueOf(*pairs, kServerName).value_or("");
+            } else if (starts(name, kClientPrefix)) {
+                contents->clients.push_back({name.substr(strlen(kClientPrefix)),
+                                             ValueOf(*pairs, kClientServerName).value_or("")});
+            } else if (starts(name, kSharePrefix)) {
+                StoreShare share;
+                share.name = name.substr(strlen(kSharePrefix));
+                share.fields = ShareFieldsOf(*pairs);
+                share.binding = BindingOf(share.fields);
+                if (share.binding == ShareBinding::kRunning ||
+                    share.binding == ShareBinding::kCompleted) {
+                    share.owner = *share.fields.runningID;
+                }
+                contents->shares.push_back(std::move(share));
+            } else if (starts(name, kTaskPrefix)) {
+                contents->tasks.push_back(
+                    {name.substr(strlen(kTaskPrefix)), ValueOf(*pairs, kTaskStatus).value_or("")});
+            }
+        }
+    } catch (const std::bad_alloc&) {
+        VLIBCErrSet(VLIB_ERR_OUT_OF_MEMORY);
+        return -1;
+    }
+    VLIBCErrSet(VLIB_ERR_NONE);
+    return 0;
+}
+
+int UpdateShareRecord(const std::string& share, const ShareFields& fields) {
+    Table values(kUpdateTableSize);
+    if (!values.ok()) {
+        return S2S_SVR_ERR_ALLOC;
+    }
+    const std::pair<const char*, const std::optional<std::string>*> keys[] = {
+        {kRunningID, &fields.runningID},
+        {kCompleteID, &fields.completeID},
+        {kLastStart, &fields.lastStart},
+        {kLastResult, &fields.lastResult},
+        {kLastTime, &fields.lastTime}};
+    for (const auto& key : keys) {
+        if (*key.second && !values.Set(key.first, (*key.second)->c_str())) {
+            return S2S_SVR_ERR_ALLOC;
+        }
+    }
+    return S2SServerUpdateShare(share.c_str(), values.get()) == 0 ? 0 : -1;
+}
+
+int RecordTaskStatus(const std::string& key, const std::string& status) {
+    Table values(kUpdateTableSize);
+    if (!values.ok() || !values.Set(kTaskStatus, status.c_str())) {
+        return S2S_SVR_ERR_ALLOC;
+    }
+    return S2SServerUpdateTask(key.c_str(), values.get()) == 0 ? 0 : -1;
+}
+
 }  // namespace PairingStore
 }  // namespace S2S
 
@@ -448,7 +620,7 @@ int S2SServerGetShare(const char* share, const char* key, char* buf, int size) {
         return -1;
     }
     EnsureFile();
-    PlatformString section(SectionName("SHARE_", share));
+    PlatformString section(SectionName(kSharePrefix, share));
     if (section.get() == nullptr) {
         VLIBCErrSet(VLIB_ERR_OUT_OF_MEMORY);
         return -1;
@@ -485,7 +657,7 @@ int S2SServerUpdateTask(const char* task, VLIBSzHash* values) {
     if (task == nullptr) {
         return -1;
     }
-    PlatformString section(SectionName("TASK_", task));
+    PlatformString section(SectionName(kTaskPrefix, task));
     return section.get() != nullptr ? S2SUpdateServerInfo(section.get(), values) : -1;
 }
 
@@ -493,7 +665,7 @@ int S2SServerUpdateShare(const char* share, VLIBSzHash* values) {
     if (share == nullptr) {
         return -1;
     }
-    PlatformString section(SectionName("SHARE_", share));
+    PlatformString section(SectionName(kSharePrefix, share));
     return section.get() != nullptr ? S2SUpdateServerInfo(section.get(), values) : -1;
 }
 
@@ -508,15 +680,15 @@ int S2SServerSetPairValue(VLIBSzHash* values) {
     if (S2SGetServerInfo(kPairSection, pair.slot()) < 0) {
         return S2S_SVR_ERR_READ;
     }
-    const char* clientId = VLIBCSzHashGetValue(values, "clientID");
-    const char* serverName = VLIBCSzHashGetValue(values, "serverName");
+    const char* clientId = VLIBCSzHashGetValue(values, kClientID);
+    const char* serverName = VLIBCSzHashGetValue(values, kServerName);
     if (clientId == nullptr || serverName == nullptr) {
         return S2S_SVR_ERR_KEY;
     }
     // Only the two keys are written: the update keeps the section's other keys ("s2sEnabled")
     // as they are at the moment of the write, not as they were read a moment earlier.
     VLIBCHashRemoveAll(pair.get());
-    if (!pair.Set("clientID", clientId) || !pair.Set("serverName", serverName)) {
+    if (!pair.Set(kClientID, clientId) || !pair.Set(kServerName, serverName)) {
         return S2S_SVR_ERR_KEY;
     }
     return S2SUpdateServerInfo(kPairSection, pair.get()) < 0 ? S2S_SVR_ERR_WRITE : S2S_SVR_OK;
@@ -532,17 +704,17 @@ int S2SServerUpdatePairInfo(const char* client_id, const char* server_name) {
     if (!client.ok() || !pair.ok()) {
         return S2S_SVR_ERR_ALLOC;
     }
-    if (!client.Set("ServerName", server_name)) {
+    if (!client.Set(kClientServerName, server_name)) {
         return S2S_SVR_ERR_KEY;
     }
-    PlatformString section(SectionName("CLIENTID_", client_id));
+    PlatformString section(SectionName(kClientPrefix, client_id));
     if (section.get() == nullptr) {
         return S2S_SVR_ERR_ALLOC;
     }
     if (S2SUpdateServerInfo(section.get(), client.get()) < 0) {
         return S2S_SVR_ERR_WRITE;
     }
-    if (!pair.Set("clientID", kMultiClientMarker) || !pair.Set("serverName", kMultiClientMarker)) {
+    if (!pair.Set(kClientID, kMultiClientMarker) || !pair.Set(kServerName, kMultiClientMarker)) {
         return S2S_SVR_ERR_KEY;
     }
     return S2SServerSetPairValue(pair.get()) != 0 ? S2S_SVR_ERR_WRITE : S2S_SVR_OK;
@@ -558,8 +730,8 @@ int S2SServerIfOldClientPaired(void) {
         Message("Get server paired-info error.");
         return -1;
     }
-    const char* clientId = pair.Get("clientID");
-    const char* serverName = pair.Get("serverName");
+    const char* clientId = pair.Get(kClientID);
+    const char* serverName = pair.Get(kServerName);
     if (clientId == nullptr || *clientId == '\0' || serverName == nullptr || *serverName == '\0') {
         return 0;
     }
@@ -589,22 +761,22 @@ int s2s_svr_reset_pair(void) {
     // Moving the old client to its own section is best effort: the conversion goes on without.
     EnsureFile();
     Table client(kPairTableSize);
-    const char* clientId = pair.Get("clientID");
-    const char* serverName = pair.Get("serverName");
+    const char* clientId = pair.Get(kClientID);
+    const char* serverName = pair.Get(kServerName);
     if (clientId == nullptr) {
         Message("Failed to get clientID from hash.");
     } else if (serverName == nullptr) {
         Message("Failed to get serverName from hash.");
-    } else if (client.ok() && client.Set("ServerName", serverName)) {
-        PlatformString section(SectionName("CLIENTID_", clientId));
+    } else if (client.ok() && client.Set(kClientServerName, serverName)) {
+        PlatformString section(SectionName(kClientPrefix, clientId));
         if (section.get() == nullptr ||
             VLIBCFileAddSection(file, section.get(), client.get(), nullptr) < 0) {
             Message("Failed to add section [%s].",
-                    section.get() != nullptr ? section.get() : "CLIENTID_");
+                    section.get() != nullptr ? section.get() : kClientPrefix);
         }
     }
 
-    if (!pair.Set("clientID", kMultiClientMarker) || !pair.Set("serverName", kMultiClientMarker)) {
+    if (!pair.Set(kClientID, kMultiClientMarker) || !pair.Set(kServerName, kMultiClientMarker)) {
         return -1;
     }
     if (EnsureFile() != 0) {
@@ -632,7 +804,7 @@ int S2SCheckIfSharePaired(VLIBSzList* shares, const char* client_id, VLIBSzList*
     VLIBCSzListRemoveAll(*refused);
     EnsureFile();
     // The file is read when the first share is looked up, after it was ensured.
-    StoreSnapshot store(StorePath());
+    StoreSnapshot store(StorePath(), kSharePrefix);
     ShareState state;
     const int count = VLIBCSzListCount(shares);
     for (int i = 0; i < count; ++i) {
@@ -668,8 +840,8 @@ int s2s_svr_get_status(s2s_svr_status* status) {
         VLIBCProcAliveByPidFile(S2SPath(S2S_PATH_RSYNCD_PID)) != 0) {
         status->running = 1;
     }
-    const char* clientId = pair.Get("clientID");
-    const char* serverName = pair.Get("serverName");
+    const char* clientId = pair.Get(kClientID);
+    const char* serverName = pair.Get(kServerName);
     status->client_id = clientId != nullptr ? VLIBCStrGet("%s", clientId) : nullptr;
     status->server_name = serverName != nullptr ? VLIBCStrGet("%s", serverName) : nullptr;
     status->busy = AnyTaskBusy(StorePath());

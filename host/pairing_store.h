@@ -1,6 +1,12 @@
-// Internals of the pairing store that its tests reach: where its messages go.
+// The pairing store's typed face for the receiver (clients, shares with their states, task
+// heartbeats, read in one go), and the internals its tests reach: where its messages go. The
+// store's sections and keys are known to host/pairing_store.cpp alone (docs/pairing-store.md).
 #ifndef S2S_HOST_PAIRING_STORE_H
 #define S2S_HOST_PAIRING_STORE_H
+
+#include <optional>
+#include <string>
+#include <vector>
 
 namespace S2S {
 namespace PairingStore {
@@ -9,6 +15,14 @@ namespace PairingStore {
 // program that writes the file.
 constexpr int kSemaphoreKey = 0x2980298;
 
+// Stands in the pairing section's client ID and server name once the store is multi-client;
+// never a client itself.
+constexpr const char* kMultiClientMarker = "S2SMULTI-SRC-SUPPORT";
+
+// The section prefixes of clients and of task heartbeats, for messages that name them.
+constexpr const char* kClientSectionPrefix = "CLIENTID_";
+constexpr const char* kTaskSectionPrefix = "TASK_";
+
 // Receives each message, already formatted, instead of syslog. Called from any thread; must not
 // call back into the store.
 using MessageSink = void (*)(const char* message);
@@ -16,6 +30,73 @@ using MessageSink = void (*)(const char* message);
 // Sends the store's messages to `sink`, or back to syslog (LOG_ERR) when null. Returns the sink
 // that was in place.
 MessageSink SetMessageSink(MessageSink sink);
+
+// A share's record as stored; a key the record lacks stays unset.
+struct ShareFields {
+    std::optional<std::string> completeID;  // the client that last completed a sync into it
+    std::optional<std::string> runningID;   // the client bound to it
+    std::optional<std::string> lastStart;   // when a client last started a sync (epoch seconds)
+    std::optional<std::string> lastResult;  // how the last finished sync ended
+    std::optional<std::string> lastTime;    // and when
+
+    // True when every field `wanted` sets is set here to the same value.
+    bool Holds(const ShareFields& wanted) const;
+};
+
+// The store's one reading of a share's two IDs (S2SCheckIfSharePaired decides on it too).
+enum class ShareBinding {
+    kRunning,    // bound to `owner` while it syncs
+    kCompleted,  // `owner` completed a sync and is still bound to it
+    kFree,       // any client may take it (also without a record or a completed ID)
+    kUnreadable  // a completed ID without a running ID, or an ID too long to read: not judged
+};
+
+struct StoreShare {
+    std::string name;
+    ShareFields fields;
+    ShareBinding binding = ShareBinding::kFree;
+    std::string owner;  // the bound client; "" unless running or completed
+};
+
+struct StoreClient {
+    std::string clientID;
+    std::string serverName;
+};
+
+struct StoreTask {
+    std::string key;     // "<client ID>/<task name>" as the receiver records it
+    std::string status;  // "idle", or the last heartbeat (epoch seconds)
+};
+
+// The whole store from one read of the file. Lists keep the file's order.
+struct StoreContents {
+    // The pairing section's single client, or kMultiClientMarker; "" when absent.
+    std::string pairedClientID;
+    std::string pairedServerName;
+    std::vector<StoreClient> clients;
+    std::vector<StoreShare> shares;
+    std::vector<StoreTask> tasks;
+
+    const StoreClient* FindClient(const std::string& clientID) const;
+    const StoreShare* FindShare(const std::string& name) const;
+    const StoreTask* FindTask(const std::string& key) const;
+    // How many task keys start with `prefix`.
+    int CountTasks(const std::string& prefix) const;
+};
+
+// Reads the store, creating its file empty first when missing (as every read of the store does).
+// 0, or -1 with the platform error set (VLIB_ERR_FILE_NOT_FOUND when the file could not be
+// created).
+int ReadStore(StoreContents* contents);
+
+// Sets the fields of the share's record that `fields` sets, keeping the others (the record is
+// added when missing). 0; 200 (S2S_SVR_ERR_ALLOC) when the update could not be built; -1 as
+// S2SServerUpdateShare (the platform error tells why).
+int UpdateShareRecord(const std::string& share, const ShareFields& fields);
+
+// Records a task's heartbeat (`status`: epoch seconds, or "idle") under `key`. 0; 200 when the
+// update could not be built; -1 as S2SServerUpdateTask.
+int RecordTaskStatus(const std::string& key, const std::string& status);
 
 }  // namespace PairingStore
 }  // namespace S2S

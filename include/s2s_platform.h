@@ -188,6 +188,16 @@ S2S_EXPORT int VLIBCFileRemoveSection(const char* file, const char* section);
 S2S_EXPORT int VLIBCFileEnumSection(const char* file, VLIBSzList** list);
 /* 1 when `path` exists and is a regular file (symbolic links followed), else 0. */
 S2S_EXPORT int VLIBCFileExist(const char* path);
+/* Reads `file` once and calls `visit` for each section whose name starts with `prefix` (every
+ * section when `prefix` is null or empty), in file order (a name repeated by hand once per
+ * header), with the section's `count` pairs as by VLIBCFileGetSection: a caller deciding over
+ * many sections sees them all from one version of the file. `visit` returns 0 to go on; any other
+ * value ends the walk and is returned. 0 after the last section, negative on failure (missing
+ * file: VLIB_ERR_FILE_NOT_FOUND). */
+typedef int (*VLIBSectionVisitor)(void* arg, const char* section, int count,
+                                  const char* const* keys, const char* const* values);
+S2S_EXPORT int VLIBCFileVisitSections(const char* file, const char* prefix,
+                                      VLIBSectionVisitor visit, void* arg);
 
 /* ---------------------------------------------------------------------------------------------
  * Cross-process semaphores (System V, one binary semaphore per integer key, created on first
