@@ -13,7 +13,8 @@
 #include <utility>
 #include <vector>
 
-#include "rsync/command_reply.h"
+#include "core/protocol.h"
+#include "host/pairing_store.h"
 #include "receiver/internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
@@ -27,14 +28,34 @@ namespace {
 constexpr size_t kMaxKey = 64;
 constexpr size_t kMaxClientID = 35;  // the pairing store reads client IDs into 36 bytes
 constexpr size_t kMaxServerName = 255;
-constexpr const char* kMultiMarker = "S2SMULTI-SRC-SUPPORT";
 // What clients may create in the store: client sections, and task sections per client. With the
 // longest names a client can send, these bounds keep the store well below the size its reader
 // takes (every write is also refused when it would pass that size).
 constexpr int kMaxClients = 256;
 constexpr int kMaxTasksPerClient = 64;
 
+// The answers are the exchange's own numbers.
+static_assert(protocol::Is(kReceiverOK, protocol::kOK), "");
+static_assert(protocol::Is(kReceiverUnknownCommand, protocol::kUnknownCommand), "");
+static_assert(protocol::Is(kReceiverMissingKey, protocol::kMissingKey), "");
+static_assert(protocol::Is(kReceiverUnknownKey, protocol::kUnknownKey), "");
+static_assert(protocol::Is(kReceiverMalformed, protocol::kMalformed), "");
+static_assert(protocol::Is(kReceiverBadName, protocol::kBadName), "");
+static_assert(protocol::Is(kReceiverStoreWrite, protocol::kStoreWrite), "");
+static_assert(protocol::Is(kReceiverStoreRead, protocol::kStoreRead), "");
+static_assert(protocol::Is(kReceiverPairedOther, protocol::kPairedOther), "");
+static_assert(protocol::Is(kReceiverNotPaired, protocol::kNotPaired), "");
+static_assert(protocol::Is(kReceiverNoShare, protocol::kNoShare), "");
+static_assert(protocol::Is(kReceiverAttrMismatch, protocol::kAttrMismatch), "");
+static_assert(protocol::Is(kReceiverBadFinishType, protocol::kBadFinishType), "");
+static_assert(protocol::Is(kReceiverShareConflict, protocol::kShareConflict), "");
+static_assert(protocol::Is(kReceiverInternal, protocol::kInternal), "");
+static_assert(protocol::Is(kReceiverStoreFull, protocol::kStoreFull), "");
+
 typedef std::map<std::string, std::string> Pairs;
+using PairingStore::kMultiClientMarker;
+using PairingStore::ShareFields;
+using PairingStore::StoreContents;
 
 struct HashDeleter {
     void operator()(VLIBSzHash* h) const { VLIBCSzHashFree(h); }
@@ -66,10 +87,10 @@ bool ValidKey(const std::string& key) {
     return true;
 }
 
-// The multi-client marker stands in the store's "clientID" for "many clients": as a client's
+// The multi-client marker stands in the store's client ID for "many clients": as a client's
 // own ID it would count as paired without pairing and bind shares to nobody.
 bool ReservedClientID(const std::string& id) {
-    return strcasecmp(id.c_str(), kMultiMarker) == 0;
+    return strcasecmp(id.c_str(), kMultiClientMarker) == 0;
 }
 
 bool ValidClientID(const std::string& id) {
@@ -90,15 +111,15 @@ bool ValidServerName(const std::string& name) {
 }
 
 bool YesNo(const std::string& v, bool* out) {
-    if (v == "yes" || v == "no") {
-        *out = v == "yes";
+    if (v == protocol::kYes || v == protocol::kNo) {
+        *out = v == protocol::kYes;
         return true;
     }
     return false;
 }
 
 bool ZeroOne(const std::string& v) {
-    return v == "0" || v == "1";
+    return v == protocol::kZero || v == protocol::kOne;
 }
 
 bool Decimal(const std::string& v) {
@@ -130,76 +151,44 @@ bool Set(Hash& h, const char* key, const std::string& value) {
 
 // The answer to a failed store write: the store is full (nothing was written), or it failed.
 int StoreWriteFailure() {
-    return VLIBCErrGet() == VLIB_ERR_TOO_LARGE ? kReceiverStoreFull : kReceiverStoreWrite;
+    return VLIBCErrGet() == VLIB_ERR_TOO_LARGE ? protocol::kStoreFull : protocol::kStoreWrite;
 }
 
-// Whether the store may take one more section starting with `prefix` when it does not hold
-// `section` yet: fewer than `limit` such sections. 0 (yes), 216 (no) or 206.
-int RoomFor(const std::string& section, const std::string& prefix, int limit) {
-    List names(VLIBCSzListAlloc(64));
-    if (!names) {
-        return kReceiverInternal;
+// The store as it is now, for one decision. False when it cannot be read; `*missing` tells
+// whether that is because it has no file at all.
+bool LoadStore(StoreContents* store, bool* missing = nullptr) {
+    if (PairingStore::ReadStore(store) == 0) {
+        return true;
     }
-    VLIBSzList* raw = names.release();
-    S2SCheckServerInfo();
-    int count = VLIBCFileEnumSection(S2SPath(S2S_PATH_PAIRING_STORE), &raw);
-    names.reset(raw);
-    if (count < 0) {
-        return VLIBCErrGet() == VLIB_ERR_FILE_NOT_FOUND ? kReceiverOK : kReceiverStoreRead;
+    if (missing != nullptr) {
+        *missing = VLIBCErrGet() == VLIB_ERR_FILE_NOT_FOUND;
     }
-    int same = 0;
-    for (int i = 0; i < VLIBCSzListCount(names.get()); ++i) {
-        const std::string name = VLIBCSzListGet(names.get(), i);
-        if (name == section) {
-            return kReceiverOK;
-        }
-        same += name.compare(0, prefix.size(), prefix) == 0;
-    }
-    if (same >= limit) {
-        Logger::LogMsg(Logger::Warning,
-                       "[WARNING] receiver_commands.cpp(%d): the pairing store holds %d sections "
-                       "'%s...' already (at most %d)\n",
-                       __LINE__, same, prefix.c_str(), limit);
-        return kReceiverStoreFull;
-    }
-    return kReceiverOK;
+    return false;
 }
 
-// The client recorded in "PairedClientInfo" by the single-client scheme ("" when none, the
-// marker when the store is multi-client). False when the store cannot be read.
-bool SingleClient(std::string* id) {
-    Hash h = NewHash();
-    if (!h) {
-        return false;
+// Whether the store may take one more record: it holds `existing` already, or fewer than `limit`
+// of its kind (`count`, `kind` names them in the warning). 0 (yes) or 216 (no).
+int RoomFor(bool existing, int count, const std::string& kind, int limit) {
+    if (existing || count < limit) {
+        return protocol::kOK;
     }
-    VLIBSzHash* raw = h.release();
-    int rc = S2SGetServerInfo("PairedClientInfo", &raw);
-    h.reset(raw);
-    if (rc < 0) {
-        return false;
-    }
-    const char* v = VLIBCSzHashGetValue(h.get(), "clientID");
-    *id = v != nullptr ? v : "";
-    return true;
+    Logger::LogMsg(Logger::Warning,
+                   "[WARNING] receiver_commands.cpp(%d): the pairing store holds %d sections "
+                   "'%s...' already (at most %d)\n",
+                   __LINE__, count, kind.c_str(), limit);
+    return protocol::kStoreFull;
 }
 
 // Whether `id` paired with this server, in either scheme. -1 when the store cannot be read.
 int ClientPaired(const std::string& id) {
-    std::string single;
-    if (!SingleClient(&single)) {
+    StoreContents store;
+    if (!LoadStore(&store)) {
         return -1;
     }
-    if (single == id && !ReservedClientID(id)) {
+    if (store.pairedClientID == id && !ReservedClientID(id)) {
         return 1;
     }
-    Hash h = NewHash();
-    if (!h) {
-        return -1;
-    }
-    VLIBSzHash* raw = h.release();
-    int rc = S2SGetServerInfo(("CLIENTID_" + id).c_str(), &raw);
-    h.reset(raw);
-    return rc < 0 ? -1 : (rc > 0 ? 1 : 0);
+    return store.FindClient(id) != nullptr ? 1 : 0;
 }
 
 // Binding checks through the store: 0, 214 (refused shares in `*refused`), 201 or 206.
@@ -208,14 +197,14 @@ int CheckShares(const std::vector<std::string>& shares, const std::string& clien
     List in(VLIBCSzListAlloc(static_cast<int>(shares.size()) + 1));
     List out(VLIBCSzListAlloc(8));
     if (!in || !out) {
-        return kReceiverInternal;
+        return protocol::kInternal;
     }
     for (const auto& s : shares) {
         VLIBSzList* raw = in.release();
         int rc = VLIBCSzListPush(&raw, s.c_str());
         in.reset(raw);
         if (rc < 0) {
-            return kReceiverInternal;
+            return protocol::kInternal;
         }
     }
     VLIBSzList* rawOut = out.release();
@@ -230,77 +219,63 @@ int CheckShares(const std::vector<std::string>& shares, const std::string& clien
     return rc;
 }
 
-// True when `section` of the store already holds every pair of `kv`. Every store write is a
-// synced rewrite of the file, so a write that would change nothing is skipped: a resync sends the
-// same pairing, start and finish each time. False (write) when the store cannot be read.
-bool StoreHolds(const std::string& section,
-                const std::vector<std::pair<const char*, std::string>>& kv) {
-    Hash h = NewHash();
-    if (!h) {
-        return false;
-    }
-    VLIBSzHash* raw = h.release();
-    int rc = S2SGetServerInfo(section.c_str(), &raw);
-    h.reset(raw);
-    if (rc <= 0) {
-        return false;
-    }
-    for (const auto& p : kv) {
-        const char* v = VLIBCSzHashGetValue(h.get(), p.first);
-        if (v == nullptr || p.second != v) {
-            return false;
+// Sets the share's fields. Every store write is a synced rewrite of the file, so a write that
+// would change nothing is skipped: a resync sends the same pairing, start and finish each time.
+// A store that cannot be read is written.
+int UpdateShare(const std::string& share, const ShareFields& fields) {
+    StoreContents store;
+    if (LoadStore(&store)) {
+        const PairingStore::StoreShare* held = store.FindShare(share);
+        if (held != nullptr && held->fields.Holds(fields)) {
+            return protocol::kOK;
         }
     }
-    return true;
+    int rc = PairingStore::UpdateShareRecord(share, fields);
+    if (rc == S2S_SVR_ERR_ALLOC) {
+        return protocol::kInternal;
+    }
+    return rc == 0 ? protocol::kOK : StoreWriteFailure();
 }
 
-int UpdateShare(const std::string& share,
-                const std::vector<std::pair<const char*, std::string>>& kv) {
-    if (StoreHolds("SHARE_" + share, kv)) {
-        return kReceiverOK;
-    }
-    Hash h = NewHash();
-    if (!h) {
-        return kReceiverInternal;
-    }
-    for (const auto& p : kv) {
-        if (!Set(h, p.first, p.second)) {
-            return kReceiverInternal;
-        }
-    }
-    return S2SServerUpdateShare(share.c_str(), h.get()) == 0 ? kReceiverOK : StoreWriteFailure();
-}
-
-// The share's "CompleteID" as stored, "" when absent. Binding writes it back with "RunningID":
-// the store reads a share without that key as free, whatever "RunningID" says.
+// The share's completed ID as stored, "" when absent. Binding writes it back with the running
+// ID: the store reads a share without a completed ID as free, whatever its running ID says.
 std::string CompleteID(const std::string& share) {
-    char buf[kMaxClientID + 1];
-    if (S2SServerGetShare(share.c_str(), "CompleteID", buf, sizeof buf) < 0) {
-        return std::string();
-    }
-    return buf;
+    StoreContents store;
+    const PairingStore::StoreShare* held = LoadStore(&store) ? store.FindShare(share) : nullptr;
+    // The store's readers take IDs of at most kMaxClientID bytes; a longer one reads as none.
+    return held != nullptr && held->fields.completeID &&
+                   held->fields.completeID->size() <= kMaxClientID
+               ? *held->fields.completeID
+               : std::string();
 }
 
 // Records `clientID` in the multi-client scheme, moving an older single client first.
 int RecordMultiClient(const std::string& clientID, const std::string& serverName) {
     int old = S2SServerIfOldClientPaired();
     if (old < 0) {
-        return kReceiverStoreRead;
+        return protocol::kStoreRead;
     }
-    if (old == 0 && StoreHolds("CLIENTID_" + clientID, {{"ServerName", serverName}}) &&
-        StoreHolds("PairedClientInfo",
-                   {{"clientID", kMultiMarker}, {"serverName", kMultiMarker}})) {
-        return kReceiverOK;
+    StoreContents store;
+    bool missing = false;
+    if (!LoadStore(&store, &missing) && !missing) {
+        return protocol::kStoreRead;
     }
-    int room = RoomFor("CLIENTID_" + clientID, "CLIENTID_", kMaxClients);
-    if (room != kReceiverOK) {
+    const PairingStore::StoreClient* known = store.FindClient(clientID);
+    if (old == 0 && known != nullptr && known->serverName == serverName &&
+        store.pairedClientID == kMultiClientMarker &&
+        store.pairedServerName == kMultiClientMarker) {
+        return protocol::kOK;
+    }
+    int room = RoomFor(known != nullptr, static_cast<int>(store.clients.size()),
+                       PairingStore::kClientSectionPrefix, kMaxClients);
+    if (room != protocol::kOK) {
         return room;
     }
     if (old == 1 && s2s_svr_reset_pair() != 0) {
         return StoreWriteFailure();
     }
     int rc = S2SServerUpdatePairInfo(clientID.c_str(), serverName.c_str());
-    return rc == 0 ? kReceiverOK : StoreWriteFailure();
+    return rc == 0 ? protocol::kOK : StoreWriteFailure();
 }
 
 // Brings the daemon's share modules up to date with the share registry: a share registered
@@ -326,20 +301,20 @@ class Command {
     // required + optional. 0, 201 or 202.
     int Keys(const std::set<std::string>& required, const std::set<std::string>& optional) const {
         for (const auto& p : pairs_) {
-            if (p.first == "command" || p.first == "clientID") {
+            if (p.first == protocol::kKeyCommand || p.first == protocol::kKeyClientID) {
                 continue;
             }
             if (required.count(p.first) == 0 && optional.count(p.first) == 0) {
-                return kReceiverUnknownKey;
+                return protocol::kUnknownKey;
             }
         }
         for (const auto& k : required) {
             auto it = pairs_.find(k);
             if (it == pairs_.end() || it->second.empty()) {
-                return kReceiverMissingKey;
+                return protocol::kMissingKey;
             }
         }
-        return kReceiverOK;
+        return protocol::kOK;
     }
     const std::string& Get(const std::string& key) const {
         static const std::string kEmpty;
@@ -347,7 +322,7 @@ class Command {
         return it == pairs_.end() ? kEmpty : it->second;
     }
     bool Has(const std::string& key) const { return pairs_.count(key) != 0; }
-    const std::string& Client() const { return Get("clientID"); }
+    const std::string& Client() const { return Get(protocol::kKeyClientID); }
     bool OldServer() const { return oldServer_; }
 
   private:
@@ -357,69 +332,78 @@ class Command {
 
 int GetProtocolVer(const Command& c, ReceiverAnswer* a) {
     if (c.OldServer()) {
-        return kReceiverUnknownCommand;
+        return protocol::kUnknownCommand;
     }
-    int rc = c.Keys({"outfile"}, {});
+    int rc = c.Keys({protocol::kKeyOutfile}, {});
     if (rc != 0) {
         return rc;
     }
     a->hasOutput = true;
     a->output = std::to_string(S2S_RECEIVER_PROTOCOL_VERSION) + "\n";
-    return kReceiverOK;
+    return protocol::kOK;
 }
 
 int Pairing(const Command& c) {
-    int rc = c.Keys({"dryRun", "serverName"}, {});
+    int rc = c.Keys({protocol::kKeyDryRun, protocol::kKeyServerName}, {});
     if (rc != 0) {
         return rc;
     }
     bool dryRun = false;
-    if (!YesNo(c.Get("dryRun"), &dryRun) || !ValidServerName(c.Get("serverName"))) {
-        return kReceiverMalformed;
+    const std::string& serverName = c.Get(protocol::kKeyServerName);
+    if (!YesNo(c.Get(protocol::kKeyDryRun), &dryRun) || !ValidServerName(serverName)) {
+        return protocol::kMalformed;
     }
-    std::string single;
-    if (!SingleClient(&single)) {
-        return kReceiverStoreRead;
+    StoreContents store;
+    if (!LoadStore(&store)) {
+        return protocol::kStoreRead;
     }
-    bool multi = single == kMultiMarker;
+    // The client recorded by the single-client scheme ("" when none, the marker when the store
+    // is multi-client).
+    const std::string& single = store.pairedClientID;
+    bool multi = single == kMultiClientMarker;
     if (!multi && !single.empty() && single != c.Client()) {
-        return kReceiverPairedOther;
+        return protocol::kPairedOther;
     }
     RefreshModules();
     if (dryRun) {
-        return kReceiverOK;
+        return protocol::kOK;
     }
     if (multi || !c.OldServer()) {
-        return RecordMultiClient(c.Client(), c.Get("serverName"));
+        return RecordMultiClient(c.Client(), serverName);
     }
+    // The pairing section's own keys, as the store's single-client setter takes them.
     Hash h = NewHash();
-    if (!h || !Set(h, "clientID", c.Client()) || !Set(h, "serverName", c.Get("serverName"))) {
-        return kReceiverInternal;
+    if (!h || !Set(h, protocol::kKeyClientID, c.Client()) ||
+        !Set(h, protocol::kKeyServerName, serverName)) {
+        return protocol::kInternal;
     }
     rc = S2SServerSetPairValue(h.get());
-    return rc == 0 ? kReceiverOK : StoreWriteFailure();
+    return rc == 0 ? protocol::kOK : StoreWriteFailure();
 }
 
 int PairingMultiSrc(const Command& c, ReceiverAnswer* a) {
     if (c.OldServer()) {
-        return kReceiverUnknownCommand;
+        return protocol::kUnknownCommand;
     }
-    int rc = c.Keys({"serverName", "syncShares", "dryRun", "outfile"}, {});
+    int rc = c.Keys({protocol::kKeyServerName, protocol::kKeySyncShares, protocol::kKeyDryRun,
+                     protocol::kKeyOutfile},
+                    {});
     if (rc != 0) {
         return rc;
     }
     bool dryRun = false;
-    if (!YesNo(c.Get("dryRun"), &dryRun) || !ValidServerName(c.Get("serverName"))) {
-        return kReceiverMalformed;
+    const std::string& serverName = c.Get(protocol::kKeyServerName);
+    if (!YesNo(c.Get(protocol::kKeyDryRun), &dryRun) || !ValidServerName(serverName)) {
+        return protocol::kMalformed;
     }
     std::vector<std::string> shares;
-    const std::string& joined = c.Get("syncShares");
+    const std::string& joined = c.Get(protocol::kKeySyncShares);
     size_t start = 0;
     for (;;) {
-        size_t end = joined.find(':', start);
+        size_t end = joined.find(protocol::kShareSeparator, start);
         std::string name = joined.substr(start, end == std::string::npos ? end : end - start);
-        if (!receiver_internal::ValidShareName(name)) {
-            return kReceiverBadName;
+        if (!protocol::ShareNameSyncable(name)) {
+            return protocol::kBadName;
         }
         shares.push_back(name);
         if (end == std::string::npos) {
@@ -429,51 +413,52 @@ int PairingMultiSrc(const Command& c, ReceiverAnswer* a) {
     }
     std::vector<std::string> refused;
     rc = CheckShares(shares, c.Client(), &refused);
-    if (rc != kReceiverOK && rc != kReceiverShareConflict) {
-        return rc == S2S_SVR_ERR_READ ? kReceiverStoreRead : kReceiverInternal;
+    if (rc != protocol::kOK && rc != protocol::kShareConflict) {
+        return rc == protocol::kStoreRead ? protocol::kStoreRead : protocol::kInternal;
     }
     RefreshModules();
     a->hasOutput = true;
     for (size_t i = 0; i < refused.size(); ++i) {
-        a->output += (i == 0 ? "" : ":") + refused[i];
+        a->output += (i == 0 ? "" : std::string(1, protocol::kShareSeparator)) + refused[i];
     }
     a->output += "\n";
     if (!dryRun) {
-        int recorded = RecordMultiClient(c.Client(), c.Get("serverName"));
-        if (recorded != kReceiverOK) {
+        int recorded = RecordMultiClient(c.Client(), serverName);
+        if (recorded != protocol::kOK) {
             return recorded;
         }
     }
     return rc;
 }
 
-const std::set<std::string> kAttributeKeys = {"isEncrypt", "isAutomount", "isEnableACL",
-                                              "isWinShare", "lenEncKey"};
+const std::set<std::string> kAttributeKeys = {protocol::kKeyIsEncrypt, protocol::kKeyIsAutomount,
+                                              protocol::kKeyIsEnableACL, protocol::kKeyIsWinShare,
+                                              protocol::kKeyLenEncKey};
 
 // The share must exist here, the client must have paired, and no other client may hold it.
 int ShareForClient(const Command& c, const std::string& share, bool* encrypted) {
-    if (!receiver_internal::ValidShareName(share)) {
-        return kReceiverBadName;
+    if (!protocol::ShareNameSyncable(share)) {
+        return protocol::kBadName;
     }
     int known = receiver_internal::ShareEncrypted(share, encrypted);
     if (known < 0) {
-        return kReceiverInternal;
+        return protocol::kInternal;
     }
     if (known == 0) {
-        return kReceiverNoShare;
+        return protocol::kNoShare;
     }
     int paired = ClientPaired(c.Client());
     if (paired < 0) {
-        return kReceiverStoreRead;
+        return protocol::kStoreRead;
     }
     if (paired == 0) {
-        return kReceiverNotPaired;
+        return protocol::kNotPaired;
     }
     int rc = CheckShares({share}, c.Client(), nullptr);
-    if (rc == S2S_SVR_ERR_READ) {
-        return kReceiverStoreRead;
+    if (rc == protocol::kStoreRead) {
+        return protocol::kStoreRead;
     }
-    return rc == 0 || rc == kReceiverShareConflict ? rc : kReceiverInternal;
+    return rc == 0 || rc == protocol::kShareConflict ? rc : protocol::kInternal;
 }
 
 int SyncStart(const Command& c) {
@@ -482,105 +467,110 @@ int SyncStart(const Command& c) {
         withAttributes = withAttributes || c.Has(k);
     }
     if (withAttributes && c.OldServer()) {
-        return kReceiverUnknownKey;
+        return protocol::kUnknownKey;
     }
-    int rc = withAttributes ? c.Keys({"volumeName", "shareName", "isEncrypt", "isAutomount",
-                                      "isEnableACL", "isWinShare", "lenEncKey"},
-                                     {})
-                            : c.Keys({"volumeName", "shareName"}, {});
+    std::set<std::string> required = {protocol::kKeyVolumeName, protocol::kKeyShareName};
+    if (withAttributes) {
+        required.insert(kAttributeKeys.begin(), kAttributeKeys.end());
+    }
+    int rc = c.Keys(required, {});
     if (rc != 0) {
         return rc;
     }
-    if (!ValidServerName(c.Get("volumeName"))) {
-        return kReceiverMalformed;
+    if (!ValidServerName(c.Get(protocol::kKeyVolumeName))) {
+        return protocol::kMalformed;
     }
-    if (withAttributes && !(ZeroOne(c.Get("isEncrypt")) && ZeroOne(c.Get("isAutomount")) &&
-                            ZeroOne(c.Get("isEnableACL")) && ZeroOne(c.Get("isWinShare")) &&
-                            Decimal(c.Get("lenEncKey")))) {
-        return kReceiverMalformed;
+    if (withAttributes &&
+        !(ZeroOne(c.Get(protocol::kKeyIsEncrypt)) && ZeroOne(c.Get(protocol::kKeyIsAutomount)) &&
+          ZeroOne(c.Get(protocol::kKeyIsEnableACL)) && ZeroOne(c.Get(protocol::kKeyIsWinShare)) &&
+          Decimal(c.Get(protocol::kKeyLenEncKey)))) {
+        return protocol::kMalformed;
     }
-    const std::string& share = c.Get("shareName");
+    const std::string& share = c.Get(protocol::kKeyShareName);
     bool encrypted = false;
     rc = ShareForClient(c, share, &encrypted);
-    if (rc != kReceiverOK) {
+    if (rc != protocol::kOK) {
         return rc;
     }
-    if (withAttributes && encrypted != (c.Get("isEncrypt") == "1")) {
-        return kReceiverAttrMismatch;
+    if (withAttributes && encrypted != (c.Get(protocol::kKeyIsEncrypt) == protocol::kOne)) {
+        return protocol::kAttrMismatch;
     }
     RefreshModules();
-    return UpdateShare(
-        share,
-        {{"RunningID", c.Client()}, {"CompleteID", CompleteID(share)}, {"LastStart", Now()}});
+    ShareFields bound;
+    bound.runningID = c.Client();
+    bound.completeID = CompleteID(share);
+    bound.lastStart = Now();
+    return UpdateShare(share, bound);
 }
 
 int SyncFinish(const Command& c) {
-    int rc = c.Keys({"finishType", "name"}, {});
+    int rc = c.Keys({protocol::kKeyFinishType, protocol::kKeyName}, {});
     if (rc != 0) {
         return rc;
     }
-    const std::string& type = c.Get("finishType");
-    if (type != "complete" && type != "abort" && type != "unpair") {
-        return kReceiverBadFinishType;
+    const std::string& type = c.Get(protocol::kKeyFinishType);
+    if (type != protocol::kFinishComplete && type != protocol::kFinishAbort &&
+        type != protocol::kFinishUnpair) {
+        return protocol::kBadFinishType;
     }
     bool encrypted = false;
-    const std::string& share = c.Get("name");
+    const std::string& share = c.Get(protocol::kKeyName);
     rc = ShareForClient(c, share, &encrypted);
-    if (rc != kReceiverOK) {
+    if (rc != protocol::kOK) {
         return rc;
     }
     // Every finish records what became of the client's sync and when, for the status.
-    const std::string now = Now();
-    if (type == "complete") {
-        return UpdateShare(share, {{"RunningID", c.Client()},
-                                   {"CompleteID", c.Client()},
-                                   {"LastResult", type},
-                                   {"LastTime", now}});
+    ShareFields finished;
+    finished.lastResult = type;
+    finished.lastTime = Now();
+    if (type == protocol::kFinishComplete) {
+        finished.runningID = c.Client();
+        finished.completeID = c.Client();
+    } else if (type == protocol::kFinishUnpair) {
+        finished.runningID = "";
+        finished.completeID = "";
+    } else {
+        finished.runningID = c.Client();
+        finished.completeID = CompleteID(share);
     }
-    if (type == "unpair") {
-        return UpdateShare(
-            share,
-            {{"RunningID", ""}, {"CompleteID", ""}, {"LastResult", type}, {"LastTime", now}});
-    }
-    return UpdateShare(share, {{"RunningID", c.Client()},
-                               {"CompleteID", CompleteID(share)},
-                               {"LastResult", type},
-                               {"LastTime", now}});
+    return UpdateShare(share, finished);
 }
 
 int UpdateTaskStatus(const Command& c) {
-    int rc = c.Keys({"taskName"}, {});
+    int rc = c.Keys({protocol::kKeyTaskName}, {});
     if (rc != 0) {
         return rc;
     }
-    const std::string& task = c.Get("taskName");
+    const std::string& task = c.Get(protocol::kKeyTaskName);
     if (!ReceiverTaskNameValid(task)) {
-        return kReceiverBadName;
+        return protocol::kBadName;
     }
     int paired = ClientPaired(c.Client());
     if (paired <= 0) {
-        return paired < 0 ? kReceiverStoreRead : kReceiverNotPaired;
+        return paired < 0 ? protocol::kStoreRead : protocol::kNotPaired;
     }
     // Tasks of different clients may share a name: the client ID keeps their heartbeats apart.
     std::string key = c.Client() + "/" + task;
-    int room = RoomFor("TASK_" + key, "TASK_" + c.Client() + "/", kMaxTasksPerClient);
-    if (room != kReceiverOK) {
+    StoreContents store;
+    bool missing = false;
+    if (!LoadStore(&store, &missing) && !missing) {
+        return protocol::kStoreRead;
+    }
+    int room = RoomFor(store.FindTask(key) != nullptr, store.CountTasks(c.Client() + "/"),
+                       PairingStore::kTaskSectionPrefix + c.Client() + "/", kMaxTasksPerClient);
+    if (room != protocol::kOK) {
         return room;
     }
-    Hash h = NewHash();
-    if (!h || !Set(h, "status", Now())) {
-        return kReceiverInternal;
+    rc = PairingStore::RecordTaskStatus(key, Now());
+    if (rc == S2S_SVR_ERR_ALLOC) {
+        return protocol::kInternal;
     }
-    return S2SServerUpdateTask(key.c_str(), h.get()) == 0 ? kReceiverOK : StoreWriteFailure();
+    return rc == 0 ? protocol::kOK : StoreWriteFailure();
 }
 
 }  // namespace
 
 namespace receiver_internal {
-
-bool ValidShareName(const std::string& name) {
-    return VURNShareNameIsSyncable(name.c_str()) == 1;
-}
 
 int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs) {
     token->clear();
@@ -598,40 +588,35 @@ int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs)
         start = end + 1;
     }
     // The token comes first so that even a malformed command gets its answer.
-    const std::string prefix = "token=\"";
-    if (!lines.empty() && lines[0].size() == prefix.size() + 2 * command_reply::kTokenBytes + 1 &&
-        lines[0].compare(0, prefix.size(), prefix) == 0 && lines[0].back() == '"') {
-        std::string t = lines[0].substr(prefix.size(), 2 * command_reply::kTokenBytes);
-        if (command_reply::ValidToken(t)) {
-            *token = t;
-        }
+    if (!lines.empty()) {
+        *token = protocol::TokenOfLine(lines[0]);
     }
-    if (token->empty() || unterminated || input.size() > command_reply::kMaxCommandFile) {
-        return kReceiverMalformed;
+    if (token->empty() || unterminated || input.size() > protocol::kMaxCommandFile) {
+        return protocol::kMalformed;
     }
     std::vector<std::pair<std::string, std::string>> ordered;
     for (const auto& line : lines) {
         size_t eq = line.find("=\"");
         if (eq == std::string::npos || line.size() < eq + 3 || line.back() != '"' ||
             !ValidKey(line.substr(0, eq))) {
-            return kReceiverMalformed;
+            return protocol::kMalformed;
         }
         ordered.push_back(
             std::make_pair(line.substr(0, eq), line.substr(eq + 2, line.size() - eq - 3)));
     }
     if (token->empty()) {
-        return kReceiverMalformed;
+        return protocol::kMalformed;
     }
-    if (ordered.size() < 3 || ordered[0].first != "token" || ordered[1].first != "command" ||
-        ordered[2].first != "clientID") {
-        return kReceiverMalformed;
+    if (ordered.size() < 3 || ordered[0].first != protocol::kKeyToken ||
+        ordered[1].first != protocol::kKeyCommand || ordered[2].first != protocol::kKeyClientID) {
+        return protocol::kMalformed;
     }
     for (size_t i = 1; i < ordered.size(); ++i) {
         if (!pairs->insert(ordered[i]).second) {
-            return kReceiverMalformed;  // a key given twice
+            return protocol::kMalformed;  // a key given twice
         }
     }
-    return kReceiverOK;
+    return protocol::kOK;
 }
 
 }  // namespace receiver_internal
@@ -642,7 +627,7 @@ const char kReceiverTaskNameRule[] =
     "trailing blank";
 
 bool ReceiverTaskNameValid(const std::string& name) {
-    return !name.empty() && name.size() <= VURN_SHARE_NAME_MAX && !HasControl(name) &&
+    return !name.empty() && name.size() <= protocol::kShareNameMax && !HasControl(name) &&
            name.find_first_of("/\"'`[]\\") == std::string::npos &&
            name.find("..") == std::string::npos && name.front() != ' ' && name.front() != '@' &&
            name.back() != ' ';
@@ -652,43 +637,44 @@ ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer) {
     ReceiverAnswer answer;
     Pairs pairs;
     int rc = receiver_internal::ParseCommandFile(input, &answer.token, &pairs);
-    if (rc == kReceiverOK) {
-        const std::string& name = pairs["command"];
-        const std::string& client = pairs["clientID"];
+    if (rc == protocol::kOK) {
+        const std::string& name = pairs[protocol::kKeyCommand];
+        const std::string& client = pairs[protocol::kKeyClientID];
         Command c(pairs, oldServer);
         if (!ValidClientID(client)) {
-            rc = kReceiverMalformed;
+            rc = protocol::kMalformed;
         } else {
             // Control characters are never part of a value; share and task names are refused
             // with their own code.
             for (const auto& p : pairs) {
-                bool nameKey = p.first == "shareName" || p.first == "syncShares" ||
-                               p.first == "name" || p.first == "taskName";
+                bool nameKey = p.first == protocol::kKeyShareName ||
+                               p.first == protocol::kKeySyncShares ||
+                               p.first == protocol::kKeyName || p.first == protocol::kKeyTaskName;
                 if (HasControl(p.second)) {
-                    rc = nameKey ? kReceiverBadName : kReceiverMalformed;
+                    rc = nameKey ? protocol::kBadName : protocol::kMalformed;
                 }
             }
         }
-        if (rc == kReceiverOK) {
-            if (name == "S2S_GetProtocolVer") {
+        if (rc == protocol::kOK) {
+            if (name == protocol::kGetProtocolVer) {
                 rc = GetProtocolVer(c, &answer);
-            } else if (name == "S2S_Pairing") {
+            } else if (name == protocol::kPairing) {
                 rc = Pairing(c);
-            } else if (name == "S2S_PairingMultiSrc") {
+            } else if (name == protocol::kPairingMultiSrc) {
                 rc = PairingMultiSrc(c, &answer);
-            } else if (name == "S2S_SyncStart") {
+            } else if (name == protocol::kSyncStart) {
                 rc = SyncStart(c);
-            } else if (name == "S2S_SyncFinish") {
+            } else if (name == protocol::kSyncFinish) {
                 rc = SyncFinish(c);
-            } else if (name == "S2S_UpdateTaskStatus") {
+            } else if (name == protocol::kUpdateTaskStatus) {
                 rc = UpdateTaskStatus(c);
             } else {
-                rc = kReceiverUnknownCommand;
+                rc = protocol::kUnknownCommand;
             }
         }
         const char* shownName = HasControl(name) || name.size() > kMaxKey ? "?" : name.c_str();
         const char* shownClient = ValidClientID(client) ? client.c_str() : "?";
-        if (rc == kReceiverOK) {
+        if (rc == protocol::kOK) {
             Logger::LogMsg(Logger::Info, "[INFO] receiver_commands.cpp(%d): %s from client %s\n",
                            __LINE__, shownName, shownClient);
         } else {
@@ -698,7 +684,7 @@ ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer) {
         }
     }
     answer.result = rc;
-    if (rc != kReceiverOK && rc != kReceiverShareConflict) {
+    if (rc != protocol::kOK && rc != protocol::kShareConflict) {
         answer.hasOutput = false;
         answer.output.clear();
     }

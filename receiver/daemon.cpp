@@ -29,13 +29,16 @@
 #include <iterator>
 #include <map>
 #include <memory>
+#include <optional>
 #include <set>
 #include <sstream>
 #include <thread>
 #include <vector>
 
-#include "rsync/child_process.h"
+#include "core/protocol.h"
+#include "host/pairing_store.h"
 #include "receiver/internal.h"
+#include "rsync/child_process.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_receiver.h"
@@ -520,8 +523,10 @@ int ShareModules(std::string* text, std::vector<std::string>* notes, std::string
         }
         std::unique_ptr<VURNShare, ShareDeleter> share(raw);
         std::string path = share->path;
-        if (!receiver_internal::ValidShareName(name) || !ConfSafe(name) || path.empty() ||
-            path[0] != '/' || !ConfSafe(path)) {
+        // A syncable name is also a literal value of the configuration (no quote, '%', control
+        // character or outer blank), so only the path needs that check of its own.
+        if (!protocol::ShareNameSyncable(name) || path.empty() || path[0] != '/' ||
+            !ConfSafe(path)) {
             std::string shown = HasControl(name) ? "?" : name;
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] receiver_daemon.cpp(%d): share '%s' is not served (its name "
@@ -535,11 +540,7 @@ int ShareModules(std::string* text, std::vector<std::string>* notes, std::string
             }
             continue;
         }
-        char key[VURN_SHARE_NAME_MAX + 1];
-        if (VURNShareModuleKey(name.c_str(), key, sizeof key) < 0) {
-            return Fail(error, "cannot derive the module of share " + name);
-        }
-        auto taken = modules.emplace(key, name);
+        auto taken = modules.emplace(protocol::ShareModuleKey(name), name);
         if (!taken.second) {
             return Fail(error, "shares '" + taken.first->second + "' and '" + name +
                                    "' would be served as one module (names may not differ only "
@@ -964,56 +965,41 @@ int ReceiverGetStatus(ReceiverStatus* out) {
         out->storeError = store + " cannot be read (" + VLIBCErrStr(VLIBCErrGet()) + ")";
         return -1;
     }
-    VLIBSzList* rawSections = VLIBCSzListAlloc(64);
-    int count = VLIBCFileEnumSection(store.c_str(), &rawSections);
-    std::unique_ptr<VLIBSzList, ListDeleter> sections(rawSections);
-    if (count < 0) {
+    PairingStore::StoreContents contents;
+    if (PairingStore::ReadStore(&contents) != 0) {
         out->storeError = store + " cannot be read (" + VLIBCErrStr(VLIBCErrGet()) + ")";
         return -1;
     }
-    for (int i = 0; i < VLIBCSzListCount(sections.get()); ++i) {
-        std::string section = VLIBCSzListGet(sections.get(), i);
-        std::unique_ptr<VLIBSzHash, HashDeleter> h(VLIBCSzHashAlloc(8));
-        VLIBSzHash* raw = h.release();
-        int found = VLIBCFileGetSection(store.c_str(), section.c_str(), &raw);
-        h.reset(raw);
-        if (found < 0) {
-            out->storeError = store + " cannot be read (" + VLIBCErrStr(VLIBCErrGet()) + ")";
-            return -1;
-        }
-        auto value = [&](const char* key) {
-            const char* v = VLIBCSzHashGetValue(h.get(), key);
-            return std::string(v != nullptr ? v : "");
-        };
-        auto seconds = [&](const char* key) {
-            std::string v = value(key);
-            return v.empty() || v.size() > 18 ||
-                           v.find_first_not_of("0123456789") != std::string::npos
-                       ? 0L
-                       : std::atol(v.c_str());
-        };
-        if (section.compare(0, 9, "CLIENTID_") == 0) {
-            out->clients.push_back({section.substr(9), value("ServerName")});
-        } else if (section.compare(0, 6, "SHARE_") == 0) {
-            ReceiverShareState share;
-            share.name = section.substr(6);
-            share.completeID = value("CompleteID");
-            share.lastStart = seconds("LastStart");
-            share.lastResult = value("LastResult");
-            share.lastTime = seconds("LastTime");
-            std::string running = value("RunningID");
-            // The pairing store's own reading of the two IDs.
-            if (running.empty()) {
-                share.state = "free";
-            } else if (running == share.completeID) {
-                share.state = "completed";
-                share.owner = running;
-            } else {
+    auto seconds = [](const std::optional<std::string>& v) {
+        return !v || v->empty() || v->size() > 18 ||
+                       v->find_first_not_of("0123456789") != std::string::npos
+                   ? 0L
+                   : std::atol(v->c_str());
+    };
+    for (const PairingStore::StoreClient& client : contents.clients) {
+        out->clients.push_back({client.clientID, client.serverName});
+    }
+    for (const PairingStore::StoreShare& stored : contents.shares) {
+        ReceiverShareState share;
+        share.name = stored.name;
+        share.completeID = stored.fields.completeID.value_or("");
+        share.lastStart = seconds(stored.fields.lastStart);
+        share.lastResult = stored.fields.lastResult.value_or("");
+        share.lastTime = seconds(stored.fields.lastTime);
+        share.owner = stored.owner;
+        switch (stored.binding) {
+            case PairingStore::ShareBinding::kRunning:
                 share.state = "running";
-                share.owner = running;
-            }
-            out->shares.push_back(share);
+                break;
+            case PairingStore::ShareBinding::kCompleted:
+                share.state = "completed";
+                break;
+            default:
+                // A record the store cannot judge binds nobody it could name.
+                share.state = "free";
+                break;
         }
+        out->shares.push_back(share);
     }
     return 0;
 }

@@ -32,7 +32,7 @@
 #include <string>
 #include <vector>
 
-#include "rsync/command_reply.h"
+#include "core/protocol.h"
 #include "receiver/internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
@@ -101,7 +101,7 @@ std::string TokenOf(const std::string& conn) {
     std::ifstream in(Spool() + "/conns/" + conn);
     std::string token;
     std::getline(in, token);
-    return command_reply::ValidToken(token) ? token : std::string();
+    return protocol::ValidToken(token) ? token : std::string();
 }
 
 void RemoveStale(const std::string& dir) {
@@ -118,7 +118,7 @@ void RemoveStale(const std::string& dir) {
         struct stat st;
         std::string path = dir + "/" + name;
         if (lstat(path.c_str(), &st) == 0 && now - st.st_mtime > kStaleSeconds) {
-            command_reply::RemoveTree(path);
+            protocol::RemoveTree(path);
         }
     }
     closedir(d);
@@ -128,7 +128,7 @@ void RemoveStale(const std::string& dir) {
 void RemoveConnection(const std::string& conn) {
     std::string token = TokenOf(conn);
     if (!token.empty()) {
-        command_reply::RemoveTree(Spool() + "/replies/" + token);
+        protocol::RemoveTree(Spool() + "/replies/" + token);
     }
     unlink((Spool() + "/conns/" + conn).c_str());
 }
@@ -142,8 +142,8 @@ void WatchConnection(const std::string& conn, const std::string& token) {
         return;  // a later early hook removes it
     }
     const std::string dir = Spool() + "/replies/" + token;
-    const std::string result = dir + "/" + command_reply::kResultFile;
-    const std::string output = dir + "/" + command_reply::kOutputFile;
+    const std::string result = dir + "/" + protocol::kResultFile;
+    const std::string output = dir + "/" + protocol::kOutputFile;
     const std::string record = Spool() + "/conns/" + conn;
     pid_t pid = fork();
     if (pid == 0) {
@@ -222,7 +222,7 @@ int ReceiverHookEarly(int in_fd, bool oldServer) {
     // the parser, so reading stops a little past it.
     std::string input;
     char buffer[4096];
-    while (input.size() <= command_reply::kMaxCommandFile) {
+    while (input.size() <= protocol::kMaxCommandFile) {
         ssize_t n = read(in_fd, buffer, sizeof buffer);
         if (n < 0 && errno == EINTR) {
             continue;
@@ -251,11 +251,11 @@ int ReceiverHookEarly(int in_fd, bool oldServer) {
     }
     bool ok = chmod(dir.c_str(), 0755) == 0;
     if (answer.hasOutput) {
-        ok = ok && answer.output.size() <= command_reply::kMaxOutput &&
-             WriteNew(dir + "/" + command_reply::kOutputFile, answer.output, 0644);
+        ok = ok && answer.output.size() <= protocol::kMaxOutput &&
+             WriteNew(dir + "/" + protocol::kOutputFile, answer.output, 0644);
     }
-    ok = ok && WriteNew(dir + "/" + command_reply::kResultFile,
-                        std::to_string(answer.result) + "\n", 0644);
+    ok = ok &&
+         WriteNew(dir + "/" + protocol::kResultFile, std::to_string(answer.result) + "\n", 0644);
     // A record left by an ended connection whose pid came round again is replaced.
     const std::string record = spool + "/conns/" + conn;
     if (ok && !TokenOf(conn).empty()) {
@@ -263,7 +263,7 @@ int ReceiverHookEarly(int in_fd, bool oldServer) {
     }
     ok = ok && WriteNew(record, answer.token + "\n" + start + "\n", 0600);
     if (!ok) {
-        command_reply::RemoveTree(dir);
+        protocol::RemoveTree(dir);
         Logger::LogMsg(Logger::Error, "[ERROR] receiver_hooks.cpp(%d): cannot write reply\n",
                        __LINE__);
         return 1;
@@ -296,7 +296,7 @@ int ReceiverHookKey() {
         }
     }
     bool encrypted = false;
-    if (!receiver_internal::ValidShareName(share) ||
+    if (!protocol::ShareNameSyncable(share) ||
         receiver_internal::ShareEncrypted(share, &encrypted) != 1 || !encrypted) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] receiver_hooks.cpp(%d): key transfer to a destination other "

@@ -8,10 +8,6 @@
 namespace S2S {
 namespace receiver_internal {
 
-// A share name a client may use: one the share registry's syncable rule accepts (no quotes,
-// "..", leading '@', run of blanks, or "global"; VURNShareNameIsSyncable).
-bool ValidShareName(const std::string& name);
-
 // Reads a command file: the token line, then command="...", clientID="..." and the command's
 // keys, each key once. The token is set whenever the first line is a valid token line, even when
 // the rest is refused. 0, or 203 (malformed).

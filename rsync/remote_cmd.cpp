@@ -5,6 +5,7 @@
 #include <string>
 #include <vector>
 
+#include "core/protocol.h"
 #include "s2s_host.h"
 #include "s2s_logger.h"
 #include "s2s_rsyncer.h"
@@ -13,9 +14,23 @@ namespace S2S {
 
 namespace {
 
-// Pairing commands speak "yes"/"no"; S2S_SyncStart speaks "1"/"0". Servers expect both forms.
+namespace protocol = S2S::protocol;
+
+// The sender's names for the codes it gives a meaning to are the exchange's own numbers.
+static_assert(protocol::Is(kRsyncResultOK, protocol::kOK), "");
+static_assert(protocol::Is(kRsyncResultNoAddress, protocol::kNoAddress), "");
+static_assert(protocol::Is(kRsyncResultUnknownCmd, protocol::kUnknownCommand), "");
+static_assert(protocol::Is(kRsyncResultNoVersion, protocol::kNoVersion), "");
+static_assert(protocol::Is(kRsyncResultUnknownCmdAlt, protocol::kNoCommandModule), "");
+static_assert(protocol::Is(kRsyncResultRetryPlain, protocol::kUnknownKey), "");
+static_assert(protocol::Is(kRsyncResultDryRunOK, protocol::kPairedOther), "");
+static_assert(protocol::Is(kRsyncResultNotTested, protocol::kNotTested), "");
+static_assert(protocol::Is(kRsyncResultConflict, protocol::kShareConflict), "");
+static_assert(protocol::Is(kRsyncResultLocalFailure, protocol::kLocalFailure), "");
+static_assert(protocol::Is(Rsyncer::RsyncTask::kResultNoCommands, protocol::kNoCommandModule), "");
+
 const char* YesNo(bool on) {
-    return on ? "yes" : "no";
+    return on ? protocol::kYes : protocol::kNo;
 }
 
 // A host name longer than this goes out with its first 35 characters dropped, not truncated:
@@ -59,18 +74,18 @@ int Rsyncer::GenCommandLines(const std::string& command, const ParamList& params
     }
     // Values go in verbatim (no escaping, no trimming): the server parses each line strictly and
     // refuses what it cannot take.
-    lines.push_back("command=\"" + command + "\"");
-    lines.push_back("clientID=\"" + clientID + "\"");
+    lines.push_back(protocol::Line(protocol::kKeyCommand, command));
+    lines.push_back(protocol::Line(protocol::kKeyClientID, clientID));
     for (ParamList::const_iterator it = params.begin(); it != params.end(); ++it) {
-        lines.push_back(it->first + "=\"" + it->second + "\"");
+        lines.push_back(protocol::Line(it->first, it->second));
     }
     return 0;
 }
 
 int Rsyncer::GenServerVersionCmd(const std::string& outfile, std::list<std::string>& lines) {
     ParamList params;
-    params.emplace_back("outfile", outfile);
-    return GenCommandLines("S2S_GetProtocolVer", params, lines);
+    params.emplace_back(protocol::kKeyOutfile, outfile);
+    return GenCommandLines(protocol::kGetProtocolVer, params, lines);
 }
 
 int Rsyncer::GenSinglePairCmd(bool dryRun, std::list<std::string>& lines) {
@@ -79,9 +94,9 @@ int Rsyncer::GenSinglePairCmd(bool dryRun, std::list<std::string>& lines) {
 
 int Rsyncer::SinglePairLines(bool dryRun, std::list<std::string>& lines) {
     ParamList params;
-    params.emplace_back("dryRun", YesNo(dryRun));
-    params.emplace_back("serverName", GetHostName(kServerNameSkip));
-    return GenCommandLines("S2S_Pairing", params, lines);
+    params.emplace_back(protocol::kKeyDryRun, YesNo(dryRun));
+    params.emplace_back(protocol::kKeyServerName, GetHostName(kServerNameSkip));
+    return GenCommandLines(protocol::kPairing, params, lines);
 }
 
 int Rsyncer::GenPairMultiSrcCmd(bool dryRun, const std::list<std::string>& shares,
@@ -93,11 +108,12 @@ int Rsyncer::GenPairMultiSrcCmd(bool dryRun, const std::list<std::string>& share
         return -1;
     }
     ParamList params;
-    params.emplace_back("serverName", GetHostName(kServerNameSkip));
-    params.emplace_back("syncShares", JoinItems(shares, ":"));
-    params.emplace_back("dryRun", YesNo(dryRun));
-    params.emplace_back("outfile", outfile);
-    return GenCommandLines("S2S_PairingMultiSrc", params, lines);
+    params.emplace_back(protocol::kKeyServerName, GetHostName(kServerNameSkip));
+    params.emplace_back(protocol::kKeySyncShares,
+                        JoinItems(shares, std::string(1, protocol::kShareSeparator)));
+    params.emplace_back(protocol::kKeyDryRun, YesNo(dryRun));
+    params.emplace_back(protocol::kKeyOutfile, outfile);
+    return GenCommandLines(protocol::kPairingMultiSrc, params, lines);
 }
 
 int Rsyncer::GenFinishSyncCmd(const std::string& finishType, const std::string& name,
@@ -109,9 +125,9 @@ int Rsyncer::GenFinishSyncCmd(const std::string& finishType, const std::string& 
         return -1;
     }
     ParamList params;
-    params.emplace_back("finishType", finishType);
-    params.emplace_back("name", name);
-    return GenCommandLines("S2S_SyncFinish", params, lines);
+    params.emplace_back(protocol::kKeyFinishType, finishType);
+    params.emplace_back(protocol::kKeyName, name);
+    return GenCommandLines(protocol::kSyncFinish, params, lines);
 }
 
 int Rsyncer::GenSendBeaconCmd(const std::string& taskName, std::list<std::string>& lines) const {
@@ -122,8 +138,8 @@ int Rsyncer::GenSendBeaconCmd(const std::string& taskName, std::list<std::string
         return -1;
     }
     ParamList params;
-    params.emplace_back("taskName", taskName);
-    return GenCommandLines("S2S_UpdateTaskStatus", params, lines);
+    params.emplace_back(protocol::kKeyTaskName, taskName);
+    return GenCommandLines(protocol::kUpdateTaskStatus, params, lines);
 }
 
 void Rsyncer::GetServerVersion() {
@@ -215,7 +231,7 @@ bool ReadConflictShares(const std::string& path, std::list<std::string>& conflic
     }
     std::string line;
     if (std::getline(in, line) && !line.empty()) {
-        SplitStringByChars(line, ":", conflictShares);
+        SplitStringByChars(line, std::string(1, protocol::kShareSeparator), conflictShares);
     }
     return true;
 }

@@ -12,7 +12,7 @@
 #include <fstream>
 #include <sstream>
 
-#include "rsync/command_reply.h"
+#include "core/protocol.h"
 #include "rsync/rsync_wrapper_impl.h"
 #include "s2s_logger.h"
 
@@ -23,7 +23,7 @@ namespace {
 
 using S2S::Logger;
 using S2S::rsync_internal::ChildCommand;
-namespace reply = S2S::command_reply;
+namespace reply = S2S::protocol;
 
 // A directory private to this run (mode 0700), removed with its content on every path.
 class PrivateDir {
@@ -134,7 +134,7 @@ std::string WriteOutputFile(const std::string& path, const std::string& content)
 
 // The local path the caller named in outfile="...", or "".
 std::string OutfileOf(const std::list<std::string>& lines) {
-    static const std::string kPrefix = "outfile=\"";
+    static const std::string kPrefix = std::string(reply::kKeyOutfile) + "=\"";
     for (const auto& line : lines) {
         if (line.size() > kPrefix.size() && line.compare(0, kPrefix.size(), kPrefix) == 0 &&
             line.back() == '"') {

@@ -3,6 +3,7 @@
 #include <list>
 #include <string>
 
+#include "core/protocol.h"
 #include "rsync/path_list.h"
 #include "s2s_host.h"
 #include "s2s_logger.h"
@@ -12,8 +13,10 @@ namespace S2S {
 
 namespace {
 
+namespace protocol = S2S::protocol;
+
 const char* Flag(bool on) {
-    return on ? "1" : "0";
+    return on ? protocol::kOne : protocol::kZero;
 }
 
 }  // namespace
@@ -99,16 +102,16 @@ int Rsyncer::GenStartSyncShareCmd(const std::string& shareName, bool withAttribu
         return -1;
     }
     ParamList params;
-    params.emplace_back("volumeName", volume.GetName());
-    params.emplace_back("shareName", info.GetName());
+    params.emplace_back(protocol::kKeyVolumeName, volume.GetName());
+    params.emplace_back(protocol::kKeyShareName, info.GetName());
     if (withAttributes) {
-        params.emplace_back("isEncrypt", Flag(info.IsEncrypted()));
-        params.emplace_back("isAutomount", Flag(info.IsAutoMount()));
-        params.emplace_back("isEnableACL", Flag(info.IsACL()));
-        params.emplace_back("isWinShare", Flag(info.IsWinShare()));
-        params.emplace_back("lenEncKey", std::to_string(info.GetEncryptKeyLen()));
+        params.emplace_back(protocol::kKeyIsEncrypt, Flag(info.IsEncrypted()));
+        params.emplace_back(protocol::kKeyIsAutomount, Flag(info.IsAutoMount()));
+        params.emplace_back(protocol::kKeyIsEnableACL, Flag(info.IsACL()));
+        params.emplace_back(protocol::kKeyIsWinShare, Flag(info.IsWinShare()));
+        params.emplace_back(protocol::kKeyLenEncKey, std::to_string(info.GetEncryptKeyLen()));
     }
-    return GenCommandLines("S2S_SyncStart", params, lines);
+    return GenCommandLines(protocol::kSyncStart, params, lines);
 }
 
 int Rsyncer::StartSyncShare(const std::string& shareName, bool withAttributes, int& result) {
