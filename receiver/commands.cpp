@@ -13,8 +13,9 @@
 #include <utility>
 #include <vector>
 
-#include "rsync/command_reply.h"
+#include "host/platform_records.h"
 #include "receiver/internal.h"
+#include "rsync/command_reply.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_receiver.h"
@@ -36,14 +37,8 @@ constexpr int kMaxTasksPerClient = 64;
 
 typedef std::map<std::string, std::string> Pairs;
 
-struct HashDeleter {
-    void operator()(VLIBSzHash* h) const { VLIBCSzHashFree(h); }
-};
-struct ListDeleter {
-    void operator()(VLIBSzList* l) const { VLIBCSzListFree(l); }
-};
-typedef std::unique_ptr<VLIBSzHash, HashDeleter> Hash;
-typedef std::unique_ptr<VLIBSzList, ListDeleter> List;
+using Hash = HashRecord;
+using List = ListRecord;
 
 bool HasControl(const std::string& s) {
     for (unsigned char c : s) {

@@ -34,8 +34,9 @@
 #include <thread>
 #include <vector>
 
-#include "rsync/child_process.h"
+#include "host/platform_records.h"
 #include "receiver/internal.h"
+#include "rsync/child_process.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_receiver.h"
@@ -48,16 +49,6 @@ namespace {
 constexpr auto kStartWait = std::chrono::seconds(10);
 constexpr auto kStopWait = std::chrono::seconds(10);
 constexpr auto kKillWait = std::chrono::seconds(5);
-
-struct ListDeleter {
-    void operator()(VLIBSzList* l) const { VLIBCSzListFree(l); }
-};
-struct HashDeleter {
-    void operator()(VLIBSzHash* h) const { VLIBCSzHashFree(h); }
-};
-struct ShareDeleter {
-    void operator()(VURNShare* s) const { VURNShareFree(s); }
-};
 
 int Fail(std::string* error, const std::string& text) {
     Logger::LogMsg(Logger::Error, "[ERROR] receiver_daemon.cpp(%d): %s\n", __LINE__, text.c_str());
@@ -246,7 +237,7 @@ void ListenSettings(int* port, std::string* address) {
 }
 
 int SetEnabled(bool on) {
-    std::unique_ptr<VLIBSzHash, HashDeleter> h(VLIBCSzHashAlloc(2));
+    HashRecord h(VLIBCSzHashAlloc(2));
     VLIBSzHash* raw = h.release();
     int rc = VLIBCSzHashSetValue(&raw, "s2sEnabled", on ? "yes" : "no");
     h.reset(raw);
@@ -424,7 +415,7 @@ int ShareEncrypted(const std::string& name, bool* encrypted) {
     if (VURNShareGet(name.c_str(), &raw) < 0) {
         return VLIBCErrGet() == VLIB_ERR_NOT_FOUND ? 0 : -1;
     }
-    std::unique_ptr<VURNShare, ShareDeleter> share(raw);
+    ShareRecord share(raw);
     int value = 0;
     if (VLIBShareIsEncryptionGet(share.get(), &value) < 0) {
         return -1;
@@ -505,7 +496,7 @@ void TightenKeys(const std::string& dir, int depth) {
 int ShareModules(std::string* text, std::vector<std::string>* notes, std::string* error) {
     VLIBSzList* rawNames = VLIBCSzListAlloc(16);
     int count = VURNShareEnum(&rawNames);
-    std::unique_ptr<VLIBSzList, ListDeleter> names(rawNames);
+    ListRecord names(rawNames);
     if (count < 0 && VLIBCErrGet() != VLIB_ERR_FILE_NOT_FOUND) {
         return Fail(error, "cannot read the share registry");
     }
@@ -518,7 +509,7 @@ int ShareModules(std::string* text, std::vector<std::string>* notes, std::string
         if (VURNShareGet(name.c_str(), &raw) < 0) {
             return Fail(error, "cannot read the share " + name);
         }
-        std::unique_ptr<VURNShare, ShareDeleter> share(raw);
+        ShareRecord share(raw);
         std::string path = share->path;
         if (!receiver_internal::ValidShareName(name) || !ConfSafe(name) || path.empty() ||
             path[0] != '/' || !ConfSafe(path)) {
@@ -966,14 +957,14 @@ int ReceiverGetStatus(ReceiverStatus* out) {
     }
     VLIBSzList* rawSections = VLIBCSzListAlloc(64);
     int count = VLIBCFileEnumSection(store.c_str(), &rawSections);
-    std::unique_ptr<VLIBSzList, ListDeleter> sections(rawSections);
+    ListRecord sections(rawSections);
     if (count < 0) {
         out->storeError = store + " cannot be read (" + VLIBCErrStr(VLIBCErrGet()) + ")";
         return -1;
     }
     for (int i = 0; i < VLIBCSzListCount(sections.get()); ++i) {
         std::string section = VLIBCSzListGet(sections.get(), i);
-        std::unique_ptr<VLIBSzHash, HashDeleter> h(VLIBCSzHashAlloc(8));
+        HashRecord h(VLIBCSzHashAlloc(8));
         VLIBSzHash* raw = h.release();
         int found = VLIBCFileGetSection(store.c_str(), section.c_str(), &raw);
         h.reset(raw);
