@@ -1,4 +1,5 @@
-// Internals of the pairing store that its tests reach: where its messages go.
+// Internals of the pairing store that its tests reach: the key of its semaphore and where its
+// messages go.
 #ifndef S2S_HOST_PAIRING_STORE_H
 #define S2S_HOST_PAIRING_STORE_H
 

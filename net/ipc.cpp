@@ -1,3 +1,6 @@
+// IPCListener and IPCSender: the listening socket (TCP on 127.0.0.1 with upward port probing, or a
+// domain socket at a path) and the connection end that carries one PObject per message. Every
+// failed system call is logged with its errno before -1 goes back.
 #include "s2s_ipc.h"
 
 #include <arpa/inet.h>

@@ -1,3 +1,5 @@
+// The token line, the check of a reply token, the reading of a reply's result file and the
+// removal of a reply directory: the pieces of the command exchange both ends share.
 #include "rsync/command_reply.h"
 
 #include <cctype>

@@ -1,3 +1,5 @@
+// The tables and texts `s2s` prints from the sync service's replies: aligned columns, local times,
+// and "-" for a key the reply does not carry.
 #include "tools/s2s/service_view.h"
 
 #include <ctime>
