@@ -127,6 +127,23 @@ void ResetErrorQueue() {
     ERR_clear_error();
 }
 
+// What one wait of a record read or write (`who`: "ReadFd" or "WriteFd") left in its sets: 0 when
+// `ready` holds the descriptor; -2 on an exception, -3 when select returned without it.
+int CheckReady(int fd, const fd_set& ready, const fd_set& except, const char* who) {
+    if (FD_ISSET(fd, &except)) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): %s: exception set\n",
+                       __LINE__, who);
+        return -2;
+    }
+    if (!FD_ISSET(fd, &ready)) {
+        Logger::LogMsg(Logger::Warning,
+                       "[WARNING] s2s_channel.cpp(%d): %s: select but fd [%d] not ready\n",
+                       __LINE__, who, fd);
+        return -3;
+    }
+    return 0;
+}
+
 }  // namespace
 
 namespace tls {
@@ -410,19 +427,11 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wai
     fd_set readable;
     fd_set except;
     int status = WaitFd(fd, &readable, nullptr, &except, wait, flag);
+    if (status == 0) {
+        status = CheckReady(fd, readable, except, "ReadFd");
+    }
     if (status < 0) {
         return status;
-    }
-    if (FD_ISSET(fd, &except)) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): ReadFd: exception set\n",
-                       __LINE__);
-        return -2;
-    }
-    if (!FD_ISSET(fd, &readable)) {
-        Logger::LogMsg(Logger::Warning,
-                       "[WARNING] s2s_channel.cpp(%d): ReadFd: select but fd [%d] not ready\n",
-                       __LINE__, fd);
-        return -3;
     }
     ResetErrorQueue();
     // SSL_read takes an int: a ring larger than INT_MAX is read in pieces.
@@ -450,19 +459,11 @@ int Channel::SSLWriteFd(SSL* ssl, const void* buf, unsigned int len, const timev
     fd_set writable;
     fd_set except;
     int status = WaitFd(fd, nullptr, &writable, &except, wait, flag);
+    if (status == 0) {
+        status = CheckReady(fd, writable, except, "WriteFd");
+    }
     if (status < 0) {
         return status;
-    }
-    if (FD_ISSET(fd, &except)) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): WriteFd: exception set\n",
-                       __LINE__);
-        return -2;
-    }
-    if (!FD_ISSET(fd, &writable)) {
-        Logger::LogMsg(Logger::Warning,
-                       "[WARNING] s2s_channel.cpp(%d): WriteFd: select but fd [%d] not ready\n",
-                       __LINE__, fd);
-        return -3;
     }
     ResetErrorQueue();
     int n = SSL_write(ssl, buf, static_cast<int>(std::min(len, 0x7fffffffU)));
