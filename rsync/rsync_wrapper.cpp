@@ -23,10 +23,6 @@ namespace Backup {
 
 namespace {
 
-using S2S::Logger;
-using S2S::rsync_internal::ChildCommand;
-using S2S::rsync_internal::ChildOutcome;
-
 // Where the debug log of client runs goes, and the receiver's daemon configuration that a
 // one-shot daemon started over ssh reads (both below $S2S_ROOT when it is set).
 constexpr const char* kDefaultLogFile = "/var/log/s2s_rsync.log";

@@ -21,8 +21,6 @@ namespace Backup {
 
 namespace {
 
-using S2S::Logger;
-using S2S::rsync_internal::ChildCommand;
 namespace reply = S2S::command_reply;
 
 // A directory private to this run (mode 0700), removed with its content on every path.
