@@ -55,10 +55,7 @@ done
 
 user=bench
 password=$(s2s_random_password)
-ip link set lo up
-work=$(mktemp -d /tmp/s2s-rtbench.XXXXXX)
-sender=$work/sender
-receiver=$work/receiver
+s2s_stage s2s-rtbench
 s2sd_pid=
 lsyncd_pid=
 

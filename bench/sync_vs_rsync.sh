@@ -26,10 +26,7 @@ files=${S2S_BENCH_FILES:-5000}
 megabytes=${S2S_BENCH_MB:-1024}
 user=bench
 password=$(s2s_random_password)
-ip link set lo up
-work=$(mktemp -d /tmp/s2s-bench.XXXXXX)
-sender=$work/sender
-receiver=$work/receiver
+s2s_stage s2s-bench
 cleanup() {
   S2S_ROOT=$receiver "$bin/s2s-receiver" stop >/dev/null 2>&1 || true
   rm -rf "$work"

@@ -127,9 +127,22 @@ void ResetErrorQueue() {
     ERR_clear_error();
 }
 
-// What one wait of a record read or write (`who`: "ReadFd" or "WriteFd") left in its sets: 0 when
-// `ready` holds the descriptor; -2 on an exception, -3 when select returned without it.
-int CheckReady(int fd, const fd_set& ready, const fd_set& except, const char* who) {
+// Channel::WaitFd, handed in by the channel (it is the channel's own step).
+using WaitFdFn = int (*)(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_set,
+                         const timeval& wait, int* flag);
+
+// One bounded wait of a record read or write (`who`: "ReadFd" or "WriteFd") until `fd` is
+// readable (or, with `write`, writable): 0 when it is; the wait's own negative status; -2 on an
+// exception, -3 when select returned without the descriptor.
+int WaitReady(WaitFdFn wait_fd, int fd, bool write, const timeval& wait, int* flag,
+              const char* who) {
+    fd_set ready;
+    fd_set except;
+    const int status = write ? wait_fd(fd, nullptr, &ready, &except, wait, flag)
+                             : wait_fd(fd, &ready, nullptr, &except, wait, flag);
+    if (status < 0) {
+        return status;
+    }
     if (FD_ISSET(fd, &except)) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): %s: exception set\n",
                        __LINE__, who);
@@ -423,13 +436,7 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wai
                        __LINE__, n);
         return n;
     }
-    const int fd = SSL_get_fd(ssl);
-    fd_set readable;
-    fd_set except;
-    int status = WaitFd(fd, &readable, nullptr, &except, wait, flag);
-    if (status == 0) {
-        status = CheckReady(fd, readable, except, "ReadFd");
-    }
+    const int status = WaitReady(&WaitFd, SSL_get_fd(ssl), false, wait, flag, "ReadFd");
     if (status < 0) {
         return status;
     }
@@ -455,13 +462,7 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wai
 
 int Channel::SSLWriteFd(SSL* ssl, const void* buf, unsigned int len, const timeval& wait,
                         int* flag) {
-    const int fd = SSL_get_fd(ssl);
-    fd_set writable;
-    fd_set except;
-    int status = WaitFd(fd, nullptr, &writable, &except, wait, flag);
-    if (status == 0) {
-        status = CheckReady(fd, writable, except, "WriteFd");
-    }
+    const int status = WaitReady(&WaitFd, SSL_get_fd(ssl), true, wait, flag, "WriteFd");
     if (status < 0) {
         return status;
     }

@@ -36,10 +36,7 @@ password=$(s2s_random_password)
 ssh_port=2222
 started=$(date +%s.%N)
 
-ip link set lo up
-work=$(mktemp -d /tmp/s2s-demo.XXXXXX)
-sender=$work/sender
-receiver=$work/receiver
+s2s_stage s2s-demo
 sshd_pid=
 s2sd_pid=
 

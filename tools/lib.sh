@@ -3,7 +3,8 @@
 # (tools/demo.sh, bench/realtime_latency.sh, bench/sync_vs_rsync.sh): where the programs are, the
 # root check and the build, a server's root with its host file, the receiver's rsync daemon, a
 # password file only its owner reads, and generated trees of files. Source it from the
-# repository's top folder; it defines functions only, except s2s_locate_build's variables.
+# repository's top folder; it defines functions only, except the variables that
+# s2s_locate_build and s2s_stage set.
 
 # Sets repo (this folder), build (S2S_BUILD_DIR, default build) and bin (the programs).
 s2s_locate_build() {
@@ -24,6 +25,16 @@ s2s_require_root() {  # script-name why
 s2s_build() {  # target...
   cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
   cmake --build "$build" -j "$(nproc)" --target "$@"
+}
+
+# Brings the loopback of the private network up and makes the work folder /tmp/<name>.XXXXXX:
+# sets work, and sender and receiver, the two servers' roots in it.
+# shellcheck disable=SC2034  # sender and receiver are the sourcing script's
+s2s_stage() {  # name
+  ip link set lo up
+  work=$(mktemp -d "/tmp/$1.XXXXXX")
+  sender=$work/sender
+  receiver=$work/receiver
 }
 
 # A random password of letters and digits.
