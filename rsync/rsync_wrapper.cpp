@@ -516,6 +516,12 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
     return outcome.exit_code;
 }
 
+int RsyncWrapper::Impl::RefuseRun(const std::string& why) {
+    lastError = why;
+    Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__, why.c_str());
+    return kResultUsage;
+}
+
 int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     std::string why = CheckConnection();
     std::string target;
@@ -526,9 +532,7 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
         why = "no usable source path";
     }
     if (!why.empty()) {
-        lastError = why;
-        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__, why.c_str());
-        return kResultUsage;
+        return RefuseRun(why);
     }
 
     ChildCommand job;

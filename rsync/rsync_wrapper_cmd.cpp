@@ -165,9 +165,7 @@ int RsyncWrapper::Impl::ExecuteCommand(const boost::function<bool()>& cancel) {
         }
     }
     if (!why.empty()) {
-        lastError = why;
-        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__, why.c_str());
-        return kResultUsage;
+        return RefuseRun(why);
     }
 
     PrivateDir dir;

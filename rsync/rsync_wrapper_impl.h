@@ -91,6 +91,9 @@ struct RsyncWrapper::Impl {
     void Environment(ChildCommand* job) const;
     // Runs rsync; keeps the last error lines; maps spawn failures and cancellation.
     int Run(ChildCommand& job, const boost::function<bool()>& cancel, bool commandRun);
+    // A run refused before it started (settings that cannot make a safe command line): `why`
+    // becomes the last error and an ERROR line; kResultUsage.
+    int RefuseRun(const std::string& why);
 
     int ExecuteTransfer(const boost::function<bool()>& cancel);
     int ExecuteCommand(const boost::function<bool()>& cancel);
