@@ -127,6 +127,14 @@ void ResetErrorQueue() {
     ERR_clear_error();
 }
 
+// The end of a failed step of InitSSL, its warning logged already: the TLS error queue goes to
+// the log and what the steps made so far is freed. Always -1.
+int AbandonInit(SSL*& ssl, SSL_CTX*& ctx) {
+    Channel::log_ssl();
+    Channel::DeinitSSL(ssl, ctx, false);
+    return -1;
+}
+
 // Channel::WaitFd, handed in by the channel (it is the channel's own step).
 using WaitFdFn = int (*)(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_set,
                          const timeval& wait, int* flag);
@@ -255,9 +263,7 @@ int Channel::InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted
     if (ctx == nullptr) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): m_ssl_ctx created failed\n",
                        __LINE__);
-        log_ssl();
-        DeinitSSL(ssl, ctx, false);
-        return -1;
+        return AbandonInit(ssl, ctx);
     }
     // The channel's write loop hands over whatever is contiguous in its ring and advances by what
     // was sent, like a plain send(); a retry may come with more bytes than the one that stalled.
@@ -269,25 +275,19 @@ int Channel::InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] s2s_channel.cpp(%d): Open: init ssl certificate failed\n",
                            __LINE__);
-            log_ssl();
-            DeinitSSL(ssl, ctx, false);
-            return -1;
+            return AbandonInit(ssl, ctx);
         }
         if (InstallPriKey(ctx) < 0) {
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] s2s_channel.cpp(%d): Open: init ssl private key failed\n",
                            __LINE__);
-            log_ssl();
-            DeinitSSL(ssl, ctx, false);
-            return -1;
+            return AbandonInit(ssl, ctx);
         }
         ssl = SSL_new(ctx);
         if (ssl == nullptr) {
             Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): m_ssl created failed\n",
                            __LINE__);
-            log_ssl();
-            DeinitSSL(ssl, ctx, false);
-            return -1;
+            return AbandonInit(ssl, ctx);
         }
         SSL_set_accept_state(ssl);
         return 0;
@@ -307,27 +307,21 @@ int Channel::InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted
         if (!defaults.empty() && SSL_CTX_set_cipher_list(ctx, defaults.c_str()) != 1) {
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] s2s_channel.cpp(%d): m_ssl_ctx created failed\n", __LINE__);
-            log_ssl();
-            DeinitSSL(ssl, ctx, false);
-            return -1;
+            return AbandonInit(ssl, ctx);
         }
     }
     ssl = SSL_new(ctx);
     if (ssl == nullptr) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): m_ssl created failed\n",
                        __LINE__);
-        log_ssl();
-        DeinitSSL(ssl, ctx, false);
-        return -1;
+        return AbandonInit(ssl, ctx);
     }
     // The session consults the context's store when it verifies, so loading after SSL_new counts.
     if (!allow_untrusted && InstallVerifyCA(ctx) < 0) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] s2s_channel.cpp(%d): InitSSL(): set Verify store fail\n",
                        __LINE__);
-        log_ssl();
-        DeinitSSL(ssl, ctx, false);
-        return -1;
+        return AbandonInit(ssl, ctx);
     }
     SSL_set_connect_state(ssl);
     return 0;
