@@ -23,23 +23,18 @@
 # Quick run: S2S_BENCH_FILES=5000 S2S_BENCH_CHANGES=10 S2S_BENCH_IDLE=5 S2S_BENCH_DIRS=2000
 set -euo pipefail
 cd "$(dirname "$0")/.."
-repo=$(pwd)
-build=${S2S_BUILD_DIR:-build}
-case $build in /*) bin=$build/bin ;; *) bin=$repo/$build/bin ;; esac
+source tools/lib.sh
+s2s_locate_build
 
 if [ -z "${S2S_BENCH_INSIDE:-}" ]; then
-  if [ "$(id -u)" -ne 0 ]; then
-    echo "bench: run as root (the receiver's daemon gets a private network namespace)" >&2
-    exit 1
-  fi
+  s2s_require_root bench "the receiver's daemon gets a private network namespace"
   if ! command -v lsyncd >/dev/null; then
     echo "installing lsyncd"
     DEBIAN_FRONTEND=noninteractive apt-get install -y -qq --no-install-recommends lsyncd ||
       { apt-get update -qq && DEBIAN_FRONTEND=noninteractive apt-get install -y -qq \
         --no-install-recommends lsyncd; }
   fi
-  cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
-  cmake --build "$build" -j "$(nproc)" --target s2s_cli s2s-receiver s2sd >/dev/null
+  s2s_build s2s_cli s2s-receiver s2sd >/dev/null
   exec unshare --net -- env S2S_BENCH_INSIDE=1 bash "$0" "$@"
 fi
 
@@ -59,11 +54,8 @@ done
 ((files > 0 && changes > 0 && max_wait > 0)) || { echo "bench: nothing to measure" >&2; exit 2; }
 
 user=bench
-password=$(head -c 18 /dev/urandom | base64 | tr -d '/+=')
-ip link set lo up
-work=$(mktemp -d /tmp/s2s-rtbench.XXXXXX)
-sender=$work/sender
-receiver=$work/receiver
+password=$(s2s_random_password)
+s2s_stage s2s-rtbench
 s2sd_pid=
 lsyncd_pid=
 
@@ -102,30 +94,21 @@ fail() {  # message
 # s2sd syncs the share "live"; lsyncd mirrors the same tree from "mirror" into the receiver's share
 # of that name; "dirs" is the tree of directories.
 for root in "$sender" "$receiver"; do
-  mkdir -p "$root/etc/s2s" "$root/volume1"  # tmp/S2S is made (private) at first use
-  printf '[host]\n\tserial="SN-RTBENCH-%s"\n[volumes]\n\t%s="internal,directory"\n' \
-    "$(basename "$root")" "$root/volume1" >"$root/etc/s2s/host.conf"
+  s2s_make_host "$root" "SN-RTBENCH-$(basename "$root")"
   for share in live mirror dirs; do
     mkdir -p "$root/volume1/$share"
     S2S_ROOT=$root "$bin/s2s" share add "$share" --path "$root/volume1/$share" >/dev/null
   done
 done
-printf '%s\n' "$password" |
-  S2S_ROOT=$receiver "$bin/s2s-receiver" configure --user "$user" --port 873 --address 127.0.0.1
-S2S_ROOT=$receiver "$bin/s2s-receiver" start
+s2s_start_receiver "$receiver" "$user" "$password"
 password_file=$work/password
-(umask 077 && printf '%s\n' "$password" >"$password_file")
+s2s_password_file "$password_file" "$password"
 
 # The tree: 250 files of 1 KiB per folder. Both tools' copies on the receiver start identical to
 # the source, so their first full syncs only compare.
 echo "generating $files files of 1 KiB in $(((files + 249) / 250)) folders"
-per_dir=250
-for ((d = 0; d * per_dir < files; d++)); do
-  n=$((files - d * per_dir < per_dir ? files - d * per_dir : per_dir))
-  mkdir -p "$sender/volume1/live/dir$d"
-  head -c $((n * 1024)) /dev/urandom | split -b 1024 -a 3 - "$sender/volume1/live/dir$d/f"
-done
-folders=$d
+s2s_generate_files "$sender/volume1/live" "$files" 1024
+folders=$(((files + 249) / 250))
 cp -a "$sender/volume1/live/." "$sender/volume1/mirror/"
 cp -a "$sender/volume1/live/." "$receiver/volume1/live/"
 cp -a "$sender/volume1/live/." "$receiver/volume1/mirror/"

@@ -13,28 +13,20 @@
 #   S2S_BUILD_DIR     build directory holding bin/s2s and bin/s2s-receiver (default build)
 set -euo pipefail
 cd "$(dirname "$0")/.."
-repo=$(pwd)
-build=${S2S_BUILD_DIR:-build}
-case $build in /*) bin=$build/bin ;; *) bin=$repo/$build/bin ;; esac
+source tools/lib.sh
+s2s_locate_build
 
 if [ -z "${S2S_BENCH_INSIDE:-}" ]; then
-  if [ "$(id -u)" -ne 0 ]; then
-    echo "bench: run as root (the daemon gets a private network namespace)" >&2
-    exit 1
-  fi
-  cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
-  cmake --build "$build" -j "$(nproc)" --target s2s_cli s2s-receiver >/dev/null
+  s2s_require_root bench "the daemon gets a private network namespace"
+  s2s_build s2s_cli s2s-receiver >/dev/null
   exec unshare --net -- env S2S_BENCH_INSIDE=1 bash "$0" "$@"
 fi
 
 files=${S2S_BENCH_FILES:-5000}
 megabytes=${S2S_BENCH_MB:-1024}
 user=bench
-password=$(head -c 18 /dev/urandom | base64 | tr -d '/+=')
-ip link set lo up
-work=$(mktemp -d /tmp/s2s-bench.XXXXXX)
-sender=$work/sender
-receiver=$work/receiver
+password=$(s2s_random_password)
+s2s_stage s2s-bench
 cleanup() {
   S2S_ROOT=$receiver "$bin/s2s-receiver" stop >/dev/null 2>&1 || true
   rm -rf "$work"
@@ -42,30 +34,20 @@ cleanup() {
 trap cleanup EXIT
 
 for root in "$sender" "$receiver"; do
-  mkdir -p "$root/etc/s2s" "$root/volume1"  # tmp/S2S is made (private) at first use
-  printf '[host]\n\tserial="SN-BENCH-%s"\n[volumes]\n\t%s="internal,directory"\n' "$(basename "$root")" \
-    "$root/volume1" >"$root/etc/s2s/host.conf"
+  s2s_make_host "$root" "SN-BENCH-$(basename "$root")"
 done
 mkdir -p "$sender/volume1/data" "$receiver/volume1/data" "$receiver/volume1/plain"
 S2S_ROOT=$sender "$bin/s2s" share add data --path "$sender/volume1/data" >/dev/null
 S2S_ROOT=$receiver "$bin/s2s" share add data --path "$receiver/volume1/data" >/dev/null
 S2S_ROOT=$receiver "$bin/s2s" share add plain --path "$receiver/volume1/plain" >/dev/null
-printf '%s\n' "$password" |
-  S2S_ROOT=$receiver "$bin/s2s-receiver" configure --user "$user" --port 873 --address 127.0.0.1
-S2S_ROOT=$receiver "$bin/s2s-receiver" start
+s2s_start_receiver "$receiver" "$user" "$password"
 
 echo "generating $files files, $megabytes MiB"
-per_dir=250
-size=$((megabytes * 1048576 / files))
-for ((d = 0; d * per_dir < files; d++)); do
-  n=$((files - d * per_dir < per_dir ? files - d * per_dir : per_dir))
-  mkdir -p "$sender/volume1/data/dir$d"
-  head -c $((n * size)) /dev/urandom | split -b "$size" -a 3 - "$sender/volume1/data/dir$d/f"
-done
+s2s_generate_files "$sender/volume1/data" "$files" $((megabytes * 1048576 / files))
 sync
 
 password_file=$work/password
-(umask 077 && printf '%s\n' "$password" >"$password_file")
+s2s_password_file "$password_file" "$password"
 now() { date +%s.%N; }
 field() { sed -n "s/^  \"$2\": \([0-9.]*\),\{0,1\}$/\1/p" "$1"; }
 

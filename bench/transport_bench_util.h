@@ -9,45 +9,51 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <initializer_list>
 #include <string>
+#include <utility>
 
 #include "s2s_pobject.h"
 
 namespace s2s_bench {
 
+// Sets each key of `fields` in the map `map`.
+inline void SetFields(S2S::PObject& map,
+                      std::initializer_list<std::pair<const char*, S2S::PObject>> fields) {
+    for (const auto& field : fields) {
+        map[field.first] = field.second;
+    }
+}
+
 // A sync task as the daemon and its front ends exchange it: about 25 keys, a share list and the
 // nested connection settings.
 inline S2S::PObject TaskMap() {
     S2S::PObject task;
-    task["task_id"] = 17ULL;
-    task["task_name"] = "Nightly copy to the backup server";
-    task["status"] = 2ULL;
-    task["last_result"] = 0ULL;
-    task["last_run"] = 1700000000ULL;
-    task["next_run"] = 1700086400ULL;
-    task["enabled"] = 1ULL;
-    task["created_by"] = "admin";
-    task["description"] = "copies the media shares every night at two";
+    SetFields(task, {{"task_id", 17ULL},
+                     {"task_name", "Nightly copy to the backup server"},
+                     {"status", 2ULL},
+                     {"last_result", 0ULL},
+                     {"last_run", 1700000000ULL},
+                     {"next_run", 1700086400ULL},
+                     {"enabled", 1ULL},
+                     {"created_by", "admin"},
+                     {"description", "copies the media shares every night at two"}});
     S2S::PObject::Array shares;
     for (const char* name : {"music", "photos", "video", "documents", "homes"}) {
         shares.push_back(S2S::PObject(name));
     }
     task["shares"] = shares;
-    S2S::PObject& info = task["sync_info"];
-    info["server"] = "192.168.10.20";
-    info["port"] = 873ULL;
-    info["user"] = "backup";
-    info["compress"] = 1ULL;
-    info["encrypt"] = 1ULL;
-    info["bandwidth"] = 0ULL;
-    info["timeout"] = 600ULL;
-    info["keep_deleted"] = 0ULL;
-    info["sparse"] = 1ULL;
-    S2S::PObject& schedule = task["schedule"];
-    schedule["mode"] = 1ULL;
-    schedule["hour"] = 2ULL;
-    schedule["minute"] = 0ULL;
-    schedule["weekdays"] = 127ULL;
+    SetFields(task["sync_info"], {{"server", "192.168.10.20"},
+                                  {"port", 873ULL},
+                                  {"user", "backup"},
+                                  {"compress", 1ULL},
+                                  {"encrypt", 1ULL},
+                                  {"bandwidth", 0ULL},
+                                  {"timeout", 600ULL},
+                                  {"keep_deleted", 0ULL},
+                                  {"sparse", 1ULL}});
+    SetFields(task["schedule"],
+              {{"mode", 1ULL}, {"hour", 2ULL}, {"minute", 0ULL}, {"weekdays", 127ULL}});
     return task;
 }
 

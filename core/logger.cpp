@@ -1,7 +1,14 @@
+// Logger: where log lines go, their filtering, time stamps and size-based rotation. Every write,
+// the size accounting and a rotation happen under log_mutex, so lines of different threads never
+// interleave; Initialize and Destroy change the settings without it and must not run while
+// another thread logs.
 #include "s2s_logger.h"
 
+#include <pthread.h>
+#include <sys/stat.h>
 #include <syslog.h>
 
+#include <cerrno>
 #include <cstdarg>
 #include <cstdio>
 #include <ctime>
@@ -12,9 +19,14 @@ int Logger::log_level = 3;
 int Logger::log_size = -1;
 int Logger::rotate_cnt = 50;
 int Logger::log_type = Logger::Syslog;
-FILE* Logger::log_fp = nullptr;
 std::string Logger::log_path;
-pthread_mutex_t Logger::log_mutex = PTHREAD_MUTEX_INITIALIZER;
+
+// The stream and its lock belong to this file alone: the header does not show them. Their storage
+// carries the exported names S2S::Logger::log_fp and S2S::Logger::log_mutex, which programs built
+// against the library's first header refer to, so such programs still link and share this state.
+S2S_EXPORT FILE* log_fp __asm__("_ZN3S2S6Logger6log_fpE") = nullptr;
+S2S_EXPORT pthread_mutex_t log_mutex __asm__("_ZN3S2S6Logger9log_mutexE") =
+    PTHREAD_MUTEX_INITIALIZER;
 
 namespace {
 
@@ -132,6 +144,32 @@ int Logger::Rotate() {
         return -1;
     }
     log_fp = fp;
+    return 0;
+}
+
+int Logger::Reopen(mode_t mode) {
+    if (log_type != File || log_path.empty()) {
+        errno = EINVAL;
+        return -1;
+    }
+    FILE* fresh = std::fopen(log_path.c_str(), "a");
+    if (fresh == nullptr) {
+        return -1;
+    }
+    if (fchmod(fileno(fresh), mode) != 0) {
+        const int saved = errno;
+        std::fclose(fresh);
+        errno = saved;
+        return -1;
+    }
+    pthread_mutex_lock(&log_mutex);
+    FILE* old = log_fp;
+    log_fp = fresh;
+    log_size = 0;
+    pthread_mutex_unlock(&log_mutex);
+    if (old != nullptr && old != stdout && old != stderr) {
+        std::fclose(old);
+    }
     return 0;
 }
 

@@ -15,6 +15,28 @@
 
 namespace S2S {
 
+namespace {
+
+// Takes (`want`) or releases the lock on `fd` unless it is in that state already; `verb` names
+// the step in the message of a failure.
+int SetLocked(int fd, bool& locked, bool want, const char* verb) {
+    if (locked == want) {
+        return 0;
+    }
+    if (fd < 0) {
+        return -1;
+    }
+    if (flock(fd, want ? LOCK_EX : LOCK_UN) != 0) {
+        Logger::LogMsg(Logger::Error, "[ERROR] s2s.cpp(%d): Fail to %s, error:'%s'\n", __LINE__,
+                       verb, strerror(errno));
+        return -1;
+    }
+    locked = want;
+    return 0;
+}
+
+}  // namespace
+
 SimpleFileLock::SimpleFileLock(const std::string& path) : locked(false), fd(-1) {
     fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
     if (fd < 0) {
@@ -51,35 +73,11 @@ SimpleFileLock& SimpleFileLock::operator=(SimpleFileLock&& other) noexcept {
 }
 
 int SimpleFileLock::ExLock() {
-    if (locked) {
-        return 0;
-    }
-    if (fd < 0) {
-        return -1;
-    }
-    if (flock(fd, LOCK_EX) != 0) {
-        Logger::LogMsg(Logger::Error, "[ERROR] s2s.cpp(%d): Fail to lock, error:'%s'\n", __LINE__,
-                       strerror(errno));
-        return -1;
-    }
-    locked = true;
-    return 0;
+    return SetLocked(fd, locked, true, "lock");
 }
 
 int SimpleFileLock::UnLock() {
-    if (!locked) {
-        return 0;
-    }
-    if (fd < 0) {
-        return -1;
-    }
-    if (flock(fd, LOCK_UN) != 0) {
-        Logger::LogMsg(Logger::Error, "[ERROR] s2s.cpp(%d): Fail to unlock, error:'%s'\n", __LINE__,
-                       strerror(errno));
-        return -1;
-    }
-    locked = false;
-    return 0;
+    return SetLocked(fd, locked, false, "unlock");
 }
 
 LockFactory::LockFactory(const std::string& path) : path(path) {}

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "host/platform_records.h"
 #include "s2s_host.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
@@ -18,18 +19,18 @@ int GetShareInfo(const std::string& name, ShareInfo& info) {
     if (name.empty()) {
         return -1;
     }
-    VURNShare* rec = nullptr;
-    if (VURNShareGet(name.c_str(), &rec) != 0) {
+    VURNShare* raw = nullptr;
+    const int got = VURNShareGet(name.c_str(), &raw);
+    const ShareRecord rec(raw);  // freed on every path below
+    if (got != 0) {
         Logger::LogMsg(Logger::Error, "[ERROR] s2s.cpp(%d): Fail to get share '%s'\n", __LINE__,
                        name.c_str());
-        VURNShareFree(rec);
         return -1;
     }
     std::string path = rec->path != nullptr ? rec->path : "";
     if (path.empty()) {
         Logger::LogMsg(Logger::Error, "[ERROR] s2s.cpp(%d): Fail to get the path of share '%s'\n",
                        __LINE__, name.c_str());
-        VURNShareFree(rec);
         return -1;
     }
     std::string module_path = path;
@@ -40,7 +41,6 @@ int GetShareInfo(const std::string& name, ShareInfo& info) {
             Logger::LogMsg(Logger::Error,
                            "[ERROR] s2s.cpp(%d): Fail to get encrypted path of share '%s'\n",
                            __LINE__, name.c_str());
-            VURNShareFree(rec);
             return -1;
         }
         module_path = buffer;
@@ -52,7 +52,6 @@ int GetShareInfo(const std::string& name, ShareInfo& info) {
     info.moduleName = module_name;
     info.status = rec->status;
     info.encKeyLen = rec->keyLen;
-    VURNShareFree(rec);
     return 0;
 }
 

@@ -1,3 +1,7 @@
+// Channel: the plain socket operations, the read and write rings, and the waits. Every wait is a
+// select() of at most one second, so the abort flag is looked at at least once a second and the
+// inactivity timeout counts whole quiet seconds; the rings are allocated once, in the
+// constructor, and the data path never allocates.
 #include "s2s_channel.h"
 
 #include <arpa/inet.h>

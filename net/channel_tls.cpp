@@ -127,6 +127,44 @@ void ResetErrorQueue() {
     ERR_clear_error();
 }
 
+// The end of a failed step of InitSSL, its warning logged already: the TLS error queue goes to
+// the log and what the steps made so far is freed. Always -1.
+int AbandonInit(SSL*& ssl, SSL_CTX*& ctx) {
+    Channel::log_ssl();
+    Channel::DeinitSSL(ssl, ctx, false);
+    return -1;
+}
+
+// Channel::WaitFd, handed in by the channel (it is the channel's own step).
+using WaitFdFn = int (*)(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_set,
+                         const timeval& wait, int* flag);
+
+// One bounded wait of a record read or write (`who`: "ReadFd" or "WriteFd") until `fd` is
+// readable (or, with `write`, writable): 0 when it is; the wait's own negative status; -2 on an
+// exception, -3 when select returned without the descriptor.
+int WaitReady(WaitFdFn wait_fd, int fd, bool write, const timeval& wait, int* flag,
+              const char* who) {
+    fd_set ready;
+    fd_set except;
+    const int status = write ? wait_fd(fd, nullptr, &ready, &except, wait, flag)
+                             : wait_fd(fd, &ready, nullptr, &except, wait, flag);
+    if (status < 0) {
+        return status;
+    }
+    if (FD_ISSET(fd, &except)) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): %s: exception set\n",
+                       __LINE__, who);
+        return -2;
+    }
+    if (!FD_ISSET(fd, &ready)) {
+        Logger::LogMsg(Logger::Warning,
+                       "[WARNING] s2s_channel.cpp(%d): %s: select but fd [%d] not ready\n",
+                       __LINE__, who, fd);
+        return -3;
+    }
+    return 0;
+}
+
 }  // namespace
 
 namespace tls {
@@ -225,9 +263,7 @@ int Channel::InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted
     if (ctx == nullptr) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): m_ssl_ctx created failed\n",
                        __LINE__);
-        log_ssl();
-        DeinitSSL(ssl, ctx, false);
-        return -1;
+        return AbandonInit(ssl, ctx);
     }
     // The channel's write loop hands over whatever is contiguous in its ring and advances by what
     // was sent, like a plain send(); a retry may come with more bytes than the one that stalled.
@@ -239,25 +275,19 @@ int Channel::InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] s2s_channel.cpp(%d): Open: init ssl certificate failed\n",
                            __LINE__);
-            log_ssl();
-            DeinitSSL(ssl, ctx, false);
-            return -1;
+            return AbandonInit(ssl, ctx);
         }
         if (InstallPriKey(ctx) < 0) {
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] s2s_channel.cpp(%d): Open: init ssl private key failed\n",
                            __LINE__);
-            log_ssl();
-            DeinitSSL(ssl, ctx, false);
-            return -1;
+            return AbandonInit(ssl, ctx);
         }
         ssl = SSL_new(ctx);
         if (ssl == nullptr) {
             Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): m_ssl created failed\n",
                            __LINE__);
-            log_ssl();
-            DeinitSSL(ssl, ctx, false);
-            return -1;
+            return AbandonInit(ssl, ctx);
         }
         SSL_set_accept_state(ssl);
         return 0;
@@ -277,27 +307,21 @@ int Channel::InitSSL(SSL*& ssl, SSL_CTX*& ctx, bool server, bool allow_untrusted
         if (!defaults.empty() && SSL_CTX_set_cipher_list(ctx, defaults.c_str()) != 1) {
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] s2s_channel.cpp(%d): m_ssl_ctx created failed\n", __LINE__);
-            log_ssl();
-            DeinitSSL(ssl, ctx, false);
-            return -1;
+            return AbandonInit(ssl, ctx);
         }
     }
     ssl = SSL_new(ctx);
     if (ssl == nullptr) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): m_ssl created failed\n",
                        __LINE__);
-        log_ssl();
-        DeinitSSL(ssl, ctx, false);
-        return -1;
+        return AbandonInit(ssl, ctx);
     }
     // The session consults the context's store when it verifies, so loading after SSL_new counts.
     if (!allow_untrusted && InstallVerifyCA(ctx) < 0) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] s2s_channel.cpp(%d): InitSSL(): set Verify store fail\n",
                        __LINE__);
-        log_ssl();
-        DeinitSSL(ssl, ctx, false);
-        return -1;
+        return AbandonInit(ssl, ctx);
     }
     SSL_set_connect_state(ssl);
     return 0;
@@ -406,23 +430,9 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wai
                        __LINE__, n);
         return n;
     }
-    const int fd = SSL_get_fd(ssl);
-    fd_set readable;
-    fd_set except;
-    int status = WaitFd(fd, &readable, nullptr, &except, wait, flag);
+    const int status = WaitReady(&WaitFd, SSL_get_fd(ssl), false, wait, flag, "ReadFd");
     if (status < 0) {
         return status;
-    }
-    if (FD_ISSET(fd, &except)) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): ReadFd: exception set\n",
-                       __LINE__);
-        return -2;
-    }
-    if (!FD_ISSET(fd, &readable)) {
-        Logger::LogMsg(Logger::Warning,
-                       "[WARNING] s2s_channel.cpp(%d): ReadFd: select but fd [%d] not ready\n",
-                       __LINE__, fd);
-        return -3;
     }
     ResetErrorQueue();
     // SSL_read takes an int: a ring larger than INT_MAX is read in pieces.
@@ -446,23 +456,9 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wai
 
 int Channel::SSLWriteFd(SSL* ssl, const void* buf, unsigned int len, const timeval& wait,
                         int* flag) {
-    const int fd = SSL_get_fd(ssl);
-    fd_set writable;
-    fd_set except;
-    int status = WaitFd(fd, nullptr, &writable, &except, wait, flag);
+    const int status = WaitReady(&WaitFd, SSL_get_fd(ssl), true, wait, flag, "WriteFd");
     if (status < 0) {
         return status;
-    }
-    if (FD_ISSET(fd, &except)) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): WriteFd: exception set\n",
-                       __LINE__);
-        return -2;
-    }
-    if (!FD_ISSET(fd, &writable)) {
-        Logger::LogMsg(Logger::Warning,
-                       "[WARNING] s2s_channel.cpp(%d): WriteFd: select but fd [%d] not ready\n",
-                       __LINE__, fd);
-        return -3;
     }
     ResetErrorQueue();
     int n = SSL_write(ssl, buf, static_cast<int>(std::min(len, 0x7fffffffU)));

@@ -1,3 +1,6 @@
+// IPCListener and IPCSender: the listening socket (TCP on 127.0.0.1 with upward port probing, or a
+// domain socket at a path) and the connection end that carries one PObject per message. Every
+// failed system call is logged with its errno before -1 goes back.
 #include "s2s_ipc.h"
 
 #include <arpa/inet.h>
@@ -39,6 +42,27 @@ sockaddr_in LoopbackAddress(int port) {
     return addr;
 }
 
+// A TCP socket for a listener on 127.0.0.1, closed on exec: the service runs rsync children,
+// which must not inherit its listeners. -1 (logged) on failure.
+int NewTcpSocket() {
+    int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
+    if (fd < 0) {
+        LogCallFailure(__LINE__, "socket");
+    }
+    return fd;
+}
+
+// Starts listening on the bound TCP socket `fd`; on failure the socket is closed (and the failure
+// logged) and false returned.
+bool ListenOrClose(int fd) {
+    if (::listen(fd, kBacklog) == 0) {
+        return true;
+    }
+    LogCallFailure(__LINE__, "listen");
+    IPCListener::CloseSocket(fd);
+    return false;
+}
+
 }  // namespace
 
 // --- IPCListener ---------------------------------------------------------------------------
@@ -56,10 +80,8 @@ void IPCListener::setTimeout(timeval timeout) {
 int IPCListener::prepare(int port) {
     // A listener already held is replaced; a domain one takes its socket file along.
     close();
-    // Close-on-exec: the service runs rsync children, which must not inherit its listeners.
-    int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
+    int fd = NewTcpSocket();
     if (fd < 0) {
-        LogCallFailure(__LINE__, "socket");
         return -1;
     }
     int bound = do_bind(fd, port);
@@ -69,9 +91,7 @@ int IPCListener::prepare(int port) {
         CloseSocket(fd);
         return -1;
     }
-    if (::listen(fd, kBacklog) != 0) {
-        LogCallFailure(__LINE__, "listen");
-        CloseSocket(fd);
+    if (!ListenOrClose(fd)) {
         return -1;
     }
     // The port the system really bound (it differs from the probed one only for port 0).
@@ -160,9 +180,8 @@ int IPCListener::OpenSocket(int port) {
     if (port < 1 || port > kMaxPort) {
         return -1;
     }
-    int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
+    int fd = NewTcpSocket();
     if (fd < 0) {
-        LogCallFailure(__LINE__, "socket");
         return -1;
     }
     sockaddr_in addr = LoopbackAddress(port);
@@ -171,9 +190,7 @@ int IPCListener::OpenSocket(int port) {
         CloseSocket(fd);
         return -1;
     }
-    if (::listen(fd, kBacklog) != 0) {
-        LogCallFailure(__LINE__, "listen");
-        CloseSocket(fd);
+    if (!ListenOrClose(fd)) {
         return -1;
     }
     Logger::LogMsg(Logger::Debug, "[DEBUG] s2s_ipc.cpp(%d): listening on port %d\n", __LINE__,

@@ -1,3 +1,5 @@
+// The messages of the status codes. The table is indexed by the code's absolute value, so its order
+// is the numbering itself: entries are only ever appended.
 #include "s2s_status.h"
 
 #include <cstdlib>

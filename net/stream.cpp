@@ -1,3 +1,6 @@
+// PStream: the tagged wire form of a PObject, written into and read from a Channel's rings, with
+// its debug trace (one line per tag and value, secrets masked) and the stream's history and
+// counters under the stream's own mutex.
 #include "s2s_stream.h"
 
 #include <linux/membarrier.h>

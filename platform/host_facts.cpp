@@ -29,7 +29,6 @@
 
 using S2S::Logger;
 using s2s_platform::Fail;
-using s2s_platform::Pairs;
 using s2s_platform::SectionDoc;
 using s2s_platform::Succeed;
 
@@ -224,11 +223,11 @@ bool ParseVolumeValue(const std::string& value, int& type, bool& directory) {
     return true;
 }
 
-}  // namespace
-
-extern "C" {
-
-int VLIBGetSerialNumber(char* buf, int size) {
+// The frame of a fact read from the host file into the caller's buffer: the buffer is checked
+// and emptied first, then `fill` gets the loaded file and gives the result. -1 when the file
+// cannot be loaded; running out of memory anywhere is VLIB_ERR_OUT_OF_MEMORY.
+template <typename Fill>
+int HostFactInto(char* buf, int size, Fill fill) {
     if (buf == nullptr || size <= 0) {
         return Fail(VLIB_ERR_BAD_PARAMETER);
     }
@@ -238,6 +237,18 @@ int VLIBGetSerialNumber(char* buf, int size) {
         if (LoadHostConf(doc) != 0) {
             return -1;
         }
+        return fill(doc);
+    } catch (const std::bad_alloc&) {
+        return Fail(VLIB_ERR_OUT_OF_MEMORY);
+    }
+}
+
+}  // namespace
+
+extern "C" {
+
+int VLIBGetSerialNumber(char* buf, int size) {
+    return HostFactInto(buf, size, [&](const SectionDoc& doc) {
         std::string serial = HostValue(doc, "serial");
         if (serial.empty()) {
             serial = DmiSerial();
@@ -256,10 +267,8 @@ int VLIBGetSerialNumber(char* buf, int size) {
         size_t n = std::min(serial.size(), static_cast<size_t>(size - 1));
         std::memcpy(buf, serial.data(), n);
         buf[n] = '\0';
-    } catch (const std::bad_alloc&) {
-        return Fail(VLIB_ERR_OUT_OF_MEMORY);
-    }
-    return Succeed(0);
+        return Succeed(0);
+    });
 }
 
 int VURNHAIsRunning(void) {
@@ -284,19 +293,9 @@ int VURNHAIsRunning(void) {
 }
 
 int VLIBGetModelClass(char* buf, int size) {
-    if (buf == nullptr || size <= 0) {
-        return Fail(VLIB_ERR_BAD_PARAMETER);
-    }
-    buf[0] = '\0';
-    try {
-        SectionDoc doc;
-        if (LoadHostConf(doc) != 0) {
-            return -1;
-        }
+    return HostFactInto(buf, size, [&](const SectionDoc& doc) {
         return s2s_platform::CopyOut(HostValue(doc, "model_class"), buf, size);
-    } catch (const std::bad_alloc&) {
-        return Fail(VLIB_ERR_OUT_OF_MEMORY);
-    }
+    });
 }
 
 int VLIBCIsPortBox(void) {

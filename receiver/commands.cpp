@@ -15,6 +15,7 @@
 
 #include "core/protocol.h"
 #include "host/pairing_store.h"
+#include "host/platform_records.h"
 #include "receiver/internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
@@ -57,14 +58,8 @@ using PairingStore::kMultiClientMarker;
 using PairingStore::ShareFields;
 using PairingStore::StoreContents;
 
-struct HashDeleter {
-    void operator()(VLIBSzHash* h) const { VLIBCSzHashFree(h); }
-};
-struct ListDeleter {
-    void operator()(VLIBSzList* l) const { VLIBCSzListFree(l); }
-};
-typedef std::unique_ptr<VLIBSzHash, HashDeleter> Hash;
-typedef std::unique_ptr<VLIBSzList, ListDeleter> List;
+using Hash = HashRecord;
+using List = ListRecord;
 
 bool HasControl(const std::string& s) {
     for (unsigned char c : s) {

@@ -37,6 +37,7 @@
 
 #include "core/protocol.h"
 #include "host/pairing_store.h"
+#include "host/platform_records.h"
 #include "receiver/internal.h"
 #include "rsync/child_process.h"
 #include "s2s_logger.h"
@@ -51,16 +52,6 @@ namespace {
 constexpr auto kStartWait = std::chrono::seconds(10);
 constexpr auto kStopWait = std::chrono::seconds(10);
 constexpr auto kKillWait = std::chrono::seconds(5);
-
-struct ListDeleter {
-    void operator()(VLIBSzList* l) const { VLIBCSzListFree(l); }
-};
-struct HashDeleter {
-    void operator()(VLIBSzHash* h) const { VLIBCSzHashFree(h); }
-};
-struct ShareDeleter {
-    void operator()(VURNShare* s) const { VURNShareFree(s); }
-};
 
 int Fail(std::string* error, const std::string& text) {
     Logger::LogMsg(Logger::Error, "[ERROR] receiver_daemon.cpp(%d): %s\n", __LINE__, text.c_str());
@@ -249,7 +240,7 @@ void ListenSettings(int* port, std::string* address) {
 }
 
 int SetEnabled(bool on) {
-    std::unique_ptr<VLIBSzHash, HashDeleter> h(VLIBCSzHashAlloc(2));
+    HashRecord h(VLIBCSzHashAlloc(2));
     VLIBSzHash* raw = h.release();
     int rc = VLIBCSzHashSetValue(&raw, "s2sEnabled", on ? "yes" : "no");
     h.reset(raw);
@@ -427,7 +418,7 @@ int ShareEncrypted(const std::string& name, bool* encrypted) {
     if (VURNShareGet(name.c_str(), &raw) < 0) {
         return VLIBCErrGet() == VLIB_ERR_NOT_FOUND ? 0 : -1;
     }
-    std::unique_ptr<VURNShare, ShareDeleter> share(raw);
+    ShareRecord share(raw);
     int value = 0;
     if (VLIBShareIsEncryptionGet(share.get(), &value) < 0) {
         return -1;
@@ -508,7 +499,7 @@ void TightenKeys(const std::string& dir, int depth) {
 int ShareModules(std::string* text, std::vector<std::string>* notes, std::string* error) {
     VLIBSzList* rawNames = VLIBCSzListAlloc(16);
     int count = VURNShareEnum(&rawNames);
-    std::unique_ptr<VLIBSzList, ListDeleter> names(rawNames);
+    ListRecord names(rawNames);
     if (count < 0 && VLIBCErrGet() != VLIB_ERR_FILE_NOT_FOUND) {
         return Fail(error, "cannot read the share registry");
     }
@@ -521,7 +512,7 @@ int ShareModules(std::string* text, std::vector<std::string>* notes, std::string
         if (VURNShareGet(name.c_str(), &raw) < 0) {
             return Fail(error, "cannot read the share " + name);
         }
-        std::unique_ptr<VURNShare, ShareDeleter> share(raw);
+        ShareRecord share(raw);
         std::string path = share->path;
         // A syncable name is also a literal value of the configuration (no quote, '%', control
         // character or outer blank), so only the path needs that check of its own.

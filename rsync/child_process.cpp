@@ -1,3 +1,6 @@
+// RunChild: fork and exec without a shell, the merged output pipe read line by line, the
+// cancel poll, and the stop of the child's whole process group (SIGTERM, then SIGKILL). Every
+// path reaps the child before returning: no zombie and no running member of the group is left.
 #include "rsync/child_process.h"
 
 #include <fcntl.h>

@@ -4,6 +4,7 @@
 #include <memory>
 #include <string>
 
+#include "host/platform_records.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_rsyncer.h"
@@ -11,11 +12,6 @@
 namespace S2S {
 
 namespace {
-
-struct ShareRecordFree {
-    void operator()(VURNShare* share) const { VURNShareFree(share); }
-};
-typedef std::unique_ptr<VURNShare, ShareRecordFree> ShareRecord;
 
 constexpr int kKeyPathSize = 4096;
 

@@ -1,5 +1,6 @@
-// Remote commands over rsync: the command files, the version query, pairing, the connection test
-// and the search for a reachable address, finishing a share's sync and the task's heartbeat.
+// Remote commands over rsync: the command files (and the string-list helpers that build and read
+// them), the version query, pairing, the connection test and the search for a reachable address,
+// finishing a share's sync and the task's heartbeat.
 #include <fstream>
 #include <list>
 #include <string>

@@ -1,3 +1,6 @@
+// RsyncTask: the rsync wrapper set up the way every run of the sync uses it (deletion, numeric
+// ids, the server's authentication and pseudo-root), and its two runs: a share's data transfer and
+// a custom-command run, each with its own time limit and the caller's cancel predicate.
 #include <boost/function.hpp>
 #include <list>
 #include <string>

@@ -23,10 +23,6 @@ namespace Backup {
 
 namespace {
 
-using S2S::Logger;
-using S2S::rsync_internal::ChildCommand;
-using S2S::rsync_internal::ChildOutcome;
-
 // Where the debug log of client runs goes, and the receiver's daemon configuration that a
 // one-shot daemon started over ssh reads (both below $S2S_ROOT when it is set).
 constexpr const char* kDefaultLogFile = "/var/log/s2s_rsync.log";
@@ -520,6 +516,12 @@ int RsyncWrapper::Impl::Run(ChildCommand& job, const boost::function<bool()>& ca
     return outcome.exit_code;
 }
 
+int RsyncWrapper::Impl::RefuseRun(const std::string& why) {
+    lastError = why;
+    Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__, why.c_str());
+    return kResultUsage;
+}
+
 int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     std::string why = CheckConnection();
     std::string target;
@@ -530,9 +532,7 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
         why = "no usable source path";
     }
     if (!why.empty()) {
-        lastError = why;
-        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__, why.c_str());
-        return kResultUsage;
+        return RefuseRun(why);
     }
 
     ChildCommand job;

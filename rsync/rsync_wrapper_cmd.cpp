@@ -21,8 +21,6 @@ namespace Backup {
 
 namespace {
 
-using S2S::Logger;
-using S2S::rsync_internal::ChildCommand;
 namespace reply = S2S::protocol;
 
 // A directory private to this run (mode 0700), removed with its content on every path.
@@ -167,9 +165,7 @@ int RsyncWrapper::Impl::ExecuteCommand(const boost::function<bool()>& cancel) {
         }
     }
     if (!why.empty()) {
-        lastError = why;
-        Logger::LogMsg(Logger::Error, "[ERROR] rsync_wrapper.cpp(%d): %s\n", __LINE__, why.c_str());
-        return kResultUsage;
+        return RefuseRun(why);
     }
 
     PrivateDir dir;

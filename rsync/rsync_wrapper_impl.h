@@ -9,10 +9,16 @@
 #include <vector>
 
 #include "rsync/child_process.h"
+#include "s2s_logger.h"
 #include "s2s_rsync_wrapper.h"
 
 namespace VURN {
 namespace Backup {
+
+// The names the wrapper's sources (transfer, commands, SSH login check) all use.
+using S2S::Logger;
+using S2S::rsync_internal::ChildCommand;
+using S2S::rsync_internal::ChildOutcome;
 
 struct RsyncWrapper::Impl {
     std::string src;
@@ -82,10 +88,12 @@ struct RsyncWrapper::Impl {
     // What a remembered check is filed under: login, server, port, configuration, identity.
     std::string SshLoginKey() const;
     // The password and the remote shell's password in the child's environment only.
-    void Environment(S2S::rsync_internal::ChildCommand* job) const;
+    void Environment(ChildCommand* job) const;
     // Runs rsync; keeps the last error lines; maps spawn failures and cancellation.
-    int Run(S2S::rsync_internal::ChildCommand& job, const boost::function<bool()>& cancel,
-            bool commandRun);
+    int Run(ChildCommand& job, const boost::function<bool()>& cancel, bool commandRun);
+    // A run refused before it started (settings that cannot make a safe command line): `why`
+    // becomes the last error and an ERROR line; kResultUsage.
+    int RefuseRun(const std::string& why);
 
     int ExecuteTransfer(const boost::function<bool()>& cancel);
     int ExecuteCommand(const boost::function<bool()>& cancel);

@@ -314,37 +314,61 @@ int DryRunSharePaths(Rsyncer& rsyncer, const std::string& shareName,
     return DryRun(rsyncer, shareName, list.File(), excludes, cancel, copy, result);
 }
 
-SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::string& shareName,
-                                   const std::list<std::string>& excludes,
-                                   const SourceGuardOptions& options, bool (*cancel)()) {
-    SourceGuardReport report;
+namespace {
+
+// Looks at the share's folder and volume. False, with `report` refusing the run, when they could
+// not be examined.
+bool Examine(Rsyncer& rsyncer, const std::string& shareName, SourceState& source,
+             SourceGuardReport& report) {
     ShareInfo info;
-    SourceState source;
     if (rsyncer.GetShareInfo(shareName, info) < 0 ||
         InspectShareSource(shareName, info, source) < 0) {
         report = Refuse(SourceGuardResult::kCheckFailed,
                         "share '" + shareName + "': its folder or volume could not be examined");
-    } else {
-        ReceiverCopy receiver;
-        int result = 0;
-        if (NeedsReceiverCopy(source, options) &&
-            (DryRunShareSync(rsyncer, shareName, excludes, cancel, receiver, result) < 0 ||
-             !receiver.known)) {
-            report = Refuse(
-                SourceGuardResult::kCheckFailed,
-                "share '" + shareName + "': the dry run that counts the receiver's files failed");
-            report.source = source;
-            report.dryRunResult = result;
-        } else {
-            report = JudgeShareSource(shareName, source, options, receiver);
-        }
+        return false;
     }
+    return true;
+}
+
+SourceGuardReport DryRunFailed(const std::string& shareName, int result) {
+    SourceGuardReport report =
+        Refuse(SourceGuardResult::kCheckFailed,
+               "share '" + shareName + "': the dry run that counts the receiver's files failed");
+    report.dryRunResult = result;
+    return report;
+}
+
+// Puts the verdict on the coming data run: its deletion limit, or no deletion at all when the
+// run is refused (the refusal is logged).
+SourceGuardReport Enforce(Rsyncer& rsyncer, const SourceGuardReport& report) {
     rsyncer.SetMaxDelete(report.result == SourceGuardResult::kSafe ? report.allowedDeletions : 0);
     if (report.result != SourceGuardResult::kSafe) {
         Logger::LogMsg(Logger::Warning, "[WARNING] source_guard.cpp(%d): %s\n", __LINE__,
                        report.message.c_str());
     }
     return report;
+}
+
+}  // namespace
+
+SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::string& shareName,
+                                   const std::list<std::string>& excludes,
+                                   const SourceGuardOptions& options, bool (*cancel)()) {
+    SourceGuardReport report;
+    SourceState source;
+    if (Examine(rsyncer, shareName, source, report)) {
+        ReceiverCopy receiver;
+        int result = 0;
+        if (NeedsReceiverCopy(source, options) &&
+            (DryRunShareSync(rsyncer, shareName, excludes, cancel, receiver, result) < 0 ||
+             !receiver.known)) {
+            report = DryRunFailed(shareName, result);
+            report.source = source;
+        } else {
+            report = JudgeShareSource(shareName, source, options, receiver);
+        }
+    }
+    return Enforce(rsyncer, report);
 }
 
 SourceGuardReport CheckChangedPaths(Rsyncer& rsyncer, const std::string& shareName,
@@ -354,12 +378,9 @@ SourceGuardReport CheckChangedPaths(Rsyncer& rsyncer, const std::string& shareNa
                                     bool& whole) {
     whole = false;
     SourceGuardReport report;
-    ShareInfo info;
     SourceState source;
-    if (rsyncer.GetShareInfo(shareName, info) < 0 ||
-        InspectShareSource(shareName, info, source) < 0) {
-        report = Refuse(SourceGuardResult::kCheckFailed,
-                        "share '" + shareName + "': its folder or volume could not be examined");
+    if (!Examine(rsyncer, shareName, source, report)) {
+        // the report refuses the run
     } else if (!source.folderExists || !source.volumeMounted) {
         report = JudgeShareSource(shareName, source, options, ReceiverCopy());
     } else if (source.folderEmpty) {
@@ -371,10 +392,7 @@ SourceGuardReport CheckChangedPaths(Rsyncer& rsyncer, const std::string& shareNa
         int result = 0;
         if (DryRunSharePaths(rsyncer, shareName, paths, excludes, cancel, receiver, result) < 0 ||
             !receiver.known) {
-            report = Refuse(
-                SourceGuardResult::kCheckFailed,
-                "share '" + shareName + "': the dry run that counts the receiver's files failed");
-            report.dryRunResult = result;
+            report = DryRunFailed(shareName, result);
         } else if (receiver.deletions > 0 && options.maxDelete.percent) {
             whole = true;  // a share of the whole copy: only the whole share's dry run counts it
             return report;
@@ -399,12 +417,7 @@ SourceGuardReport CheckChangedPaths(Rsyncer& rsyncer, const std::string& shareNa
         report.allowedDeletions = gone;
     }
     report.source = source;
-    rsyncer.SetMaxDelete(report.result == SourceGuardResult::kSafe ? report.allowedDeletions : 0);
-    if (report.result != SourceGuardResult::kSafe) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] source_guard.cpp(%d): %s\n", __LINE__,
-                       report.message.c_str());
-    }
-    return report;
+    return Enforce(rsyncer, report);
 }
 
 }  // namespace S2S

@@ -19,9 +19,6 @@ namespace Backup {
 
 namespace {
 
-using S2S::Logger;
-using S2S::rsync_internal::ChildCommand;
-using S2S::rsync_internal::ChildOutcome;
 using Clock = std::chrono::steady_clock;
 
 constexpr const char kReadable[] = "s2s-config-readable";

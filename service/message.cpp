@@ -12,14 +12,7 @@ namespace s2sd {
 
 namespace {
 
-enum : unsigned char {
-    kNull = 0x00,
-    kInteger = 0x01,
-    kString = 0x10,
-    kEnd = 0x40,
-    kArray = 0x41,
-    kMap = 0x42,
-};
+using S2S::PStream;  // its tags are the wire's
 
 // A channel that reads from bytes already received. PStream reads a channel of another type
 // through its virtual operations, so these are all it needs.
@@ -96,28 +89,28 @@ Scan ScanMessage(const std::string& bytes, size_t max_depth, size_t& length) {
         }
         const unsigned char tag = static_cast<unsigned char>(bytes[pos++]);
         const bool key = !open.empty() && open.back().map && open.back().key_next;
-        if (tag == kEnd) {
+        if (tag == PStream::kTagEnd) {
             // Closes an array, or a map between entries; anywhere else a value was missing.
             if (open.empty() || (open.back().map && !key)) {
                 return Scan::kMalformed;
             }
             open.pop_back();
-        } else if (key && tag != kString) {
+        } else if (key && tag != PStream::kTagString) {
             return Scan::kMalformed;
-        } else if (tag == kArray || tag == kMap) {
+        } else if (tag == PStream::kTagArray || tag == PStream::kTagMap) {
             if (open.size() >= max_depth) {
                 return Scan::kTooDeep;
             }
-            open.push_back(Frame{tag == kMap, true});
+            open.push_back(Frame{tag == PStream::kTagMap, true});
             continue;
-        } else if (tag == kNull) {
+        } else if (tag == PStream::kTagNull) {
             if (pos >= size) {
                 return Scan::kIncomplete;
             }
             if (bytes[pos++] != 0) {
                 return Scan::kMalformed;
             }
-        } else if (tag == kInteger) {
+        } else if (tag == PStream::kTagInteger) {
             if (pos >= size) {
                 return Scan::kIncomplete;
             }
@@ -126,7 +119,7 @@ Scan ScanMessage(const std::string& bytes, size_t max_depth, size_t& length) {
                 return Scan::kMalformed;
             }
             pos += n;
-        } else if (tag == kString) {
+        } else if (tag == PStream::kTagString) {
             if (pos + 2 > size) {
                 return Scan::kIncomplete;
             }
@@ -145,7 +138,7 @@ Scan ScanMessage(const std::string& bytes, size_t max_depth, size_t& length) {
         }
         // A key is followed by its value; a finished value in a map by the next key.
         if (open.back().map) {
-            open.back().key_next = !(key && tag == kString);
+            open.back().key_next = !(key && tag == PStream::kTagString);
         }
     }
 }

@@ -25,6 +25,8 @@ using S2S::PObject;
 namespace {
 
 const char kPausedSetting[] = "paused";
+// The busy answer of the commands that change a task: they never touch one that runs.
+const char kCancelFirst[] = "is running; cancel it first";
 constexpr S2S::SCHD_MODE kManual = S2S::SCHD_MODE(0);
 constexpr S2S::SCHD_MODE kRealtime = S2S::SCHD_MODE(1);
 
@@ -940,13 +942,8 @@ void Service::CmdUpdate(const PObject& request, PObject& reply) {
     bool realtime_change = false;
     {
         std::lock_guard<std::mutex> lock(mutex_);
-        TaskState* found = FindTask(id, reply);
+        TaskState* found = FindTask(id, reply, kCancelFirst);
         if (found == nullptr) {
-            return;
-        }
-        if (found->running) {
-            SetStatus(reply, Control::kBusy,
-                      "task " + std::to_string(id) + " is running; cancel it first");
             return;
         }
         // Guard options the map leaves out stay as they are.
@@ -981,29 +978,37 @@ void Service::CmdUpdate(const PObject& request, PObject& reply) {
     reply[Control::kKeyTaskId] = id;
 }
 
-Service::TaskState* Service::FindTask(uint64_t id, PObject& reply) {
+Service::TaskState* Service::FindTask(uint64_t id, PObject& reply, const char* busy) {
     const auto it = tasks_.find(id);
     if (it == tasks_.end()) {
         SetStatus(reply, Control::kNoSuchTask, "no task " + std::to_string(id));
         return nullptr;
     }
+    if (busy != nullptr && it->second->running) {
+        SetStatus(reply, Control::kBusy, "task " + std::to_string(id) + " " + busy);
+        return nullptr;
+    }
     return it->second.get();
+}
+
+std::unique_lock<std::mutex> Service::LockTask(const PObject& request, PObject& reply,
+                                               unsigned long long& id, TaskState*& task,
+                                               const char* busy) {
+    task = nullptr;
+    if (!RequiredInteger(request, Control::kKeyTaskId, id, reply)) {
+        return std::unique_lock<std::mutex>();
+    }
+    std::unique_lock<std::mutex> lock(mutex_);
+    task = FindTask(id, reply, busy);
+    return lock;
 }
 
 void Service::CmdRemove(const PObject& request, PObject& reply) {
     unsigned long long id = 0;
-    if (!RequiredInteger(request, Control::kKeyTaskId, id, reply)) {
-        return;
-    }
     {
-        std::lock_guard<std::mutex> lock(mutex_);
-        TaskState* found = FindTask(id, reply);
+        TaskState* found = nullptr;
+        const auto lock = LockTask(request, reply, id, found, kCancelFirst);
         if (found == nullptr) {
-            return;
-        }
-        if (found->running) {
-            SetStatus(reply, Control::kBusy,
-                      "task " + std::to_string(id) + " is running; cancel it first");
             return;
         }
         std::string error;
@@ -1049,11 +1054,8 @@ void Service::CmdList(const PObject&, PObject& reply) {
 
 void Service::CmdShow(const PObject& request, PObject& reply) {
     unsigned long long id = 0;
-    if (!RequiredInteger(request, Control::kKeyTaskId, id, reply)) {
-        return;
-    }
-    std::lock_guard<std::mutex> lock(mutex_);
-    TaskState* found = FindTask(id, reply);
+    TaskState* found = nullptr;
+    const auto lock = LockTask(request, reply, id, found);
     if (found == nullptr) {
         return;
     }
@@ -1062,16 +1064,9 @@ void Service::CmdShow(const PObject& request, PObject& reply) {
 
 void Service::CmdRun(const PObject& request, PObject& reply) {
     unsigned long long id = 0;
-    if (!RequiredInteger(request, Control::kKeyTaskId, id, reply)) {
-        return;
-    }
-    std::lock_guard<std::mutex> lock(mutex_);
-    TaskState* found = FindTask(id, reply);
+    TaskState* found = nullptr;
+    const auto lock = LockTask(request, reply, id, found, "is running already");
     if (found == nullptr) {
-        return;
-    }
-    if (found->running) {
-        SetStatus(reply, Control::kBusy, "task " + std::to_string(id) + " is running already");
         return;
     }
     Queue(id, Job::All(), "asked to run now");
@@ -1079,11 +1074,8 @@ void Service::CmdRun(const PObject& request, PObject& reply) {
 
 void Service::CmdCancel(const PObject& request, PObject& reply) {
     unsigned long long id = 0;
-    if (!RequiredInteger(request, Control::kKeyTaskId, id, reply)) {
-        return;
-    }
-    std::lock_guard<std::mutex> lock(mutex_);
-    TaskState* found = FindTask(id, reply);
+    TaskState* found = nullptr;
+    const auto lock = LockTask(request, reply, id, found);
     if (found == nullptr) {
         return;
     }

@@ -79,8 +79,16 @@ class Service {
     void RunThread(uint64_t id, S2S::SyncTask task, S2S::SourceGuardOptions guard, const Job& job,
                    const S2S::KnownServer& known, std::shared_ptr<std::atomic<bool>> cancel);
     void Reap();
-    // The task `id`, or null with the reply set to no-such-task. Holds no lock: call with mutex_.
-    TaskState* FindTask(uint64_t id, S2S::PObject& reply);
+    // The task `id`, or null with the reply set to no-such-task. With `busy` given, a running
+    // task is refused too: null, the reply set to busy with "task <id> " and `busy`. Holds no
+    // lock: call with mutex_.
+    TaskState* FindTask(uint64_t id, S2S::PObject& reply, const char* busy = nullptr);
+    // The prologue of the commands that name their task by a required task_id: reads the id,
+    // takes mutex_ and finds the task as FindTask does. `task` is null when the reply says why;
+    // otherwise the returned lock holds mutex_.
+    std::unique_lock<std::mutex> LockTask(const S2S::PObject& request, S2S::PObject& reply,
+                                          unsigned long long& id, TaskState*& task,
+                                          const char* busy = nullptr);
     S2S::PObject TaskMap(const TaskState& state) const;
     S2S::PObject StatusMap(const TaskState& state) const;
 

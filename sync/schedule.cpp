@@ -11,32 +11,11 @@
 
 #include "s2s_logger.h"
 #include "s2s_sync_obj.h"
+#include "sync/message_lines.h"
 
 namespace S2S {
 
 namespace {
-
-// The line numbers in these messages are part of the messages (log readers match on them), so
-// they are fixed here rather than taken from __LINE__.
-constexpr int kLineNoWeekday = 87;
-constexpr int kLineUnknownMode = 93;
-constexpr int kLineAlignFailed = 117;
-constexpr int kLineReferenceSeconds = 128;
-constexpr int kLinePastScheduled = 139;
-constexpr int kLinePastWeekly = 156;
-constexpr int kLinePastUnsupported = 160;
-constexpr int kLineDaySeconds = 209;
-constexpr int kLineBadHour = 325;
-constexpr int kLineBadMinute = 329;
-constexpr int kLineBadPeriod = 334;
-constexpr int kLineBadRepeat = 340;
-constexpr int kLineRepeatPastDay = 346;
-constexpr int kLineBadBegin = 359;
-constexpr int kLineBadBeginFields = 367;
-constexpr int kLineBadBeginDate = 375;
-constexpr int kLineWeekLength = 381;
-constexpr int kLineNoWeekdayChosen = 391;
-constexpr int kLineBadMode = 405;
 
 constexpr unsigned kLastSecondOfDay = 86399;
 constexpr unsigned kMaxRepeats = 95;

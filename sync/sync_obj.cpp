@@ -1,16 +1,11 @@
 // The sync model's value classes: event paths, server info validation, task copies.
 #include "s2s_logger.h"
 #include "s2s_sync_obj.h"
+#include "sync/message_lines.h"
 
 namespace S2S {
 
 namespace {
-
-// The line numbers in the NOTE messages are part of the messages: log readers and scripts match
-// on them, so they stay fixed whatever this file looks like.
-constexpr int kLineEmptyServer = 610;
-constexpr int kLineEmptyUser = 615;
-constexpr int kLineBadSSHPort = 620;
 
 constexpr unsigned kMaxPort = 65535;
 

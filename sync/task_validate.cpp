@@ -3,17 +3,9 @@
 #include "s2s_host.h"
 #include "s2s_logger.h"
 #include "s2s_sync_obj.h"
+#include "sync/message_lines.h"
 
 namespace S2S {
-
-namespace {
-
-// Fixed line numbers of the NOTE messages (see sync_obj.cpp).
-constexpr int kLineEmptyName = 756;
-constexpr int kLineEmptyShares = 761;
-constexpr int kLineInvalidShare = 770;
-
-}  // namespace
 
 bool TaskInfo::Validate() const {
     if (!sync_info_.Validate()) {

@@ -20,31 +20,23 @@
 # identical, 1 otherwise.
 set -euo pipefail
 cd "$(dirname "$0")/.."
-repo=$(pwd)
-build=${S2S_BUILD_DIR:-build}
+source tools/lib.sh
+s2s_locate_build
 
 if [ -z "${S2S_DEMO_INSIDE:-}" ]; then
-  if [ "$(id -u)" -ne 0 ]; then
-    echo "demo: run as root (it starts an rsync daemon and an SSH server in private namespaces)" >&2
-    exit 1
-  fi
+  s2s_require_root demo "it starts an rsync daemon and an SSH server in private namespaces"
   bash tools/deps.sh
   echo "== building (incremental)"
-  cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
-  cmake --build "$build" -j "$(nproc)" --target s2s_cli s2s-receiver s2sd
+  s2s_build s2s_cli s2s-receiver s2sd
   exec unshare --net --mount --propagation private -- env S2S_DEMO_INSIDE=1 bash "$0" "$@"
 fi
 
-case $build in /*) bin=$build/bin ;; *) bin=$repo/$build/bin ;; esac
 user=demo
-password=$(head -c 18 /dev/urandom | base64 | tr -d '/+=')
+password=$(s2s_random_password)
 ssh_port=2222
 started=$(date +%s.%N)
 
-ip link set lo up
-work=$(mktemp -d /tmp/s2s-demo.XXXXXX)
-sender=$work/sender
-receiver=$work/receiver
+s2s_stage s2s-demo
 sshd_pid=
 s2sd_pid=
 
@@ -72,10 +64,9 @@ trap 'exit 130' INT TERM
 
 # --- two servers ---------------------------------------------------------------------------------
 make_host() {  # root serial
-  mkdir -p "$1/etc/s2s" "$1/tmp/S2S" "$1/volume1" "$1/usr/vurn/etc/.encrypt"
+  s2s_make_host "$1" "$2"
+  mkdir -p "$1/tmp/S2S" "$1/usr/vurn/etc/.encrypt"
   chmod 700 "$1/tmp/S2S"
-  printf '[host]\n\tserial="%s"\n[volumes]\n\t%s="internal,directory"\n' "$2" "$1/volume1" \
-    >"$1/etc/s2s/host.conf"
 }
 make_host "$sender" "SN-DEMO-SENDER"
 make_host "$receiver" "SN-DEMO-RECEIVER"
@@ -91,9 +82,7 @@ head -c 32 /dev/urandom >"$sender/keys/vault.key"
 chmod 600 "$sender/keys/vault.key"
 
 echo "== receiver: rsync daemon on 127.0.0.1:873 (private network)"
-printf '%s\n' "$password" |
-  S2S_ROOT=$receiver "$bin/s2s-receiver" configure --user "$user" --port 873 --address 127.0.0.1
-S2S_ROOT=$receiver "$bin/s2s-receiver" start
+s2s_start_receiver "$receiver" "$user" "$password"
 
 # --- the SSH server that carries encryption keys -------------------------------------------------
 # Keys always travel over SSH. The SSH server sees a demo account (an alias of root with the demo
@@ -173,7 +162,7 @@ cat >"$task" <<EOF
 }
 EOF
 password_file=$work/password
-(umask 077 && printf '%s\n' "$password" >"$password_file")
+s2s_password_file "$password_file" "$password"
 
 # Reads a top-level number from a JSON summary (the tool prints one key per line).
 field() { sed -n "s/^  \"$2\": \([0-9.]*\),\{0,1\}$/\1/p" "$1"; }

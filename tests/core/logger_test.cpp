@@ -36,18 +36,14 @@ class LoggerTest : public ::testing::Test {
   protected:
     void SetUp() override { Reset(); }
     void TearDown() override {
-        if (Logger::log_fp != nullptr && Logger::log_fp != stdout && Logger::log_fp != stderr) {
-            std::fclose(Logger::log_fp);
+        if (Logger::log_type == Logger::File) {
+            Logger::Destroy();  // closes the test's log file
         }
         Reset();
     }
     static void Reset() {
-        Logger::log_level = 3;
-        Logger::log_size = -1;
+        Logger::Initialize(Logger::Syslog, 3, "", 0);  // no stream
         Logger::rotate_cnt = 50;
-        Logger::log_type = Logger::Syslog;
-        Logger::log_fp = nullptr;
-        Logger::log_path.clear();
         g_syslog.clear();
     }
     s2s_test::TempDir dir_{"s2s-logger"};
@@ -83,8 +79,11 @@ TEST_F(LoggerTest, FileKindNeedsAPath) {
     EXPECT_EQ(Logger::Initialize(Logger::File, 7, "", 5), -1);
     EXPECT_EQ(Logger::log_type, Logger::File);
     EXPECT_EQ(Logger::log_level, 7);
-    EXPECT_EQ(Logger::log_fp, nullptr);
+    ::testing::internal::CaptureStdout();
+    ::testing::internal::CaptureStderr();
     Logger::LogMsg(Logger::Error, "[ERROR] x.cpp(%d): nowhere\n", 1);  // dropped, no crash
+    EXPECT_EQ(::testing::internal::GetCapturedStdout(), "");
+    EXPECT_EQ(::testing::internal::GetCapturedStderr(), "");
     EXPECT_TRUE(g_syslog.empty());
 
     EXPECT_EQ(Logger::Initialize(Logger::File, 7, dir_ / "missing/dir/log", 5), -1);
@@ -159,15 +158,31 @@ TEST_F(LoggerTest, FailedReopenSilencesFileLogging) {
         ASSERT_EQ(unlink(path.c_str()), 0);
     }
     EXPECT_EQ(Logger::Rotate(), -1);
-    EXPECT_EQ(Logger::log_fp, nullptr);
     Logger::LogMsg(Logger::Error, "[ERROR] x.cpp(%d): lost\n", 1);
+    EXPECT_EQ(s2s_test::ReadFile(path).find("lost"), std::string::npos);
     chmod(sub.c_str(), 0700);
+}
+
+TEST_F(LoggerTest, ReopenStartsAFreshFileAtThePathAfterItWasMoved) {
+    std::string path = dir_ / "s2s.log";
+    EXPECT_EQ(Logger::Reopen(0640), -1);  // not in file mode
+    ASSERT_EQ(Logger::Initialize(Logger::File, 3, path, 5), 0);
+    Logger::LogMsg(Logger::Error, "[ERROR] x.cpp(%d): before\n", 1);
+    ASSERT_EQ(rename(path.c_str(), (path + ".old").c_str()), 0);
+    ASSERT_EQ(Logger::Reopen(0640), 0);
+    EXPECT_EQ(Logger::log_size, 0);
+    Logger::LogMsg(Logger::Error, "[ERROR] x.cpp(%d): after\n", 2);
+    EXPECT_NE(s2s_test::ReadFile(path + ".old").find("before"), std::string::npos);
+    EXPECT_EQ(s2s_test::ReadFile(path).find("before"), std::string::npos);
+    EXPECT_NE(s2s_test::ReadFile(path).find("after"), std::string::npos);
+    struct stat st;
+    ASSERT_EQ(stat(path.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0640u);
 }
 
 TEST_F(LoggerTest, DestroyFallsBackToStandardOutput) {
     ASSERT_EQ(Logger::Initialize(Logger::File, 7, dir_ / "s2s.log", 9), 0);
     Logger::Destroy();
-    EXPECT_EQ(Logger::log_fp, stdout);
     EXPECT_EQ(Logger::log_type, Logger::Stderr);
     EXPECT_EQ(Logger::log_level, 3);
     EXPECT_EQ(Logger::log_size, -1);

@@ -8,6 +8,7 @@
 #include "tools/s2s/exit_codes.h"
 #include "tools/s2s/options.h"
 #include "tools/s2s/progress.h"
+#include "tools/s2s/service_view.h"
 #include "tools/s2s/task_file.h"
 
 namespace s2s_cli {
@@ -147,12 +148,7 @@ bool ParseNow(const std::string& text, long& now, bool& skipped) {
 }
 
 std::string LocalTime(long seconds) {
-    const time_t t = static_cast<time_t>(seconds);
-    struct tm tm = {};
-    localtime_r(&t, &tm);
-    char text[64];
-    strftime(text, sizeof(text), "%a %Y-%m-%d %H:%M:%S %Z", &tm);
-    return text;
+    return LocalTimeText(seconds, "%a %Y-%m-%d %H:%M:%S %Z");
 }
 
 // Builds the schedule from the options; false with `error` on a value that does not parse.

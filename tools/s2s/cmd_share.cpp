@@ -6,6 +6,7 @@
 #include <memory>
 #include <nlohmann/json.hpp>
 
+#include "host/platform_records.h"
 #include "s2s_platform.h"
 #include "tools/s2s/commands.h"
 #include "tools/s2s/exit_codes.h"
@@ -15,18 +16,9 @@ namespace s2s_cli {
 
 namespace {
 
-struct HashDeleter {
-    void operator()(VLIBSzHash* hash) const { VLIBCSzHashFree(hash); }
-};
-struct ListDeleter {
-    void operator()(VLIBSzList* list) const { VLIBCSzListFree(list); }
-};
-struct ShareDeleter {
-    void operator()(VURNShare* share) const { VURNShareFree(share); }
-};
-using HashPtr = std::unique_ptr<VLIBSzHash, HashDeleter>;
-using ListPtr = std::unique_ptr<VLIBSzList, ListDeleter>;
-using SharePtr = std::unique_ptr<VURNShare, ShareDeleter>;
+using HashPtr = S2S::HashRecord;
+using ListPtr = S2S::ListRecord;
+using SharePtr = S2S::ShareRecord;
 
 const char kShareHelp[] =
     "Usage: s2s share add NAME --path DIR [OPTIONS]\n"

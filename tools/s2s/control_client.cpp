@@ -1,3 +1,6 @@
+// `s2s` asking the sync service: one request over the control socket, a reply or a message that
+// says why there is none (service not running, no access to the socket), and the exit code a
+// control status maps to.
 #include "tools/s2s/control_client.h"
 
 #include <sys/socket.h>

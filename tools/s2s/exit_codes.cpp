@@ -1,3 +1,5 @@
+// The names and meanings of the exit codes of `s2s`, and the readable names of remote result codes
+// in its output. One table row per exit code; the numbers themselves live in exit_codes.h.
 #include "tools/s2s/exit_codes.h"
 
 #include "s2s_task_run.h"

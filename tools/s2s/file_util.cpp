@@ -1,3 +1,5 @@
+// Opening a file for reading only when it is a regular file (the open never blocks on a FIFO or a
+// device), and a whole-file read that stops at a size limit instead of growing without bound.
 #include "tools/s2s/file_util.h"
 
 #include <fcntl.h>

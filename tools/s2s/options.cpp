@@ -1,3 +1,5 @@
+// The parsed options of a command (Options) and the strict unsigned-number parse that the option
+// checks use: digits only, no sign, no blanks, no overflow.
 #include "tools/s2s/options.h"
 
 namespace s2s_cli {

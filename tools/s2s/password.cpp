@@ -1,3 +1,6 @@
+// Loading the sync password: the first line of a file (or of standard input), where a file other
+// users can read is refused, or else the environment, whose variable is then removed so no child
+// inherits it. The copy read from a file is wiped before it is freed.
 #include "tools/s2s/password.h"
 
 #include <algorithm>

@@ -1,3 +1,5 @@
+// ProgressBar: the rate and time-left arithmetic, the human-readable sizes and durations, and the
+// drawing (redrawn in place on a terminal, plain periodic lines elsewhere).
 #include "tools/s2s/progress.h"
 
 #include <algorithm>

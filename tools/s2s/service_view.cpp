@@ -1,3 +1,5 @@
+// The tables and texts `s2s` prints from the sync service's replies: aligned columns, local times,
+// and "-" for a key the reply does not carry.
 #include "tools/s2s/service_view.h"
 
 #include <ctime>
@@ -121,11 +123,15 @@ std::string FormatLocalTime(unsigned long long epoch) {
     if (epoch == 0) {
         return "-";
     }
+    return LocalTimeText(static_cast<long long>(epoch), "%a %Y-%m-%d %H:%M:%S");
+}
+
+std::string LocalTimeText(long long epoch, const char* format) {
     const time_t t = static_cast<time_t>(epoch);
     struct tm tm = {};
     localtime_r(&t, &tm);
     char text[64];
-    strftime(text, sizeof(text), "%a %Y-%m-%d %H:%M:%S", &tm);
+    strftime(text, sizeof(text), format, &tm);
     return text;
 }
 

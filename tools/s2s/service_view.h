@@ -12,6 +12,8 @@ namespace s2s_cli {
 
 // "Mon 2026-11-23 02:00:00" in local time; "-" for 0 (no time).
 std::string FormatLocalTime(unsigned long long epoch);
+// `epoch` in the local time zone, written with strftime's `format`.
+std::string LocalTimeText(long long epoch, const char* format);
 // A task's id in a reply map: "task_id", or the task map's own "id".
 unsigned long long TaskIdOf(const S2S::PObject& task);
 

@@ -1,3 +1,6 @@
+// Task files in JSON: the strict reader (known keys only, each with its type and range) that
+// turns a file into the sync model's task map, and the writer that turns a task map back into
+// JSON.
 #include "tools/s2s/task_file.h"
 
 #include <climits>

@@ -55,25 +55,16 @@ void OnHangup(int) {
     }
 }
 
-// Opens the log file anew at its path, under the logger's own lock so no line is lost or torn.
+// Opens the log file anew at its path; the logger swaps it in under its own lock, so no line is
+// lost or torn.
 void ReopenLog() {
     if (g_log_path.empty()) {
         return;
     }
-    FILE* fresh = std::fopen(g_log_path.c_str(), "a");
-    if (fresh == nullptr) {
+    if (S2S::Logger::Reopen(0640) != 0) {
         S2S::Logger::LogMsg(S2S::Logger::Error, "[ERROR] s2sd(%d): cannot reopen %s: %s\n",
                             __LINE__, g_log_path.c_str(), std::strerror(errno));
         return;
-    }
-    fchmod(fileno(fresh), 0640);
-    pthread_mutex_lock(&S2S::Logger::log_mutex);
-    FILE* old = S2S::Logger::log_fp;
-    S2S::Logger::log_fp = fresh;
-    S2S::Logger::log_size = 0;
-    pthread_mutex_unlock(&S2S::Logger::log_mutex);
-    if (old != nullptr && old != stdout && old != stderr) {
-        std::fclose(old);
     }
     S2S::Logger::LogMsg(S2S::Logger::Note, "[NOTE] s2sd(%d): log reopened\n", __LINE__);
 }
