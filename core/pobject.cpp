@@ -1,10 +1,17 @@
-// PObject: storage, access, copying, printing and release of the library's dynamic value.
+// PObject: storage, access, copying, printing and release of the library's dynamic value, and
+// the arena that decoded messages are built in.
 #include "s2s_pobject.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <iterator>
+#include <memory>
+#include <new>
 #include <stdexcept>
+#include <tuple>
 #include <utility>
+
+#include "core/pobject_storage.h"
 
 namespace S2S {
 
@@ -12,7 +19,181 @@ namespace {
 
 const char kIndexError[] = "out_of_range: PObject::operator[]";
 
+// A message's first chunk holds a small request whole; later chunks double up to the cap.
+constexpr size_t kFirstChunk = 4096;
+constexpr size_t kMaxChunk = 64 * 1024;  // below the allocator's mmap threshold
+
+size_t RoundUp8(size_t size) {
+    return (size + 7) & ~size_t{7};
+}
+
+void* AllocateBlock(Arena* arena, size_t size) {
+    return arena != nullptr ? arena->Allocate(size) : ::operator new(size);
+}
+
+// Releases of arena blocks are added up and handed to the arena together.
+class Releaser {
+  public:
+    Releaser() = default;
+    Releaser(const Releaser&) = delete;
+    Releaser& operator=(const Releaser&) = delete;
+    ~Releaser() { Flush(); }
+    void Free(void* block, Arena* arena) {
+        if (arena == nullptr) {
+            ::operator delete(block);
+            return;
+        }
+        if (arena != arena_) {
+            Flush();
+            arena_ = arena;
+        }
+        ++count_;
+    }
+
+  private:
+    void Flush() {
+        if (arena_ != nullptr) {
+            arena_->Release(count_);
+        }
+        arena_ = nullptr;
+        count_ = 0;
+    }
+    Arena* arena_ = nullptr;
+    size_t count_ = 0;
+};
+
+const FlatEntry* FindFlat(const FlatMap& flat, const std::string& key) {
+    const FlatEntry* entries = flat.entries();
+    size_t low = 0;
+    size_t high = flat.count;
+    while (low < high) {
+        size_t mid = low + (high - low) / 2;
+        int order = CompareKeys(flat.key(static_cast<uint32_t>(mid)), entries[mid].key_size,
+                                key.data(), key.size());
+        if (order == 0) {
+            return &entries[mid];
+        }
+        if (order < 0) {
+            low = mid + 1;
+        } else {
+            high = mid;
+        }
+    }
+    return nullptr;
+}
+
 }  // namespace
+
+// --- Arena -------------------------------------------------------------------------------------
+
+Arena* Arena::Create() {
+    // The arena lives at the start of its own first chunk.
+    void* raw = ::operator new(kFirstChunk);
+    Chunk* chunk = static_cast<Chunk*>(raw);
+    chunk->next = nullptr;
+    Arena* arena = new (static_cast<char*>(raw) + sizeof(Chunk)) Arena();
+    arena->chunks_ = chunk;
+    arena->cursor_ = static_cast<char*>(raw) + RoundUp8(sizeof(Chunk) + sizeof(Arena));
+    arena->limit_ = static_cast<char*>(raw) + kFirstChunk;
+    arena->next_size_ = kFirstChunk * 2;
+    return arena;
+}
+
+void* Arena::Allocate(size_t size) {
+    size = RoundUp8(size);
+    if (size > static_cast<size_t>(limit_ - cursor_)) {
+        Grow(size);
+    }
+    void* at = cursor_;
+    cursor_ += size;
+    ++allocated_;
+    return at;
+}
+
+void Arena::Grow(size_t size) {
+    size_t chunk_size = std::max(next_size_, sizeof(Chunk) + size);
+    next_size_ = std::min(next_size_ * 2, kMaxChunk);
+    void* raw = ::operator new(chunk_size);
+    Chunk* chunk = static_cast<Chunk*>(raw);
+    chunk->next = chunks_;
+    chunks_ = chunk;
+    cursor_ = static_cast<char*>(raw) + sizeof(Chunk);
+    limit_ = static_cast<char*>(raw) + chunk_size;
+}
+
+void Arena::Finish() {
+    live_.fetch_add(allocated_, std::memory_order_relaxed);
+    Release(kCreatorHold);
+}
+
+void Arena::Release(size_t blocks) {
+    if (live_.fetch_sub(blocks, std::memory_order_acq_rel) == blocks) {
+        Destroy();
+    }
+}
+
+void Arena::Destroy() {
+    Chunk* chunk = chunks_;
+    this->~Arena();  // the first chunk, which holds the arena, is the last of the list
+    while (chunk != nullptr) {
+        Chunk* next = chunk->next;
+        ::operator delete(chunk);
+        chunk = next;
+    }
+}
+
+// --- Storage forms -----------------------------------------------------------------------------
+
+TextBlock* PObjectAccess::NewText(Arena* arena, const char* data, size_t size) {
+    // One byte more: the text is NUL-terminated for log lines.
+    void* raw = AllocateBlock(arena, sizeof(TextBlock) + size + 1);
+    TextBlock* text = new (raw) TextBlock{arena, size};
+    if (size > 0) {
+        std::memcpy(text->data(), data, size);
+    }
+    text->data()[size] = '\0';
+    return text;
+}
+
+void PObjectAccess::AssignText(PObject& o, Arena* arena, const char* data, size_t size) {
+    TextBlock* text = NewText(arena, data, size);  // `data` may live inside `o`
+    o.clear();
+    o.type_ = PObject::kString;
+    o.payload_ = text;
+}
+
+FlatMap* PObjectAccess::NewFlat(Arena* arena, uint32_t count, uint32_t key_bytes) {
+    void* raw = AllocateBlock(arena, sizeof(FlatMap) + count * sizeof(FlatEntry) + key_bytes);
+    FlatMap* flat = new (raw) FlatMap{arena, count, key_bytes};
+    FlatEntry* entries = flat->entries();
+    for (uint32_t i = 0; i < count; ++i) {
+        new (&entries[i]) FlatEntry{PObject(), 0, 0};
+    }
+    return flat;
+}
+
+void PObjectAccess::AssignFlat(PObject& o, FlatMap* flat) {
+    o.clear();
+    o.type_ = PObject::kMap;
+    o.payload_ = flat == nullptr ? nullptr : reinterpret_cast<char*>(flat) + 1;
+}
+
+PObject::Map& PObjectAccess::Materialise(PObject& o) {
+    FlatMap& flat = Flat(o);
+    auto map = std::make_unique<PObject::Map>();
+    FlatEntry* entries = flat.entries();
+    for (uint32_t i = 0; i < flat.count; ++i) {
+        map->emplace_hint(map->end(), std::piecewise_construct,
+                          std::forward_as_tuple(flat.key(i), entries[i].key_size),
+                          std::forward_as_tuple(std::move(entries[i].value)));
+    }
+    for (uint32_t i = 0; i < flat.count; ++i) {
+        entries[i].~FlatEntry();  // values moved out: nothing left to release
+    }
+    Releaser().Free(&flat, flat.arena);
+    o.payload_ = map.release();
+    return *static_cast<PObject::Map*>(o.payload_);
+}
 
 PObject::PObject(unsigned long long value) {
     copy(value);
@@ -88,11 +269,13 @@ bool PObject::isEmpty() const {
         case kNull:
             return true;
         case kString:
-            return static_cast<const std::string*>(payload_)->empty();
+            return static_cast<const TextBlock*>(payload_)->size == 0;
         case kArray:
             return payload_ == nullptr || static_cast<const Array*>(payload_)->empty();
         case kMap:
-            return payload_ == nullptr || static_cast<const Map*>(payload_)->empty();
+            // A flat map holds at least one entry.
+            return payload_ == nullptr ||
+                   (!PObjectAccess::IsFlat(*this) && static_cast<const Map*>(payload_)->empty());
         default:
             return false;  // an integer is never empty, also when 0
     }
@@ -111,7 +294,8 @@ bool PObject::asBool() const {
 
 std::string PObject::asString() const {
     if (type_ == kString) {
-        return *static_cast<const std::string*>(payload_);
+        const TextBlock& text = PObjectAccess::Text(*this);
+        return std::string(text.data(), text.size);
     }
     if (type_ == kInteger) {
         char text[64];
@@ -130,6 +314,11 @@ const PObject::Array& PObject::asArray() const {
 
 const PObject::Map& PObject::asMap() const {
     if (type_ == kMap && payload_ != nullptr) {
+        if (PObjectAccess::IsFlat(*this)) {
+            // The reference handed out must stay valid as a std::map's would: the storage
+            // changes form here, once (see the header).
+            return PObjectAccess::Materialise(const_cast<PObject&>(*this));
+        }
         return *static_cast<const Map*>(payload_);
     }
     return GetEmptyMap();
@@ -153,6 +342,8 @@ PObject::Map& PObject::asMap() {
     }
     if (payload_ == nullptr) {
         payload_ = new Map();
+    } else if (PObjectAccess::IsFlat(*this)) {
+        return PObjectAccess::Materialise(*this);
     }
     return *static_cast<Map*>(payload_);
 }
@@ -187,7 +378,11 @@ PObject& PObject::operator[](unsigned int index) {
 
 const PObject& PObject::operator[](const std::string& key) const {
     if (type_ == kMap && payload_ != nullptr) {
-        const Map& map = *static_cast<const Map*>(payload_);
+        // A missing key hands out nothing of this map: the flat form answers that itself.
+        if (PObjectAccess::IsFlat(*this) && FindFlat(PObjectAccess::Flat(*this), key) == nullptr) {
+            return GetEmptyObject();
+        }
+        const Map& map = asMap();
         auto it = map.find(key);
         if (it != map.end()) {
             return it->second;
@@ -209,37 +404,83 @@ const PObject& PObject::operator[](unsigned int index) const {
 }
 
 bool PObject::hasMember(const std::string& key) const {
-    return type_ == kMap && payload_ != nullptr &&
-           static_cast<const Map*>(payload_)->count(key) != 0;
+    if (type_ != kMap || payload_ == nullptr) {
+        return false;
+    }
+    if (PObjectAccess::IsFlat(*this)) {
+        return FindFlat(PObjectAccess::Flat(*this), key) != nullptr;
+    }
+    return static_cast<const Map*>(payload_)->count(key) != 0;
 }
 
 void PObject::clear() {
-    switch (type_) {
-        case kString:
-            delete static_cast<std::string*>(payload_);
-            break;
-        case kArray:
-        case kMap:
-            if (payload_ != nullptr) {
-                // A tree decoded from a peer may be nested a million levels deep: release it with
-                // an explicit work list instead of recursion, so the depth never reaches the call
-                // stack. Only containers that hold containers need the list.
-                std::vector<PObject> pending;
-                TakeChildren(pending);
-                while (!pending.empty()) {
-                    PObject last(std::move(pending.back()));
-                    pending.pop_back();
-                    last.TakeChildren(pending);
-                }
-                if (type_ == kArray) {
-                    delete static_cast<Array*>(payload_);
-                } else {
-                    delete static_cast<Map*>(payload_);
-                }
+    if (payload_ != nullptr && type_ != kInteger) {
+        // A tree decoded from a peer may be nested a million levels deep: release it with an
+        // explicit work list instead of recursion, so the depth never reaches the call stack.
+        // Only containers that hold containers need the list; strings go at once.
+        Releaser releaser;
+        std::vector<PObject> pending;
+        // A child string is released here, not by its own destructor: that adds its arena
+        // block to the releaser's count instead of paying an atomic step of its own.
+        auto release_leaf = [&releaser](PObject& value) {
+            if (value.type_ == kString) {
+                TextBlock* text = static_cast<TextBlock*>(value.payload_);
+                releaser.Free(text, text->arena);
             }
-            break;
-        default:
-            break;  // null and integers hold nothing outside the object
+            // Everything else left is an integer, a null or an empty container.
+            value.type_ = kNull;
+            value.payload_ = nullptr;
+        };
+        PObject current;
+        current.swap(*this);
+        for (;;) {
+            switch (current.type_) {
+                case kString: {
+                    TextBlock* text = static_cast<TextBlock*>(current.payload_);
+                    releaser.Free(text, text->arena);
+                    break;
+                }
+                case kArray:
+                    if (current.payload_ != nullptr) {
+                        current.TakeChildren(pending);
+                        Array* items = static_cast<Array*>(current.payload_);
+                        for (PObject& item : *items) {
+                            release_leaf(item);
+                        }
+                        delete items;
+                    }
+                    break;
+                case kMap:
+                    if (current.payload_ == nullptr) {
+                        break;
+                    }
+                    current.TakeChildren(pending);
+                    if (PObjectAccess::IsFlat(current)) {
+                        FlatMap& flat = PObjectAccess::Flat(current);
+                        FlatEntry* entries = flat.entries();
+                        for (uint32_t i = 0; i < flat.count; ++i) {
+                            release_leaf(entries[i].value);
+                        }
+                        releaser.Free(&flat, flat.arena);
+                    } else {
+                        Map* map = static_cast<Map*>(current.payload_);
+                        for (auto& entry : *map) {
+                            release_leaf(entry.second);
+                        }
+                        delete map;
+                    }
+                    break;
+                default:
+                    break;
+            }
+            current.type_ = kNull;
+            current.payload_ = nullptr;
+            if (pending.empty()) {
+                break;
+            }
+            current.swap(pending.back());
+            pending.pop_back();
+        }
     }
     type_ = kNull;
     payload_ = nullptr;
@@ -259,6 +500,11 @@ void PObject::TakeChildren(std::vector<PObject>& pending) {
         for (PObject& element : *static_cast<Array*>(payload_)) {
             take(element);
         }
+    } else if (PObjectAccess::IsFlat(*this)) {
+        FlatMap& flat = PObjectAccess::Flat(*this);
+        for (uint32_t i = 0; i < flat.count; ++i) {
+            take(flat.entries()[i].value);
+        }
     } else if (type_ == kMap) {
         for (auto& entry : *static_cast<Map*>(payload_)) {
             take(entry.second);
@@ -275,11 +521,7 @@ void PObject::copy<unsigned long long>(const unsigned long long& value) {
 
 template <>
 void PObject::copy<std::string>(const std::string& value) {
-    // Built before the old content goes: `value` may live inside this object.
-    std::string* fresh = new std::string(value);
-    clear();
-    type_ = kString;
-    payload_ = fresh;
+    PObjectAccess::AssignText(*this, nullptr, value.data(), value.size());
 }
 
 template <>
@@ -328,10 +570,12 @@ void PObject::copy(const PObject& other) {
                 to.type_ = kInteger;
                 to.number_ = from.number_;
                 break;
-            case kString:
-                to.payload_ = new std::string(*static_cast<const std::string*>(from.payload_));
+            case kString: {
+                const TextBlock& text = PObjectAccess::Text(from);
+                to.payload_ = PObjectAccess::NewText(nullptr, text.data(), text.size);
                 to.type_ = kString;
                 break;
+            }
             case kArray: {
                 to.type_ = kArray;
                 const Array& items = from.asArray();
@@ -348,7 +592,24 @@ void PObject::copy(const PObject& other) {
             }
             case kMap: {
                 to.type_ = kMap;
-                const Map& map = from.asMap();
+                if (from.payload_ == nullptr) {
+                    break;
+                }
+                if (PObjectAccess::IsFlat(from)) {
+                    // A flat map copies as one block, keys and all.
+                    const FlatMap& source = PObjectAccess::Flat(from);
+                    FlatMap* flat = PObjectAccess::NewFlat(nullptr, source.count, source.key_bytes);
+                    std::memcpy(flat->keys(), source.keys(), source.key_bytes);
+                    to.payload_ = reinterpret_cast<char*>(flat) + 1;
+                    for (uint32_t i = source.count; i-- > 0;) {
+                        const FlatEntry& entry = source.entries()[i];
+                        flat->entries()[i].key_offset = entry.key_offset;
+                        flat->entries()[i].key_size = entry.key_size;
+                        pending.emplace_back(&entry.value, &flat->entries()[i].value);
+                    }
+                    break;
+                }
+                const Map& map = *static_cast<const Map*>(from.payload_);
                 if (map.empty()) {
                     break;
                 }
@@ -372,20 +633,22 @@ void PObject::swap(PObject& other) noexcept {
 
 void PObject::Print(std::string& out) const {
     // The text is written from a work list rather than by recursion, so that any depth prints.
-    // Each step is a value still to print, or (value null) the separator/closing text to append.
+    // Each step is a value still to print, or (value null) the separator/closing text to append;
+    // a key, when there is one, goes first.
     struct Step {
         const PObject* value;
         const char* text;
-        const std::string* key;
+        const char* key;
+        size_t key_size;
     };
     std::vector<Step> pending;
-    pending.push_back(Step{this, nullptr, nullptr});
+    pending.push_back(Step{this, nullptr, nullptr, 0});
     while (!pending.empty()) {
         Step step = pending.back();
         pending.pop_back();
         if (step.key != nullptr) {
             out += '"';
-            out += *step.key;
+            out.append(step.key, step.key_size);
             out += "\": ";
         }
         if (step.value == nullptr) {
@@ -400,31 +663,45 @@ void PObject::Print(std::string& out) const {
             case kInteger:
                 out += std::to_string(value.number_);
                 break;
-            case kString:
+            case kString: {
+                const TextBlock& text = PObjectAccess::Text(value);
                 out += '"';
-                out += *static_cast<const std::string*>(value.payload_);
+                out.append(text.data(), text.size);
                 out += '"';
                 break;
+            }
             case kArray: {
                 out += '[';
-                pending.push_back(Step{nullptr, "]", nullptr});
+                pending.push_back(Step{nullptr, "]", nullptr, 0});
                 const Array& items = value.asArray();
                 for (size_t i = items.size(); i-- > 0;) {
-                    pending.push_back(Step{&items[i], nullptr, nullptr});
+                    pending.push_back(Step{&items[i], nullptr, nullptr, 0});
                     if (i > 0) {
-                        pending.push_back(Step{nullptr, ", ", nullptr});
+                        pending.push_back(Step{nullptr, ", ", nullptr, 0});
                     }
                 }
                 break;
             }
             case kMap: {
                 out += '{';
-                pending.push_back(Step{nullptr, "}", nullptr});
+                pending.push_back(Step{nullptr, "}", nullptr, 0});
+                if (PObjectAccess::IsFlat(value)) {
+                    const FlatMap& flat = PObjectAccess::Flat(value);
+                    for (uint32_t i = flat.count; i-- > 0;) {
+                        const FlatEntry& entry = flat.entries()[i];
+                        pending.push_back(Step{&entry.value, nullptr, flat.key(i), entry.key_size});
+                        if (i > 0) {
+                            pending.push_back(Step{nullptr, ", ", nullptr, 0});
+                        }
+                    }
+                    break;
+                }
                 const Map& map = value.asMap();
                 for (auto it = map.rbegin(); it != map.rend(); ++it) {
-                    pending.push_back(Step{&it->second, nullptr, &it->first});
+                    pending.push_back(
+                        Step{&it->second, nullptr, it->first.data(), it->first.size()});
                     if (std::next(it) != map.rend()) {
-                        pending.push_back(Step{nullptr, ", ", nullptr});
+                        pending.push_back(Step{nullptr, ", ", nullptr, 0});
                     }
                 }
                 break;

@@ -238,6 +238,10 @@ class S2S_EXPORT Channel {
     int* flag_ = nullptr;
     bool is_ssl_ = false;
     bool allow_untrust_ = true;
+    // The last receive on a plain channel took all the socket had (it returned less than the
+    // room offered): the next one waits for readability first instead of trying a receive that
+    // would most likely find nothing (the usual case of a request/reply exchange).
+    bool read_drained_ = false;
     std::string ssl_hostname_;
 };
 

@@ -4,8 +4,14 @@
 //
 // Storage: an integer is held in the object itself; a string, array or map is a separately
 // allocated payload. An array or map may have no payload yet: it is then empty, and gets one on
-// its first mutable use. Copying, printing and releasing never recurse, so a tree of any depth
-// (a decoded message may be nested a million levels) costs heap, never call stack.
+// its first mutable use. A map received from a stream is held in a compact sorted form until a
+// reference into it is first asked for (asMap(), operator[], an integer index): then it becomes
+// the std::map those return, once, so references handed out stay valid as std::map's do. That
+// first access may change the storage of an object reached through a const reference: like every
+// other use, it belongs to the one thread using the object. The parts of a received message share
+// its allocation; a part kept after the rest is released keeps that allocation. Copying,
+// printing and releasing never recurse, so a tree of any depth (a decoded message may be nested
+// a million levels) costs heap, never call stack.
 #ifndef S2S_POBJECT_H
 #define S2S_POBJECT_H
 
@@ -35,7 +41,11 @@ class S2S_EXPORT PObject {
     PObject(const char* value);
     PObject(const PObject& other);
     // Moves hand the payload over without copying (containers of PObject grow without deep copies).
-    PObject(PObject&& other) noexcept { swap(other); }
+    PObject(PObject&& other) noexcept : type_(other.type_) {
+        number_ = other.number_;  // the whole payload word, whichever member is in use
+        other.type_ = kNull;
+        other.payload_ = nullptr;
+    }
     ~PObject();
 
     PObject& operator=(unsigned long long value);
@@ -99,6 +109,8 @@ class S2S_EXPORT PObject {
     static const PObject& GetEmptyObject();
 
   private:
+    friend struct PObjectAccess;  // the storage forms (core/pobject_storage.h)
+
     const PObject* MapEntryAt(unsigned int index) const;
     void Print(std::string& out) const;
     void TakeChildren(std::vector<PObject>& pending);
@@ -106,7 +118,9 @@ class S2S_EXPORT PObject {
     // kNull exactly when the object is null; every operation that empties it resets both fields.
     int type_ = kNull;
     union {
-        void* payload_ = nullptr;  // owned: std::string, Array or Map; null for an empty container
+        // Owned: a TextBlock, an Array, a Map, or a FlatMap (its address + 1); null for an empty
+        // container.
+        void* payload_ = nullptr;
         unsigned long long number_;  // an integer's value
     };
 };

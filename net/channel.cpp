@@ -483,7 +483,21 @@ int Channel::ReadMore(int want) {
             "[DEBUG] s2s_channel.cpp(%d): ReadMore: want = %d, total = %d, len = %d, "
             "r_head = %d, r_size = %d\n",
             __LINE__, want, static_cast<int>(got), len, r_head_, r_size_);
-        int n = read_op_(handle_, at, len, wait_, flag_);
+        int n;
+        if (read_drained_ && !is_ssl_) {
+            // Wait first (see read_drained_); the receive that follows then finds the bytes.
+            fd_set read_set;
+            fd_set except_set;
+            n = WaitFd(GetFd(), &read_set, nullptr, &except_set, wait_, flag_);
+            if (n == kStatusSuccessful) {
+                n = read_op_(handle_, at, len, wait_, flag_);
+            }
+        } else {
+            n = read_op_(handle_, at, len, wait_, flag_);
+        }
+        if (n > 0) {
+            read_drained_ = static_cast<unsigned int>(n) < len;
+        }
         if (n == kStatusConnectionTimeout) {
             time_t now = std::time(nullptr);
             if (timeout_ != 0 && now - last >= static_cast<time_t>(timeout_)) {

@@ -11,11 +11,13 @@
 #include <algorithm>
 #include <cctype>
 #include <climits>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
 #include <tuple>
 #include <typeinfo>
 
+#include "core/pobject_storage.h"
 #include "net/log_debug.h"
 #include "s2s_logger.h"
 #include "s2s_status.h"
@@ -56,13 +58,13 @@ unsigned char IntegerLength(unsigned long long value) {
 }
 
 // The wire form of a map key: one leading underscore is dropped.
-const char* WireKey(const std::string& key, size_t& length) {
-    if (!key.empty() && key[0] == '_') {
-        length = key.size() - 1;
-        return key.data() + 1;
+const char* WireKey(const char* key, size_t size, size_t& length) {
+    if (size > 0 && key[0] == '_') {
+        length = size - 1;
+        return key + 1;
     }
-    length = key.size();
-    return key.data();
+    length = size;
+    return key;
 }
 
 // Task maps carry a password in plain text under "pswd"; other callers name theirs "password"
@@ -111,6 +113,39 @@ bool Direct(const Channel& channel) {
     return Logger::log_level < Logger::Debug && typeid(channel) == typeid(Channel);
 }
 
+constexpr size_t kNoEntry = ~size_t{0};
+
+// An entry of a flat map still being decoded; its key is in the scratch's key bytes.
+struct PendingEntry {
+    PObject value;
+    size_t key_offset;
+    uint32_t key_size;
+};
+
+// The entries and keys of the flat maps open in a decode, innermost last. One per thread, kept
+// between messages so that a receive does not allocate them again (a decode never runs inside
+// another on one thread); a large message's room is given back afterwards.
+struct DecodeScratch {
+    std::vector<PendingEntry> entries;
+    std::string keys;
+    void Reset() {
+        entries.clear();
+        keys.clear();
+        if (entries.capacity() > kKeptEntries) {
+            std::vector<PendingEntry>().swap(entries);
+        }
+        if (keys.capacity() > kKeptEntries * 16) {
+            std::string().swap(keys);
+        }
+    }
+    static constexpr size_t kKeptEntries = 1024;
+};
+
+DecodeScratch& ThreadScratch() {
+    static thread_local DecodeScratch scratch;
+    return scratch;
+}
+
 }  // namespace
 
 // One open container of the decoder. The decoder keeps these on the heap so that nesting depth
@@ -118,11 +153,20 @@ bool Direct(const Channel& channel) {
 // read: for an array that entry is its last element, which is dropped again if it fails.
 // `key_done` is set when a map entry has been read whole but its key is still on the history: the
 // pop is owed, and the next key takes its place under one lock (ReplaceKey).
+// A map the decoder creates is built flat (neither `array` nor `map`): its entries collect in the
+// scratch from `first` (keys from `key_start`) and leave it as one block at its end tag, into
+// `target`, or, when that is null, into the value of the scratch entry `owner` (scratch entries
+// move as the scratch grows, so they are named by index).
 struct PStream::Frame {
     std::vector<PObject>* array;
     std::map<std::string, PObject>* map;
     bool pending;
     bool key_done;
+    PObject* target;
+    size_t owner;
+    size_t first;
+    size_t key_start;
+    bool flat() const { return array == nullptr && map == nullptr; }
 };
 
 PStream::PStream() {
@@ -548,10 +592,11 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
     // decoder accepted can be sent on again whatever its depth.
     struct Walk {
         const std::vector<PObject>* array;
-        size_t index;
+        size_t index;  // of the array, or of the flat map
         const std::map<std::string, PObject>* map;
         std::map<std::string, PObject>::const_iterator next;
         bool key_pushed;
+        const FlatMap* flat;  // a map still in its flat form (never turned into a std::map here)
     };
     std::vector<Walk> stack;
     auto open_array = [&](const std::vector<PObject>& a) {
@@ -561,7 +606,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         }
         S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s[\n", __LINE__, Indent());
         ++depth_;
-        stack.push_back(Walk{&a, 0, nullptr, {}, false});
+        stack.push_back(Walk{&a, 0, nullptr, {}, false, nullptr});
         return 0;
     };
     auto open_map = [&](const std::map<std::string, PObject>& m) {
@@ -571,7 +616,17 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         }
         S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s{\n", __LINE__, Indent());
         ++depth_;
-        stack.push_back(Walk{nullptr, 0, &m, m.begin(), false});
+        stack.push_back(Walk{nullptr, 0, &m, m.begin(), false, nullptr});
+        return 0;
+    };
+    auto open_flat = [&](const FlatMap& flat) {
+        int ret = WriteByte(channel, kTagMap);
+        if (ret < 0) {
+            return ChannelFailure(ret);
+        }
+        S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s{\n", __LINE__, Indent());
+        ++depth_;
+        stack.push_back(Walk{nullptr, 0, nullptr, {}, false, &flat});
         return 0;
     };
 
@@ -591,9 +646,19 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             } else if (current.isInteger()) {
                 ret = Send(channel, current.asUInt64());
             } else if (current.isString()) {
-                ret = Send(channel, current.asString());
+                // Written from the value's own bytes, without a copy.
+                const TextBlock& text = PObjectAccess::Text(current);
+                ResetStatus();
+                ret = WriteString(channel, text.data(), text.size);
+                if (ret < 0) {
+                    ret = ChannelFailure(ret);
+                } else {
+                    S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s\"%s\"\n", __LINE__, Indent(),
+                                  LoggedValue(text.data()));
+                }
             } else if (current.isMap()) {
-                ret = open_map(current.asMap());
+                ret = PObjectAccess::IsFlat(current) ? open_flat(PObjectAccess::Flat(current))
+                                                     : open_map(current.asMap());
                 continue;
             } else if (current.isArray()) {
                 ret = open_array(current.asArray());
@@ -609,8 +674,9 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             return kStatusSuccessful;
         }
         Walk& top = stack.back();
-        bool at_end =
-            top.array != nullptr ? top.index == top.array->size() : top.next == top.map->end();
+        bool at_end = top.array != nullptr  ? top.index == top.array->size()
+                      : top.flat != nullptr ? top.index == top.flat->count
+                                            : top.next == top.map->end();
         // The previous value went out whole: its key leaves the history, at once before the end
         // tag, or replaced by the next key (one lock for both) once that key is written.
         if (at_end && top.key_pushed) {
@@ -634,7 +700,13 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             continue;
         }
         size_t length = 0;
-        const char* key = WireKey(top.next->first, length);
+        const char* key;
+        if (top.flat != nullptr) {
+            const FlatEntry& entry = top.flat->entries()[top.index];
+            key = WireKey(top.flat->key(static_cast<uint32_t>(top.index)), entry.key_size, length);
+        } else {
+            key = WireKey(top.next->first.data(), top.next->first.size(), length);
+        }
         ret = SendKey(channel, key, length);
         if (ret < 0) {
             if (top.key_pushed) {
@@ -649,8 +721,12 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             PushKey(key, length);
             top.key_pushed = true;
         }
-        value = &top.next->second;
-        ++top.next;
+        if (top.flat != nullptr) {
+            value = &top.flat->entries()[top.index++].value;
+        } else {
+            value = &top.next->second;
+            ++top.next;
+        }
     }
     // A failure leaves the key path of the failing value on the history.
     return ret;
@@ -670,12 +746,79 @@ int PStream::SendKey(Channel& channel, const char* key, size_t length) {
 
 int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned char tag,
                     std::vector<PObject>* array, std::map<std::string, PObject>* map) {
+    DecodeScratch& scratch = ThreadScratch();
+    std::vector<PendingEntry>& entries = scratch.entries;
+    std::string& keys = scratch.keys;
+    // Leaves the scratch empty and lets go of the message's arena on every way out.
+    struct Cleanup {
+        DecodeScratch& scratch;
+        Arena* arena = nullptr;
+        ~Cleanup() {
+            scratch.Reset();
+            if (arena != nullptr) {
+                arena->Finish();
+            }
+        }
+    } cleanup{scratch};
+    auto arena = [&cleanup] {
+        if (cleanup.arena == nullptr) {
+            cleanup.arena = Arena::Create();
+        }
+        return cleanup.arena;
+    };
+
     std::vector<Frame> stack;
     auto open = [&](std::vector<PObject>* a, std::map<std::string, PObject>* m) {
         S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
                       a != nullptr ? "[" : "{");
         ++depth_;
-        stack.push_back(Frame{a, m, false, false});
+        stack.push_back(Frame{a, m, false, false, nullptr, kNoEntry, 0, 0});
+    };
+    auto open_flat = [&](PObject* target, size_t owner) {
+        S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s{\n", __LINE__, Indent());
+        ++depth_;
+        stack.push_back(Frame{nullptr, nullptr, false, false, owner == kNoEntry ? target : nullptr,
+                              owner, entries.size(), keys.size()});
+    };
+    auto flat_target = [&](const Frame& frame) -> PObject& {
+        return frame.target != nullptr ? *frame.target : entries[frame.owner].value;
+    };
+    // A flat map's entries leave the scratch as one block, into the object it belongs to.
+    auto close_flat = [&](const Frame& frame) {
+        size_t count = entries.size() - frame.first;
+        FlatMap* flat = nullptr;
+        if (count > 0) {
+            size_t key_bytes = keys.size() - frame.key_start;
+            flat = PObjectAccess::NewFlat(arena(), static_cast<uint32_t>(count),
+                                          static_cast<uint32_t>(key_bytes));
+            FlatEntry* out = flat->entries();
+            for (size_t i = 0; i < count; ++i) {
+                PendingEntry& entry = entries[frame.first + i];
+                PObjectAccess::Move(out[i].value, entry.value);
+                out[i].key_offset = static_cast<uint32_t>(entry.key_offset - frame.key_start);
+                out[i].key_size = entry.key_size;
+            }
+            std::memcpy(flat->keys(), keys.data() + frame.key_start, key_bytes);
+            entries.resize(frame.first);
+            keys.resize(frame.key_start);
+        }
+        PObjectAccess::AssignFlat(flat_target(frame), flat);
+    };
+    // Keys out of order (or one key twice) are kept as a std::map from here on, which receives
+    // a repeated key into its existing value.
+    auto unflatten = [&](Frame& frame) {
+        PObject& target = flat_target(frame);
+        target.clear();
+        std::map<std::string, PObject>& tree = target.asMap();
+        for (size_t i = frame.first; i < entries.size(); ++i) {
+            PendingEntry& entry = entries[i];
+            tree.emplace_hint(tree.end(), std::piecewise_construct,
+                              std::forward_as_tuple(keys.data() + entry.key_offset, entry.key_size),
+                              std::forward_as_tuple(std::move(entry.value)));
+        }
+        entries.resize(frame.first);
+        keys.resize(frame.key_start);
+        frame.map = &tree;
     };
     if (array != nullptr || map != nullptr) {
         open(array, map);
@@ -694,6 +837,22 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         channel.Consume(1);
         return 0;
     };
+    // A string body buffered whole in the ring: its bytes (up to the first NUL) and the wire
+    // bytes to consume, or null.
+    auto buffered_text = [&](size_t& size, unsigned int& wire) -> const char* {
+        const char* at = direct() ? channel.BufferedRun(2) : nullptr;
+        if (at == nullptr) {
+            return nullptr;
+        }
+        unsigned int length =
+            (static_cast<unsigned char>(at[0]) << 8) | static_cast<unsigned char>(at[1]);
+        if (channel.BufferedRun(2 + length) == nullptr) {
+            return nullptr;
+        }
+        size = strnlen(at + 2, length);
+        wire = 2 + length;
+        return at + 2;
+    };
 
     // Nesting beyond the limit is refused before the container is entered.
     auto too_deep = [&] {
@@ -709,6 +868,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
 
     int ret = 0;
     std::string text;
+    size_t slot_owner = kNoEntry;  // the scratch entry whose value `slot` is, if it is one
     received_ = 0;
     for (;;) {
         bool completed = false;  // a whole value (primitive or closed container) was read
@@ -722,7 +882,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         }
         if (slot != nullptr) {
             PObject& target = *slot;
+            const size_t target_owner = slot_owner;
             slot = nullptr;
+            slot_owner = kNoEntry;
             if (!have_tag) {
                 ret = next_tag(tag);
                 if (ret < 0) {
@@ -731,14 +893,27 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             }
             have_tag = false;
             switch (tag) {
-                case kTagString:
+                case kTagString: {
+                    size_t size = 0;
+                    unsigned int wire = 0;
+                    const char* at = buffered_text(size, wire);
+                    if (at != nullptr) {
+                        // Straight from the ring into the message's arena (no debug line is due
+                        // on this path).
+                        ResetStatus();
+                        received_ += wire;
+                        PObjectAccess::AssignText(target, arena(), at, size);
+                        channel.Consume(wire);
+                        break;
+                    }
                     ret = RecvText(channel, text, false);
                     if (ret >= 0) {
-                        target = text;
+                        PObjectAccess::AssignText(target, arena(), text.data(), text.size());
                     } else if (!target.isString() || target.isNull()) {
                         target = std::string();  // what reading into a fresh string leaves
                     }
                     break;
+                }
                 case kTagInteger: {
                     unsigned long long value = 0;
                     ret = Recv(channel, value);
@@ -761,7 +936,11 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                         ret = kStatusProtocolError;
                         break;
                     }
-                    open(nullptr, &target.asMap());  // merges into a map already there
+                    if (target.isMap() && !target.isEmpty()) {
+                        open(nullptr, &target.asMap());  // merges into a map already there
+                    } else {
+                        open_flat(&target, target_owner);
+                    }
                     continue;
                 case kTagNull: {
                     unsigned char length = 0;
@@ -803,6 +982,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 --depth_;
                 S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
                               is_array ? "]" : "}");
+                if (top.flat()) {
+                    close_flat(top);
+                }
                 stack.pop_back();
                 completed = true;
             } else if (top.array != nullptr) {
@@ -818,38 +1000,55 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 ret = kStatusProtocolError;
                 break;
             } else {
-                // Keys arrive in order from a conforming writer: the end is the likely place.
-                std::map<std::string, PObject>::iterator entry;
-                const char* at = direct() ? channel.BufferedRun(2) : nullptr;
-                unsigned int length = at == nullptr ? 0
-                                                    : (static_cast<unsigned char>(at[0]) << 8) |
-                                                          static_cast<unsigned char>(at[1]);
-                if (at != nullptr && channel.BufferedRun(2 + length) != nullptr) {
-                    // A key buffered whole is built straight from the ring into its entry (no
-                    // debug line is due on this path).
+                // A key buffered whole is read in place in the ring (no debug line is due on
+                // that path); the ring keeps it until it is consumed below.
+                size_t key_size = 0;
+                unsigned int wire = 0;
+                const char* key = buffered_text(key_size, wire);
+                if (key != nullptr) {
                     ResetStatus();
-                    received_ += 2 + length;
-                    entry = top.map->emplace_hint(
-                        top.map->end(), std::piecewise_construct,
-                        std::forward_as_tuple(at + 2, strnlen(at + 2, length)),
-                        std::forward_as_tuple());
-                    channel.Consume(2 + length);
+                    received_ += wire;
                 } else {
                     ret = RecvText(channel, text, true);
                     if (ret < 0) {
                         break;
                     }
-                    entry = top.map->try_emplace(top.map->end(), text);
+                    key = text.data();
+                    key_size = text.size();
                 }
-                const std::string& key = entry->first;
+                if (top.flat()) {
+                    // A conforming writer sends keys in ascending order, each once.
+                    bool in_order = entries.size() == top.first ||
+                                    CompareKeys(keys.data() + entries.back().key_offset,
+                                                entries.back().key_size, key, key_size) < 0;
+                    if (!in_order || keys.size() + key_size > UINT32_MAX ||
+                        entries.size() - top.first >= UINT32_MAX) {
+                        unflatten(top);
+                    }
+                }
+                if (top.flat()) {
+                    entries.push_back(
+                        PendingEntry{PObject(), keys.size(), static_cast<uint32_t>(key_size)});
+                    keys.append(key, key_size);
+                    slot = &entries.back().value;
+                    slot_owner = entries.size() - 1;
+                } else {
+                    // Keys arrive in order from a conforming writer: the end is the likely place.
+                    auto entry = top.map->emplace_hint(top.map->end(), std::piecewise_construct,
+                                                       std::forward_as_tuple(key, key_size),
+                                                       std::forward_as_tuple());
+                    slot = &entry->second;
+                }
                 if (top.key_done) {
-                    ReplaceKey(key.data(), key.size());
+                    ReplaceKey(key, key_size);
                     top.key_done = false;
                 } else {
-                    PushKey(key.data(), key.size());
+                    PushKey(key, key_size);
+                }
+                if (wire != 0) {
+                    channel.Consume(wire);
                 }
                 top.pending = true;
-                slot = &entry->second;
             }
         }
         if (completed) {
@@ -858,14 +1057,18 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             }
             Frame& top = stack.back();
             if (top.pending) {
-                top.key_done = top.map != nullptr;  // the pop is owed (see Frame)
+                top.key_done = top.array == nullptr;  // the pop is owed (see Frame)
                 top.pending = false;
             }
         }
     }
     // An array element that failed is not kept; a map entry keeps what arrived of its value, and
-    // the key path of the failure stays on the history.
+    // the key path of the failure stays on the history. Maps still being built are put in place
+    // innermost first, each into its entry of the next.
     for (auto it = stack.rbegin(); it != stack.rend(); ++it) {
+        if (it->flat()) {
+            close_flat(*it);
+        }
         if (it->array != nullptr && it->pending) {
             it->array->pop_back();
         }

@@ -341,6 +341,52 @@ TEST(PStreamTest, MillionNestedArraysDecodeWithoutTheCallStack) {
     EXPECT_TRUE(partial.isArray());
 }
 
+// A received map is stored compactly until a reference into it is asked for; every access must
+// see the same map, before and after that change, and a part kept alone must outlive the rest.
+TEST(PStreamTest, ReceivedMapsBehaveAsMapsThroughEveryAccess) {
+    PObject sent;
+    sent["a"] = 1ULL;
+    sent["b"]["c"] = "a text longer than a short string";
+    sent["b"]["d"] = Array({PObject(1ULL), PObject()});
+    sent["z"] = "last";
+    const std::string bytes = Encode(sent);
+    PObject back;
+    ASSERT_EQ(0, Decode(bytes, back));
+    const PObject& read = back;
+    EXPECT_TRUE(read.hasMember("z"));
+    EXPECT_FALSE(read.hasMember("y"));
+    EXPECT_TRUE(read["y"].isNull());
+    EXPECT_EQ(sent.toString(), read.toString());
+    PObject copy = back;
+    EXPECT_TRUE(Encode(back) == bytes);  // forwarded as received
+    EXPECT_TRUE(Encode(copy) == bytes);
+
+    // References stay valid as the map grows; the copy is independent.
+    const PObject& a = copy.asMap().at("a");
+    copy["b"]["new"] = 5ULL;
+    copy["aa"] = 2ULL;
+    EXPECT_EQ(1u, a.asUInt64());
+    EXPECT_TRUE(read[1u].hasMember("c"));  // "b", second in key order
+    EXPECT_FALSE(read["b"].hasMember("new"));
+    EXPECT_EQ(
+        "{\"a\": 1, \"aa\": 2, \"b\": {\"c\": \"a text longer than a short string\", "
+        "\"d\": [1, null], \"new\": 5}, \"z\": \"last\"}",
+        copy.toString());
+
+    PObject part;
+    part.swap(back["b"]);
+    back.clear();
+    EXPECT_EQ("a text longer than a short string", part["c"].asString());
+
+    // Keys out of order, or repeated, on the wire: the later value is received into the entry.
+    PObject unordered;
+    ASSERT_EQ(0,
+              Decode(Bytes({0x42, 0x10, 0x00, 0x01, 'b',  0x01, 0x01, 0x01, 0x10, 0x00, 0x01, 'a',
+                            0x01, 0x01, 0x02, 0x10, 0x00, 0x01, 'b',  0x01, 0x01, 0x03, 0x40}),
+                     unordered));
+    EXPECT_EQ("{\"a\": 2, \"b\": 3}", unordered.toString());
+}
+
 TEST(PStreamTest, DeeplyNestedMapsKeepTheWholeKeyPath) {
     LogCapture log(S2S::Logger::Error);
     const size_t depth = 100000;

@@ -1,0 +1,134 @@
+// How a PObject holds a string or a map, for the value itself (core/pobject.cpp) and for the
+// stream codec, which builds and walks these forms directly.
+//
+// A string is a TextBlock: its length and its bytes (NUL-terminated for log lines) in one block.
+// A map is either the std::map that asMap() hands out, or a FlatMap: its entries in one block,
+// sorted by key, keys stored after the entries. The decoder builds flat maps (it learns each
+// map's size at its end tag); a flat map becomes a std::map the first time a caller asks for a
+// reference into it (asMap(), either operator[], an integer index), and stays one. Lookups that
+// hand out nothing (hasMember, a missing key, printing, copying, sending, releasing) read the
+// flat form as it is.
+//
+// Blocks come from the heap or from an Arena: one per decoded message, filled by bumping a
+// pointer and freed in chunks once its last block is released. Every block names its arena
+// (null: heap), so a part of a message that is moved elsewhere keeps the arena alive; the count
+// of live blocks is atomic because two parts of one message may be released by two threads.
+#ifndef S2S_CORE_POBJECT_STORAGE_H
+#define S2S_CORE_POBJECT_STORAGE_H
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <cstring>
+#include <map>
+#include <string>
+
+#include "s2s_pobject.h"
+
+namespace S2S {
+
+class Arena {
+  public:
+    // A new arena, held by its creator until Finish().
+    static Arena* Create();
+    Arena(const Arena&) = delete;
+    Arena& operator=(const Arena&) = delete;
+
+    // `size` bytes aligned to 8, counted as one live block. Creator's thread only.
+    void* Allocate(size_t size);
+    // The creator lets go: from now on the arena lives exactly as long as its blocks.
+    void Finish();
+    // `blocks` of its blocks were released; the last release frees every chunk.
+    void Release(size_t blocks);
+
+  private:
+    struct Chunk {
+        Chunk* next;
+    };
+    Arena() = default;
+    void Grow(size_t size);
+    void Destroy();
+
+    // While the creator holds the arena the count carries a large hold, so that blocks released
+    // during the build (a value received twice) never bring it to zero early.
+    static constexpr size_t kCreatorHold = size_t{1} << 48;
+    std::atomic<size_t> live_{kCreatorHold};
+    size_t allocated_ = 0;
+    Chunk* chunks_ = nullptr;
+    char* cursor_ = nullptr;
+    char* limit_ = nullptr;
+    size_t next_size_ = 0;
+};
+
+struct TextBlock {
+    Arena* arena;
+    size_t size;
+    const char* data() const { return reinterpret_cast<const char*>(this + 1); }
+    char* data() { return reinterpret_cast<char*>(this + 1); }
+};
+
+struct FlatEntry {
+    PObject value;
+    uint32_t key_offset;  // from the start of the map's key bytes
+    uint32_t key_size;
+};
+
+struct FlatMap {
+    Arena* arena;
+    uint32_t count;  // at least 1: an empty map has no payload
+    uint32_t key_bytes;
+    FlatEntry* entries() { return reinterpret_cast<FlatEntry*>(this + 1); }
+    const FlatEntry* entries() const { return reinterpret_cast<const FlatEntry*>(this + 1); }
+    const char* keys() const { return reinterpret_cast<const char*>(entries() + count); }
+    char* keys() { return reinterpret_cast<char*>(entries() + count); }
+    const char* key(uint32_t i) const { return keys() + entries()[i].key_offset; }
+};
+
+// Byte order of keys: what std::string's comparison gives (unsigned bytes, a prefix first).
+inline int CompareKeys(const char* a, size_t a_size, const char* b, size_t b_size) {
+    size_t common = a_size < b_size ? a_size : b_size;
+    int order = common == 0 ? 0 : std::memcmp(a, b, common);
+    if (order != 0) {
+        return order;
+    }
+    return a_size < b_size ? -1 : (a_size > b_size ? 1 : 0);
+}
+
+// The storage side of PObject, for this file's two users.
+struct PObjectAccess {
+    static bool IsText(const PObject& o) { return o.type_ == PObject::kString; }
+    static const TextBlock& Text(const PObject& o) {
+        return *static_cast<const TextBlock*>(o.payload_);
+    }
+    static bool IsFlat(const PObject& o) {
+        return o.type_ == PObject::kMap && (reinterpret_cast<uintptr_t>(o.payload_) & 1) != 0;
+    }
+    // REQUIRES: IsFlat(o).
+    static FlatMap& Flat(const PObject& o) {
+        return *reinterpret_cast<FlatMap*>(reinterpret_cast<uintptr_t>(o.payload_) - 1);
+    }
+
+    // Moves `from` into the null object `to`; `from` is null afterwards.
+    static void Move(PObject& to, PObject& from) {
+        to.type_ = from.type_;
+        to.number_ = from.number_;
+        from.type_ = PObject::kNull;
+        from.payload_ = nullptr;
+    }
+
+    // A text block of `size` bytes from `arena` (null: the heap).
+    static TextBlock* NewText(Arena* arena, const char* data, size_t size);
+    // Makes `o` the string `data`: the block is built before the old content goes.
+    static void AssignText(PObject& o, Arena* arena, const char* data, size_t size);
+    // A flat map of `count` (>= 1) null entries and `key_bytes` key bytes, to be filled in
+    // ascending key order.
+    static FlatMap* NewFlat(Arena* arena, uint32_t count, uint32_t key_bytes);
+    // Makes `o` the map `flat` (null: the empty map), dropping what it held.
+    static void AssignFlat(PObject& o, FlatMap* flat);
+    // The flat map of `o` turned into its std::map.
+    static PObject::Map& Materialise(PObject& o);
+};
+
+}  // namespace S2S
+
+#endif  // S2S_CORE_POBJECT_STORAGE_H
