@@ -17,16 +17,32 @@ sanitized_areas="core;net;platform;host;sync;service;receiver"
 # processes); they run in the normal build. A renamed one only makes the sanitizer pass slower.
 too_slow_sanitized='^(PObjectDepth\.|PStreamTest\.MillionNested|PairingStoreStressTest\.)'
 
+# With ccache a machine that keeps its cache between runs recompiles only what changed, in any
+# clone (paths below the source tree are hashed relative to it).
+launcher=()
+if command -v ccache >/dev/null; then
+  export CCACHE_BASEDIR=$PWD CCACHE_NOHASHDIR=1
+  launcher=(-DCMAKE_CXX_COMPILER_LAUNCHER=ccache -DCMAKE_C_COMPILER_LAUNCHER=ccache)
+fi
+
 phase_start=$SECONDS
 phase_end() {
   echo "== $1 took $((SECONDS - phase_start))s"
-  phase_start=$SECONDS
+  # With ccache a machine that keeps its cache between runs recompiles only what changed, in any
+# clone (paths below the source tree are hashed relative to it).
+launcher=()
+if command -v ccache >/dev/null; then
+  export CCACHE_BASEDIR=$PWD CCACHE_NOHASHDIR=1
+  launcher=(-DCMAKE_CXX_COMPILER_LAUNCHER=ccache -DCMAKE_C_COMPILER_LAUNCHER=ccache)
+fi
+
+phase_start=$SECONDS
 }
 # run_suite DIR EXCLUDE CMAKE-ARGS...: configure, build, and run the tests not matching EXCLUDE.
 run_suite() {
   local dir=$1 exclude=$2
   shift 2
-  cmake -S . -B "$dir" -G Ninja -DS2S_WERROR=ON "$@" >/dev/null
+  cmake -S . -B "$dir" -G Ninja -DS2S_WERROR=ON "${launcher[@]}" "$@" >/dev/null
   cmake --build "$dir" -j "$jobs"
   phase_end "build of $dir"
   ctest --test-dir "$dir" --output-on-failure -j "$test_jobs" --timeout 900 \
