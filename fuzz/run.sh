@@ -22,8 +22,13 @@ if ((${#names[@]} == 0)); then
   exit 0
 fi
 
+launcher=()
+if command -v ccache >/dev/null; then
+  export CCACHE_BASEDIR=$PWD CCACHE_NOHASHDIR=1
+  launcher=(-DCMAKE_CXX_COMPILER_LAUNCHER=ccache -DCMAKE_C_COMPILER_LAUNCHER=ccache)
+fi
 CC=clang CXX=clang++ cmake -S . -B "$dir" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DS2S_FUZZ=ON -DS2S_SANITIZE=ON -DS2S_TESTS=OFF -DS2S_BENCH=OFF >/dev/null
+  -DS2S_FUZZ=ON -DS2S_SANITIZE=ON -DS2S_TESTS=OFF -DS2S_BENCH=OFF "${launcher[@]}" >/dev/null
 targets=()
 for name in "${names[@]}"; do
   targets+=("fuzz_$name")

@@ -1,5 +1,7 @@
-// The sync library's core interface: values, logging, status codes, and the host services
-// (locks, temporary files, daemon control, share/volume/host queries).
+// One include for programs that use the sync library: values, logging, status codes, and the host
+// services (locks, temporary files, daemon control, share/volume/host queries). It sits above
+// every area of the library, so no source of the library includes it; each includes the headers
+// it uses.
 #ifndef S2S_H
 #define S2S_H
 

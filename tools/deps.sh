@@ -5,7 +5,7 @@ packages=(
   build-essential cmake ninja-build g++ pkg-config clang clang-format libclang-rt-14-dev
   libgtest-dev libgmock-dev libbenchmark-dev libssl-dev openssl libboost-dev libmsgpack-cxx-dev
   rsync openssh-server openssh-client sshpass procps iproute2 util-linux nlohmann-json3-dev libcli11-dev tzdata
-  libsqlite3-dev
+  libsqlite3-dev ccache
   gcovr
 )
 missing=()

@@ -61,9 +61,7 @@ TEST(CHeader, ACProgramCompilesLinksAndRuns) {
                           (dir / "prog.c") + "' -o '" + (dir / "prog.o") + "'";
     ASSERT_EQ(Shell(compile), 0) << compile;
     std::string link = "c++ '" + (dir / "prog.o") +
-                       "' '" S2S_BINARY_DIR
-                       "/libs2s_static.a' -lssl "
-                       "-lcrypto -pthread" +
+                       "' -L'" S2S_BINARY_DIR "' -ls2s -Wl,-rpath,'" S2S_BINARY_DIR "' -pthread" +
                        std::string(kLinkExtra) + " -o '" + (dir / "prog") + "'";
     ASSERT_EQ(Shell(link), 0) << link;
     EXPECT_EQ(Shell("'" + (dir / "prog") + "' '" + (dir / "store.info") + "'"), 0);
