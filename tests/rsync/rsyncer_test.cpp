@@ -226,6 +226,7 @@ TEST_F(RsyncerLocal, NoClientIdMeansNoCommand) {
     EXPECT_EQ(conflicts, (Lines{"keep"}));
     EXPECT_FALSE(log.Contains("rsync_wrapper.cpp")) << "rsync ran";
     fs::directory_iterator left(host_.Root() + "/tmp/S2S");
+    ASSERT_NE(left, fs::directory_iterator());
     EXPECT_EQ(left->path().filename().string().rfind("temp.", 0), 0u);
     EXPECT_EQ(++left, fs::directory_iterator()) << "more than the one reserved file";
 }

@@ -96,7 +96,7 @@ TEST_F(OverSsh, RefusedAndUnfitLoginsAreNamed) {
         const char* said;
     } rows[] = {
         {"root", "wrong-password", "", 5, ""},
-        {ServerPair::kGuest, kPassword, "", RsyncWrapper::kResultSshLogin, "must be root"},
+        {ServerPair::kGuest, kPassword, "", RsyncWrapper::kResultSshLogin, "cannot read the"},
         {ServerPair::kRootAlias, kPassword, "", 5, "auth failed"},  // uid 0: the account decides
         {"root", kPassword, broken, RsyncWrapper::kResultSshLogin, "syntax or usage error"},
     };
