@@ -76,8 +76,7 @@ TEST_F(RsyncerLocal, GoldenCommandLines) {
           "syncShares=\"photos:docs:music\"", "dryRun=\"no\"", "outfile=\"/o\""}},
         {[&](Lines& l) { return r.GenFinishSyncCmd("share", "photos", l); },
          {"command=\"S2S_SyncFinish\"", "finishType=\"share\"", "name=\"photos\""}},
-        // Values go in verbatim.
-        {[&](Lines& l) { return r.GenFinishSyncCmd(" type ", "a\"b", l); },
+        {[&](Lines& l) { return r.GenFinishSyncCmd(" type ", "a\"b", l); },  // verbatim
          {"command=\"S2S_SyncFinish\"", "finishType=\" type \"", "name=\"a\"b\""}},
         {[&](Lines& l) { return r.GenSendBeaconCmd("nightly", l); },
          {"command=\"S2S_UpdateTaskStatus\"", "taskName=\"nightly\""}},
@@ -468,8 +467,10 @@ TEST_F(RsyncerServer, RunsCarryTheTasksOptionsAndSendTheShare) {
          [&] {
              ASSERT_EQ(r.DoPairing(false, {"photos", "secret"}, conflicts, result), 0);
              ASSERT_EQ(r.StartSyncShare("photos", result), 0);
+             int progress = -1;
+             r.SetProgressCallback([&](int percent) { progress = percent; });
              ASSERT_EQ(r.RunSync(1, "photos", "/", {"*.tmp", "cache/"}, result), 0);
-             ASSERT_EQ(result, 0);
+             ASSERT_EQ(std::make_pair(result, progress), std::make_pair(0, 100));
              auto expected = TreeManifest(src);
              expected.erase("/scratch.tmp");
              EXPECT_EQ(TreeManifest(dst), expected);
