@@ -105,6 +105,22 @@ void RemoveTree(const std::string& path) {
     std::filesystem::remove_all(path, ec);
 }
 
+bool HasControl(const std::string& text) {
+    for (unsigned char c : text) {
+        if (c < 0x20 || c == 0x7f) {
+            return true;
+        }
+    }
+    return false;
+}
+
+bool TaskNameValid(const std::string& name) {
+    return !name.empty() && name.size() <= kShareNameMax && !HasControl(name) &&
+           name.find_first_of("/\"'`[]\\") == std::string::npos &&
+           name.find("..") == std::string::npos && name.front() != ' ' && name.front() != '@' &&
+           name.back() != ' ';
+}
+
 bool ShareNameValid(const std::string& name) {
     const size_t len = name.size();
     if (len == 0 || len > kShareNameMax || name == "." || name == ".." || name.front() == ' ' ||

@@ -140,6 +140,19 @@ bool ShareNameValid(const std::string& name);
 // of blanks, and not "global" in any folding. Such a name is also a literal value of the daemon's
 // configuration: no line break, no %VAR% expansion, no quote, no backslash, no outer blank.
 bool ShareNameSyncable(const std::string& name);
+// A task name a receiver takes: 1..kShareNameMax bytes, no control characters, quotes,
+// brackets, slashes, backslashes or "..", no leading '@', no leading or trailing blank.
+bool TaskNameValid(const std::string& name);
+// Why a task name is refused, in words an administrator can act on (a macro as well, so that
+// the receiver's exported copy of the text is an array of its own).
+#define S2S_TASK_NAME_RULE                                                                      \
+    "the task's name is not one a receiver takes: at most 255 bytes, not empty, no control "    \
+    "characters, quotes, brackets, slashes, backslashes or \"..\", no leading '@', no leading " \
+    "or trailing blank"
+constexpr char kTaskNameRule[] = S2S_TASK_NAME_RULE;
+// True when `text` holds a control character (below 0x20, or 0x7f): never part of a name, a
+// value of a command file or a word of the daemon's configuration.
+bool HasControl(const std::string& text);
 // The module the daemon makes of `name`: ASCII lower case, blanks removed. Two shares with one
 // key would be one module.
 std::string ShareModuleKey(const std::string& name);

@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "host/platform_records.h"
+#include "platform/records.h"
 #include "s2s_host.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"

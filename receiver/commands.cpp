@@ -15,7 +15,7 @@
 
 #include "core/protocol.h"
 #include "host/pairing_store.h"
-#include "host/platform_records.h"
+#include "platform/records.h"
 #include "receiver/internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
@@ -61,15 +61,6 @@ using PairingStore::StoreContents;
 using Hash = HashRecord;
 using List = ListRecord;
 
-bool HasControl(const std::string& s) {
-    for (unsigned char c : s) {
-        if (c < 0x20 || c == 0x7f) {
-            return true;
-        }
-    }
-    return false;
-}
-
 bool ValidKey(const std::string& key) {
     if (key.empty() || key.size() > kMaxKey || !std::isalpha(static_cast<unsigned char>(key[0]))) {
         return false;
@@ -101,7 +92,7 @@ bool ValidClientID(const std::string& id) {
 }
 
 bool ValidServerName(const std::string& name) {
-    return !name.empty() && name.size() <= kMaxServerName && !HasControl(name) &&
+    return !name.empty() && name.size() <= kMaxServerName && !protocol::HasControl(name) &&
            name.find_first_of("\"'\\") == std::string::npos;
 }
 
@@ -616,16 +607,11 @@ int ParseCommandFile(const std::string& input, std::string* token, Pairs* pairs)
 
 }  // namespace receiver_internal
 
-const char kReceiverTaskNameRule[] =
-    "the task's name is not one a receiver takes: at most 255 bytes, not empty, no control "
-    "characters, quotes, brackets, slashes, backslashes or \"..\", no leading '@', no leading or "
-    "trailing blank";
+// The exported rule is the exchange's own.
+const char kReceiverTaskNameRule[] = S2S_TASK_NAME_RULE;
 
 bool ReceiverTaskNameValid(const std::string& name) {
-    return !name.empty() && name.size() <= protocol::kShareNameMax && !HasControl(name) &&
-           name.find_first_of("/\"'`[]\\") == std::string::npos &&
-           name.find("..") == std::string::npos && name.front() != ' ' && name.front() != '@' &&
-           name.back() != ' ';
+    return protocol::TaskNameValid(name);
 }
 
 ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer) {
@@ -645,7 +631,7 @@ ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer) {
                 bool nameKey = p.first == protocol::kKeyShareName ||
                                p.first == protocol::kKeySyncShares ||
                                p.first == protocol::kKeyName || p.first == protocol::kKeyTaskName;
-                if (HasControl(p.second)) {
+                if (protocol::HasControl(p.second)) {
                     rc = nameKey ? protocol::kBadName : protocol::kMalformed;
                 }
             }
@@ -667,7 +653,7 @@ ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer) {
                 rc = protocol::kUnknownCommand;
             }
         }
-        const char* shownName = HasControl(name) || name.size() > kMaxKey ? "?" : name.c_str();
+        const char* shownName = protocol::HasControl(name) || name.size() > kMaxKey ? "?" : name.c_str();
         const char* shownClient = ValidClientID(client) ? client.c_str() : "?";
         if (rc == protocol::kOK) {
             Logger::LogMsg(Logger::Info, "[INFO] receiver_commands.cpp(%d): %s from client %s\n",

@@ -37,7 +37,7 @@
 
 #include "core/protocol.h"
 #include "host/pairing_store.h"
-#include "host/platform_records.h"
+#include "platform/records.h"
 #include "receiver/internal.h"
 #include "rsync/child_process.h"
 #include "s2s_logger.h"
@@ -61,19 +61,10 @@ int Fail(std::string* error, const std::string& text) {
     return -1;
 }
 
-bool HasControl(const std::string& s) {
-    for (unsigned char c : s) {
-        if (c < 0x20 || c == 0x7f) {
-            return true;
-        }
-    }
-    return false;
-}
-
 // A value rsyncd.conf takes literally: no line breaks, no %VAR% expansion, no outer blanks, and
 // (for what goes into a hook's shell command) no single quote.
 bool ConfSafe(const std::string& s) {
-    return !s.empty() && !HasControl(s) && s.find_first_of("%'\\") == std::string::npos &&
+    return !s.empty() && !protocol::HasControl(s) && s.find_first_of("%'\\") == std::string::npos &&
            s.front() != ' ' && s.back() != ' ';
 }
 
@@ -518,7 +509,7 @@ int ShareModules(std::string* text, std::vector<std::string>* notes, std::string
         // character or outer blank), so only the path needs that check of its own.
         if (!protocol::ShareNameSyncable(name) || path.empty() || path[0] != '/' ||
             !ConfSafe(path)) {
-            std::string shown = HasControl(name) ? "?" : name;
+            std::string shown = protocol::HasControl(name) ? "?" : name;
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] receiver_daemon.cpp(%d): share '%s' is not served (its name "
                            "or path cannot be a daemon module)\n",
@@ -575,7 +566,7 @@ int ConfigureLocked(const ReceiverSettings& s, std::string* error,
     if (!ValidAccount(s.user)) {
         return Fail(error, "invalid user name (letters, digits, '.', '_', '-')");
     }
-    if (s.password.empty() || HasControl(s.password)) {
+    if (s.password.empty() || protocol::HasControl(s.password)) {
         return Fail(error, "the password must be one non-empty line");
     }
     if (s.handlerPath.empty() || s.handlerPath[0] != '/' || !ConfSafe(s.handlerPath)) {

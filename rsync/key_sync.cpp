@@ -4,7 +4,7 @@
 #include <memory>
 #include <string>
 
-#include "host/platform_records.h"
+#include "platform/records.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_rsyncer.h"

@@ -14,6 +14,7 @@
 #include <utility>
 #include <vector>
 
+#include "core/protocol.h"
 #include "rsync/rsync_wrapper_impl.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
@@ -45,15 +46,6 @@ constexpr const char kExecPreparation[] = "exec preparation failed";
 constexpr const char kUsageError[] = "syntax or usage error";
 constexpr const char kNoGreeting[] = "did not see server greeting";
 
-bool HasControl(const std::string& s) {
-    for (unsigned char c : s) {
-        if (c < 0x20 || c == 0x7f) {
-            return true;
-        }
-    }
-    return false;
-}
-
 // Host names and numeric addresses (IPv6 with an optional zone): nothing that could turn the
 // URL into another user, path or option.
 bool ValidServer(const std::string& s) {
@@ -69,7 +61,7 @@ bool ValidServer(const std::string& s) {
 }
 
 bool ValidUser(const std::string& s) {
-    if (s.empty() || s[0] == '-' || HasControl(s)) {
+    if (s.empty() || s[0] == '-' || S2S::protocol::HasControl(s)) {
         return false;
     }
     return s.find_first_of("@:/ \t'\"\\") == std::string::npos;
@@ -302,7 +294,7 @@ std::string RsyncWrapper::Impl::Url(const std::string& target) const {
 }
 
 std::string RsyncWrapper::Impl::TransferTarget(std::string* why) const {
-    if (HasControl(dest) || HasControl(module) || HasDotDot(dest) || HasDotDot(module)) {
+    if (S2S::protocol::HasControl(dest) || S2S::protocol::HasControl(module) || HasDotDot(dest) || HasDotDot(module)) {
         *why = "destination holds control characters or '..'";
         return std::string();
     }
@@ -528,7 +520,7 @@ int RsyncWrapper::Impl::ExecuteTransfer(const boost::function<bool()>& cancel) {
     if (why.empty()) {
         target = TransferTarget(&why);
     }
-    if (why.empty() && (src.empty() || HasControl(src))) {
+    if (why.empty() && (src.empty() || S2S::protocol::HasControl(src))) {
         why = "no usable source path";
     }
     if (!why.empty()) {

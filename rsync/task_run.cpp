@@ -8,10 +8,10 @@
 #include <algorithm>
 #include <utility>
 
+#include "core/protocol.h"
 #include "rsync/path_list.h"
 #include "rsync/transfer_meter.h"
 #include "s2s_platform.h"
-#include "s2s_receiver.h"
 
 namespace S2S {
 
@@ -247,8 +247,8 @@ bool TaskRun::Connect() {
                  S2SPath(S2S_PATH_HOST_CONF));
         return false;
     }
-    if (!ReceiverTaskNameValid(task_.GetInfo().GetName())) {
-        Fail(RunFailure::kLocal, kReceiverTaskNameRule);
+    if (!protocol::TaskNameValid(task_.GetInfo().GetName())) {
+        Fail(RunFailure::kLocal, protocol::kTaskNameRule);
         return false;
     }
     Say("connecting to " + target + " as " + info.GetUser());

@@ -6,7 +6,7 @@
 #include <memory>
 #include <nlohmann/json.hpp>
 
-#include "host/platform_records.h"
+#include "platform/records.h"
 #include "s2s_platform.h"
 #include "tools/s2s/commands.h"
 #include "tools/s2s/exit_codes.h"

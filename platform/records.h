@@ -3,8 +3,8 @@
 // release functions ignore null). The C interface keeps its C shape; these exist on the C++ side
 // only. For the C calls that fill or grow a record through a pointer to pointer, release the
 // record into a raw pointer, make the call and reset the handle with what it left there.
-#ifndef S2S_HOST_PLATFORM_RECORDS_H
-#define S2S_HOST_PLATFORM_RECORDS_H
+#ifndef S2S_PLATFORM_RECORDS_H
+#define S2S_PLATFORM_RECORDS_H
 
 #include <memory>
 
@@ -23,4 +23,4 @@ using ShareRecord = std::unique_ptr<VURNShare, PlatformRecordFree<VURNShare, VUR
 
 }  // namespace S2S
 
-#endif  // S2S_HOST_PLATFORM_RECORDS_H
+#endif  // S2S_PLATFORM_RECORDS_H
