@@ -113,19 +113,12 @@ void RemoveStale(const std::string& dir, const std::string& prefix) {
     _exit(127);
 }
 
-bool ReadFull(int fd, void* data, size_t size) {
-    size_t done = 0;
-    while (done < size) {
-        ssize_t n = read(fd, static_cast<char*>(data) + done, size - done);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return false;
-        }
-        done += static_cast<size_t>(n);
+// One small value from a pipe: a write of up to PIPE_BUF bytes arrives whole or not at all.
+bool ReadValue(int fd, void* data, size_t size) {
+    ssize_t n;
+    while ((n = read(fd, data, size)) < 0 && errno == EINTR) {
     }
-    return true;
+    return n == static_cast<ssize_t>(size);
 }
 
 class Pipe {
@@ -201,19 +194,10 @@ FileLock& FileLock::operator=(FileLock&& other) noexcept {
 }
 
 const char* ReplaceStepName(ReplaceStep step) {
-    switch (step) {
-        case ReplaceStep::kCreate:
-            return "create";
-        case ReplaceStep::kWrite:
-            return "write";
-        case ReplaceStep::kSync:
-            return "fsync";
-        case ReplaceStep::kRename:
-            return "rename";
-        case ReplaceStep::kSyncDir:
-            return "sync the directory of";
-    }
-    return "?";
+    static const char* const kNames[kReplaceSteps] = {"create", "write", "fsync", "rename",
+                                                      "sync the directory of"};
+    int index = static_cast<int>(step) - 1;
+    return index >= 0 && index < kReplaceSteps ? kNames[index] : "?";
 }
 
 // --- Env ---------------------------------------------------------------------------------------
@@ -495,7 +479,7 @@ pid_t Env::Spawn(const SpawnSpec& spec, int* exec_error) {
         pid_report.CloseWrite();
         int status = 0;
         Wait(pid, &status, 0);
-        if (!ReadFull(pid_report.read_end(), &started, sizeof started) || started <= 0 ||
+        if (!ReadValue(pid_report.read_end(), &started, sizeof started) || started <= 0 ||
             !WIFEXITED(status) || WEXITSTATUS(status) != 0) {
             errno = EAGAIN;
             return -1;
@@ -505,7 +489,7 @@ pid_t Env::Spawn(const SpawnSpec& spec, int* exec_error) {
         setpgid(pid, pid);
     }
     int err = 0;
-    if (ReadFull(report.read_end(), &err, sizeof err) && exec_error != nullptr) {
+    if (ReadValue(report.read_end(), &err, sizeof err) && exec_error != nullptr) {
         *exec_error = err != 0 ? err : EIO;
     }
     return started;

@@ -694,6 +694,25 @@ bool NullOrEmpty(const char* text) {
     return text == nullptr || text[0] == '\0';
 }
 
+// Add and replace: the table's pairs set in the section (added to its own, or instead of them),
+// or the section appended when the file has none of that name.
+int PutSection(const char* file, const char* section, const VLIBSzHash* table,
+               const char* lineFormat, bool replace) {
+    Pairs pairs;
+    if (NullOrEmpty(file) || !s2s_platform::ValidSectionName(section) || !ValidFormat(lineFormat) ||
+        !TablePairs(table, pairs)) {
+        return Fail(VLIB_ERR_BAD_PARAMETER);
+    }
+    return s2s_platform::UpdateSectionFile(file, true, [&](SectionDoc& doc) {
+        bool found =
+            replace ? doc.ReplacePairs(section, pairs) : doc.SetPairs(section, pairs, true);
+        if (!found) {
+            doc.AppendSection(section, pairs);
+        }
+        return 1;
+    });
+}
+
 }  // namespace
 
 extern "C" {
@@ -777,17 +796,7 @@ int VLIBCFileSetSection(const char* file, const char* section, const char* oldNa
 
 int VLIBCFileAddSection(const char* file, const char* section, const VLIBSzHash* table,
                         const char* lineFormat) {
-    Pairs pairs;
-    if (NullOrEmpty(file) || !s2s_platform::ValidSectionName(section) || !ValidFormat(lineFormat) ||
-        !TablePairs(table, pairs)) {
-        return Fail(VLIB_ERR_BAD_PARAMETER);
-    }
-    return s2s_platform::UpdateSectionFile(file, true, [&](SectionDoc& doc) {
-        if (!doc.SetPairs(section, pairs, true)) {
-            doc.AppendSection(section, pairs);
-        }
-        return 1;
-    });
+    return PutSection(file, section, table, lineFormat, false);
 }
 
 int VLIBCIFileModifySection(const char* file, const char* section, const char* newName,
@@ -818,17 +827,7 @@ int VLIBCIFileModifySection(const char* file, const char* section, const char* n
 
 int VLIBCFileReplaceSection(const char* file, const char* section, const VLIBSzHash* table,
                             const char* lineFormat) {
-    Pairs pairs;
-    if (NullOrEmpty(file) || !s2s_platform::ValidSectionName(section) || !ValidFormat(lineFormat) ||
-        !TablePairs(table, pairs)) {
-        return Fail(VLIB_ERR_BAD_PARAMETER);
-    }
-    return s2s_platform::UpdateSectionFile(file, true, [&](SectionDoc& doc) {
-        if (!doc.ReplacePairs(section, pairs)) {
-            doc.AppendSection(section, pairs);
-        }
-        return 1;
-    });
+    return PutSection(file, section, table, lineFormat, true);
 }
 
 int VLIBCFileRemoveSection(const char* file, const char* section) {
