@@ -199,6 +199,14 @@ typedef int (*VLIBSectionVisitor)(void* arg, const char* section, int count,
 S2S_EXPORT int VLIBCFileVisitSections(const char* file, const char* prefix,
                                       VLIBSectionVisitor visit, void* arg);
 
+/* Replaces the file `path` whole by the `size` bytes at `data`, so that a crash at any moment
+ * leaves the old content or the new one under its name, never a mix: a temporary file with a
+ * unique name is created beside it (exclusively, never through a symbolic link) with `mode`
+ * (not subject to the umask), written, synced, renamed over `path`, and the directory synced.
+ * 0; -1 on failure with errno set and the last platform error (the old file then stays as it
+ * was, and no temporary file is left). */
+S2S_EXPORT int S2SFileReplace(const char* path, const void* data, size_t size, unsigned int mode);
+
 /* ---------------------------------------------------------------------------------------------
  * Cross-process semaphores (System V, one binary semaphore per integer key, created on first
  * open with permission 0600 and kept by the system). Locks are taken with SEM_UNDO: a process

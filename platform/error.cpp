@@ -1,8 +1,5 @@
 // The per-thread last platform error, and small helpers the platform sources share.
 #include <errno.h>
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <cstring>
 
@@ -42,65 +39,6 @@ int ErrorFromErrno(int errnum) {
         default:
             return VLIB_ERR_IO;
     }
-}
-
-int ReadWholeFd(int fd, std::string& out, size_t limit) {
-    out.clear();
-    char chunk[65536];
-    for (;;) {
-        ssize_t n = read(fd, chunk, sizeof(chunk));
-        if (n < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            return -1;
-        }
-        if (n == 0) {
-            return 0;
-        }
-        if (out.size() + static_cast<size_t>(n) > limit) {
-            errno = EFBIG;
-            return -1;
-        }
-        out.append(chunk, static_cast<size_t>(n));
-    }
-}
-
-int ReadWholeFile(const std::string& path, std::string& out, size_t limit) {
-    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) {
-        return -1;
-    }
-    int rc = ReadWholeFd(fd, out, limit);
-    int saved = errno;
-    close(fd);
-    errno = saved;
-    return rc;
-}
-
-int MakeDirs(const std::string& dir) {
-    if (dir.empty()) {
-        errno = EINVAL;
-        return -1;
-    }
-    struct stat st;
-    if (stat(dir.c_str(), &st) == 0) {
-        if (S_ISDIR(st.st_mode)) {
-            return 0;
-        }
-        errno = ENOTDIR;
-        return -1;
-    }
-    size_t slash = dir.find_last_of('/');
-    if (slash != std::string::npos && slash > 0) {
-        if (MakeDirs(dir.substr(0, slash)) != 0) {
-            return -1;
-        }
-    }
-    if (mkdir(dir.c_str(), 0755) != 0 && errno != EEXIST) {
-        return -1;
-    }
-    return 0;
 }
 
 std::string Trim(const std::string& text) {

@@ -22,6 +22,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/env.h"
 #include "platform/platform_internal.h"
 #include "platform/section_file.h"
 #include "s2s_logger.h"
@@ -83,7 +84,7 @@ bool IsPlaceholderSerial(const std::string& serial) {
 std::string DmiSerial() {
     std::string text;
     const char* path = S2SPath(S2S_PATH_DMI_SERIAL);
-    if (path == nullptr || s2s_platform::ReadWholeFile(path, text, 4096) != 0) {
+    if (path == nullptr || s2s_platform::Env::Default()->ReadWholeFile(path, text, 4096) != 0) {
         return std::string();
     }
     text = s2s_platform::Trim(text.substr(0, text.find('\n')));
@@ -120,7 +121,7 @@ struct Mount {
 
 bool ReadMounts(std::vector<Mount>& mounts) {
     std::string text;
-    if (s2s_platform::ReadWholeFile("/proc/self/mountinfo", text, 16u << 20) != 0) {
+    if (s2s_platform::Env::Default()->ReadWholeFile("/proc/self/mountinfo", text, 16u << 20) != 0) {
         return false;
     }
     size_t pos = 0;
@@ -160,7 +161,8 @@ bool Contains(const std::string& prefix, const std::string& path) {
 
 bool ReadFlag(const std::string& path) {
     std::string text;
-    return s2s_platform::ReadWholeFile(path, text, 64) == 0 && s2s_platform::Trim(text) == "1";
+    return s2s_platform::Env::Default()->ReadWholeFile(path, text, 64) == 0 &&
+           s2s_platform::Trim(text) == "1";
 }
 
 // A block device counts as external when it (or the disk of a partition) is removable or hangs

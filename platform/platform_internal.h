@@ -1,5 +1,5 @@
-// Helpers shared by the platform layer's sources: the per-thread last error, the ERROR line, and
-// small file utilities. Nothing here is exported.
+// Helpers shared by the platform layer's sources: the per-thread last error and small string
+// utilities (file access goes through platform/env.h). Nothing here is exported.
 #ifndef S2S_PLATFORM_PLATFORM_INTERNAL_H
 #define S2S_PLATFORM_PLATFORM_INTERNAL_H
 
@@ -16,13 +16,6 @@ int Succeed(int result);
 // The platform error that matches a system errno (ENOENT, EACCES, ENOMEM, other I/O).
 int ErrorFromErrno(int errnum);
 
-// Reads a whole file into `out`. 0, or -1 with errno set. Refuses files above `limit` bytes
-// (EFBIG).
-int ReadWholeFile(const std::string& path, std::string& out, size_t limit);
-// The same from an open descriptor, from its current offset; the descriptor stays open.
-int ReadWholeFd(int fd, std::string& out, size_t limit);
-// Creates `dir` and its missing parents with mode 0755. 0, or -1 with errno set.
-int MakeDirs(const std::string& dir);
 // Blanks (space, tab, CR, LF) removed at both ends.
 std::string Trim(const std::string& text);
 // Copies `value` with its NUL into buf of `size` bytes. Its length, or -1 with

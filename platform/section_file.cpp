@@ -1,7 +1,6 @@
 // Section files: parsing, atomic replacement, and the exported VLIBCFile* functions.
 #include "platform/section_file.h"
 
-#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
@@ -18,6 +17,7 @@
 #include <mutex>
 #include <new>
 
+#include "platform/env.h"
 #include "platform/platform_internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
@@ -27,16 +27,6 @@ namespace s2s_platform {
 namespace {
 
 using S2S::Logger;
-
-std::function<int(const char*)>& WriteFault() {
-    static std::function<int(const char*)> fault;
-    return fault;
-}
-
-int InjectedFault(const char* step) {
-    const auto& fault = WriteFault();
-    return fault ? fault(step) : 0;
-}
 
 bool HasLineBreak(const char* text) {
     return std::strpbrk(text, "\r\n") != nullptr;
@@ -48,120 +38,17 @@ bool HasOuterBlank(const char* text) {
     return len > 0 && (blank(text[0]) || blank(text[len - 1]));
 }
 
-std::string DirName(const std::string& path) {
-    size_t slash = path.find_last_of('/');
-    if (slash == std::string::npos) {
-        return ".";
-    }
-    return slash == 0 ? "/" : path.substr(0, slash);
-}
-
-std::string BaseName(const std::string& path) {
-    size_t slash = path.find_last_of('/');
-    return slash == std::string::npos ? path : path.substr(slash + 1);
-}
-
-// A writer that died between creating its temporary file and renaming it leaves the file behind.
-// Only the holder of the lock on the current file can have a temporary file in flight, so while
-// holding it every leftover with our prefix is stale.
-void RemoveStaleTemporaries(const std::string& dir, const std::string& prefix) {
-    DIR* d = opendir(dir.c_str());
-    if (d == nullptr) {
-        return;
-    }
-    while (dirent* entry = readdir(d)) {
-        if (std::strncmp(entry->d_name, prefix.c_str(), prefix.size()) == 0) {
-            unlinkat(dirfd(d), entry->d_name, 0);
-        }
-    }
-    closedir(d);
-}
-
-int WriteAll(int fd, const std::string& data) {
-    size_t done = 0;
-    while (done < data.size()) {
-        ssize_t n = write(fd, data.data() + done, data.size() - done);
-        if (n < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            return -1;
-        }
-        done += static_cast<size_t>(n);
-    }
-    return 0;
-}
-
 // Replaces `target` by a file holding `content`, with the mode and owner of `old`.
 int ReplaceFile(const std::string& target, const struct stat& old, const std::string& content) {
-    std::string dir = DirName(target);
-    std::string prefix = "." + BaseName(target) + ".s2stmp-";
-    RemoveStaleTemporaries(dir, prefix);
-    std::string temp = dir + "/" + prefix + "XXXXXX";
-    int fd = mkostemp(&temp[0], O_CLOEXEC);
-    if (fd < 0) {
-        int saved = errno;
-        Logger::LogMsg(Logger::Error,
-                       "[ERROR] section_file.cpp(%d): Fail to create a temporary file in '%s', "
-                       "error:'%s'\n",
-                       __LINE__, dir.c_str(), std::strerror(saved));
-        return Fail(ErrorFromErrno(saved));
-    }
-    const char* step = "chmod";
-    int err = 0;
-    if (fchmod(fd, old.st_mode & 07777) != 0) {
-        err = errno;
-    }
-    if (err == 0 && (old.st_uid != geteuid() || old.st_gid != getegid())) {
-        // Only root can hand the file back to its owner; anyone else keeps writing as themselves.
-        if (fchown(fd, old.st_uid, old.st_gid) != 0 && errno != EPERM) {
-            step = "chown";
-            err = errno;
-        }
-    }
-    if (err == 0) {
-        step = "write";
-        err = InjectedFault(step);
-        if (err == 0 && WriteAll(fd, content) != 0) {
-            err = errno;
-        }
-    }
-    if (err == 0) {
-        step = "fsync";
-        err = InjectedFault(step);
-        if (err == 0 && fsync(fd) != 0) {
-            err = errno;
-        }
-    }
-    if (close(fd) != 0 && err == 0) {
-        step = "close";
-        err = errno;
-    }
-    if (err == 0) {
-        step = "rename";
-        err = InjectedFault(step);
-        if (err == 0 && rename(temp.c_str(), target.c_str()) != 0) {
-            err = errno;
-        }
-    }
-    if (err != 0) {
-        unlink(temp.c_str());
-        Logger::LogMsg(Logger::Error,
-                       "[ERROR] section_file.cpp(%d): Fail to %s the new content of '%s', "
-                       "error:'%s'\n",
-                       __LINE__, step, target.c_str(), std::strerror(err));
-        return Fail(ErrorFromErrno(err));
-    }
-    // The new name is in place; syncing the directory makes the rename itself durable.
-    int dfd = open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dfd >= 0) {
-        if (fsync(dfd) != 0) {
-            Logger::LogMsg(Logger::Warning,
-                           "[WARNING] section_file.cpp(%d): Fail to sync directory '%s', "
-                           "error:'%s'\n",
-                           __LINE__, dir.c_str(), std::strerror(errno));
-        }
-        close(dfd);
+    ReplaceOptions options;
+    options.mode = old.st_mode & 07777;
+    options.uid = old.st_uid;
+    options.gid = old.st_gid;
+    // Only the holder of the lock on the current file can have a temporary file in flight.
+    options.sweep_stale = true;
+    options.log_tag = "section_file.cpp";
+    if (Env::Default()->ReplaceFile(target, content, options) != 0) {
+        return Fail(ErrorFromErrno(errno));
     }
     return 0;
 }
@@ -597,8 +484,7 @@ int LoadSectionFileShared(const std::string& path, std::shared_ptr<const Section
     }
     // Taken before the file is opened: whatever changes it after this moment stamps a ctime no
     // earlier than about now.
-    struct timespec read_start;
-    clock_gettime(CLOCK_REALTIME, &read_start);
+    struct timespec read_start = Env::Default()->WallClock();
     int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
     if (fd < 0) {
         return ReadFailure(path, errno);
@@ -606,7 +492,7 @@ int LoadSectionFileShared(const std::string& path, std::shared_ptr<const Section
     struct stat opened;
     bool known = fstat(fd, &opened) == 0 && S_ISREG(opened.st_mode);
     auto text = std::make_shared<std::string>();
-    if (ReadWholeFd(fd, *text, kSectionFileMax) != 0) {
+    if (Env::Default()->ReadWholeFd(fd, *text, kSectionFileMax) != 0) {
         int saved = errno;
         close(fd);
         return ReadFailure(path, saved);
@@ -676,9 +562,7 @@ int UpdateSectionFile(const std::string& path, bool create,
                            __LINE__, target.c_str(), std::strerror(saved));
             return Fail(ErrorFromErrno(saved));
         }
-        int rc;
-        while ((rc = flock(fd, LOCK_EX)) != 0 && errno == EINTR) {
-        }
+        int rc = Env::Default()->LockFd(fd);
         struct stat held;
         struct stat current;
         if (rc != 0 || fstat(fd, &held) != 0) {
@@ -696,7 +580,7 @@ int UpdateSectionFile(const std::string& path, bool create,
             continue;
         }
         std::string text;
-        if (ReadWholeFd(fd, text, kSectionFileMax) != 0) {
+        if (Env::Default()->ReadWholeFd(fd, text, kSectionFileMax) != 0) {
             int saved = errno;
             close(fd);
             Logger::LogMsg(Logger::Error,
@@ -745,10 +629,6 @@ int UpdateSectionFile(const std::string& path, bool create,
                    "[ERROR] section_file.cpp(%d): Section file '%s' keeps being replaced\n",
                    __LINE__, target.c_str());
     return Fail(VLIB_ERR_IO);
-}
-
-void SetSectionWriteFault(std::function<int(const char* step)> fault) {
-    WriteFault() = std::move(fault);
 }
 
 bool ValidSectionName(const char* name) {
@@ -800,8 +680,37 @@ bool TablePairs(const VLIBSzHash* table, Pairs& pairs) {
     return true;
 }
 
+// An update that found nothing to change (0) reports the section absent; one that wrote, none.
+int AbsentAsNotFound(int result) {
+    if (result == 0) {
+        s2s_platform::SetError(VLIB_ERR_NOT_FOUND);
+    } else if (result > 0) {
+        s2s_platform::SetError(VLIB_ERR_NONE);
+    }
+    return result;
+}
+
 bool NullOrEmpty(const char* text) {
     return text == nullptr || text[0] == '\0';
+}
+
+// Add and replace: the table's pairs set in the section (added to its own, or instead of them),
+// or the section appended when the file has none of that name.
+int PutSection(const char* file, const char* section, const VLIBSzHash* table,
+               const char* lineFormat, bool replace) {
+    Pairs pairs;
+    if (NullOrEmpty(file) || !s2s_platform::ValidSectionName(section) || !ValidFormat(lineFormat) ||
+        !TablePairs(table, pairs)) {
+        return Fail(VLIB_ERR_BAD_PARAMETER);
+    }
+    return s2s_platform::UpdateSectionFile(file, true, [&](SectionDoc& doc) {
+        bool found =
+            replace ? doc.ReplacePairs(section, pairs) : doc.SetPairs(section, pairs, true);
+        if (!found) {
+            doc.AppendSection(section, pairs);
+        }
+        return 1;
+    });
 }
 
 }  // namespace
@@ -887,17 +796,7 @@ int VLIBCFileSetSection(const char* file, const char* section, const char* oldNa
 
 int VLIBCFileAddSection(const char* file, const char* section, const VLIBSzHash* table,
                         const char* lineFormat) {
-    Pairs pairs;
-    if (NullOrEmpty(file) || !s2s_platform::ValidSectionName(section) || !ValidFormat(lineFormat) ||
-        !TablePairs(table, pairs)) {
-        return Fail(VLIB_ERR_BAD_PARAMETER);
-    }
-    return s2s_platform::UpdateSectionFile(file, true, [&](SectionDoc& doc) {
-        if (!doc.SetPairs(section, pairs, true)) {
-            doc.AppendSection(section, pairs);
-        }
-        return 1;
-    });
+    return PutSection(file, section, table, lineFormat, false);
 }
 
 int VLIBCIFileModifySection(const char* file, const char* section, const char* newName,
@@ -923,27 +822,12 @@ int VLIBCIFileModifySection(const char* file, const char* section, const char* n
         doc.SetPairs(name, pairs, addKeys != 0);
         return 1;
     });
-    if (result == 0) {
-        s2s_platform::SetError(VLIB_ERR_NOT_FOUND);
-    } else if (result > 0) {
-        s2s_platform::SetError(VLIB_ERR_NONE);
-    }
-    return result;
+    return AbsentAsNotFound(result);
 }
 
 int VLIBCFileReplaceSection(const char* file, const char* section, const VLIBSzHash* table,
                             const char* lineFormat) {
-    Pairs pairs;
-    if (NullOrEmpty(file) || !s2s_platform::ValidSectionName(section) || !ValidFormat(lineFormat) ||
-        !TablePairs(table, pairs)) {
-        return Fail(VLIB_ERR_BAD_PARAMETER);
-    }
-    return s2s_platform::UpdateSectionFile(file, true, [&](SectionDoc& doc) {
-        if (!doc.ReplacePairs(section, pairs)) {
-            doc.AppendSection(section, pairs);
-        }
-        return 1;
-    });
+    return PutSection(file, section, table, lineFormat, true);
 }
 
 int VLIBCFileRemoveSection(const char* file, const char* section) {
@@ -952,12 +836,7 @@ int VLIBCFileRemoveSection(const char* file, const char* section) {
     }
     int result = s2s_platform::UpdateSectionFile(
         file, false, [&](SectionDoc& doc) { return doc.RemoveSection(section) ? 1 : 0; });
-    if (result == 0) {
-        s2s_platform::SetError(VLIB_ERR_NOT_FOUND);
-    } else if (result > 0) {
-        s2s_platform::SetError(VLIB_ERR_NONE);
-    }
-    return result;
+    return AbsentAsNotFound(result);
 }
 
 int VLIBCFileEnumSection(const char* file, VLIBSzList** list) {

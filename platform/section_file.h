@@ -100,16 +100,12 @@ void ForgetSectionFile(const std::string& path);
 
 // The one writer path. Locks the file against other writers, reads and parses it (creating it
 // empty first when `create` and it is missing), lets `edit` change the document, and when `edit`
-// returns 1 replaces the file: temporary file in the same directory, fsync, rename, fsync of the
-// directory. `edit` returns 1 (write), 0 (leave the file alone) or -1 (failure, error set).
-// Returns what `edit` returned, or -1 with the error set (and logged) when the file cannot be
-// read, parsed or replaced; on every failure the old file stays as it was.
+// returns 1 replaces the file through Env::ReplaceFile (keeping the file's mode and owner). `edit`
+// returns 1 (write), 0 (leave the file alone) or -1 (failure, error set). Returns what `edit`
+// returned, or -1 with the error set (and logged) when the file cannot be read, parsed or replaced;
+// on every failure the old file stays as it was.
 int UpdateSectionFile(const std::string& path, bool create,
                       const std::function<int(SectionDoc&)>& edit);
-
-// Test hook: called before each step of a replacement ("write", "fsync", "rename") with the step
-// name; a non-zero errno it returns makes that step fail with that errno. Empty: no faults.
-void SetSectionWriteFault(std::function<int(const char* step)> fault);
 
 // Checks for names, keys and values the file syntax cannot carry (see s2s_platform.h).
 bool ValidSectionName(const char* name);

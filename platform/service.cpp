@@ -4,8 +4,6 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
-#include <spawn.h>
-#include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -16,11 +14,10 @@
 #include <cstring>
 #include <string>
 
+#include "platform/env.h"
 #include "platform/platform_internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
-
-extern char** environ;
 
 using S2S::Logger;
 using s2s_platform::Fail;
@@ -34,7 +31,8 @@ constexpr int kKillWaitMs = 5000;
 // The process state letter and start time (clock ticks after boot) from /proc/<pid>/stat.
 bool ProcStat(pid_t pid, char& state, unsigned long long& start) {
     std::string text;
-    if (s2s_platform::ReadWholeFile("/proc/" + std::to_string(pid) + "/stat", text, 4096) != 0) {
+    if (s2s_platform::Env::Default()->ReadWholeFile("/proc/" + std::to_string(pid) + "/stat", text,
+                                                    4096) != 0) {
         return false;
     }
     // The command name may hold blanks and parentheses; the fields resume after the last ')'.
@@ -69,7 +67,7 @@ bool ProcessAlive(pid_t pid) {
 // The pid (and, when recorded, the start time) of a pid file; false when missing or garbage.
 bool ReadPidFile(const char* path, pid_t& pid, unsigned long long& start) {
     std::string text;
-    if (path == nullptr || s2s_platform::ReadWholeFile(path, text, 256) != 0) {
+    if (path == nullptr || s2s_platform::Env::Default()->ReadWholeFile(path, text, 256) != 0) {
         return false;
     }
     std::string first = s2s_platform::Trim(text.substr(0, text.find('\n')));
@@ -118,30 +116,33 @@ bool UseSystemd() {
     return stat(S2S_PATH_SYSTEMD_RUNTIME, &st) == 0 && S_ISDIR(st.st_mode);
 }
 
-// Runs systemctl with the given arguments; its exit status, or -1 when it could not run.
+// Runs systemctl with the given arguments; its exit status, or -1 when it could not run. Its
+// errors reach our standard error; its output too unless `quiet`.
 int Systemctl(const char* verb, const char* name, bool quiet) {
+    s2s_platform::Env* env = s2s_platform::Env::Default();
     std::string unit = std::string(name) + ".service";
-    const char* argv[] = {"systemctl", verb, quiet ? "--quiet" : unit.c_str(),
-                          quiet ? unit.c_str() : nullptr, nullptr};
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
-    if (quiet) {
-        posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-    }
-    pid_t pid = -1;
-    int rc =
-        posix_spawnp(&pid, "systemctl", &actions, nullptr, const_cast<char* const*>(argv), environ);
-    posix_spawn_file_actions_destroy(&actions);
-    if (rc != 0) {
-        errno = rc;
+    s2s_platform::SpawnSpec spec;
+    spec.program = s2s_platform::FindProgram("systemctl");
+    if (spec.program.empty()) {
+        errno = ENOENT;
         return -1;
     }
+    spec.argv = {"systemctl", verb};
+    if (quiet) {
+        spec.argv.push_back("--quiet");
+    }
+    spec.argv.push_back(unit);
+    spec.output_fd = quiet ? -1 : STDOUT_FILENO;
+    spec.error_fd = STDERR_FILENO;
+    int exec_error = 0;
+    pid_t pid = env->Spawn(spec, &exec_error);
     int status = 0;
-    while (waitpid(pid, &status, 0) < 0) {
-        if (errno != EINTR) {
-            return -1;
-        }
+    if (pid < 0 || env->Wait(pid, &status, 0) < 0) {
+        return -1;
+    }
+    if (exec_error != 0) {
+        errno = exec_error;
+        return -1;
     }
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
@@ -182,36 +183,14 @@ bool ServiceAlive(const char* name, pid_t* pid_out) {
 }
 
 // Start and stop of one run directory are serialised by an flock on the directory itself.
-class RunDirLock {
-  public:
-    RunDirLock() {
-        std::string dir = RunDir();
-        if (s2s_platform::MakeDirs(dir) != 0) {
-            return;
-        }
-        fd_ = open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-        if (fd_ >= 0) {
-            while (flock(fd_, LOCK_EX) != 0) {
-                if (errno != EINTR) {
-                    close(fd_);
-                    fd_ = -1;
-                    return;
-                }
-            }
-        }
+s2s_platform::FileLock LockRunDir() {
+    std::string dir = RunDir();
+    s2s_platform::Env* env = s2s_platform::Env::Default();
+    if (env->MakeDirs(dir) != 0) {
+        return s2s_platform::FileLock();
     }
-    ~RunDirLock() {
-        if (fd_ >= 0) {
-            close(fd_);
-        }
-    }
-    RunDirLock(const RunDirLock&) = delete;
-    RunDirLock& operator=(const RunDirLock&) = delete;
-    bool ok() const { return fd_ >= 0; }
-
-  private:
-    int fd_ = -1;
-};
+    return env->LockPath(dir, true);
+}
 
 int WritePidFile(const std::string& path, pid_t pid) {
     std::string text = std::to_string(pid) + "\n";
@@ -220,121 +199,29 @@ int WritePidFile(const std::string& path, pid_t pid) {
     if (ProcStat(pid, state, start)) {
         text += std::to_string(start) + "\n";
     }
-    std::string temp = path + ".tmp";
-    int fd = open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-    if (fd < 0) {
-        return -1;
-    }
-    bool ok = write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size());
-    ok = close(fd) == 0 && ok;
-    if (!ok || rename(temp.c_str(), path.c_str()) != 0) {
-        int saved = errno;
-        unlink(temp.c_str());
-        errno = saved;
-        return -1;
-    }
-    return 0;
+    // Written under the run directory's lock: a temporary left by a dead starter is stale.
+    s2s_platform::ReplaceOptions options;
+    options.sweep_stale = true;
+    return s2s_platform::Env::Default()->ReplaceFile(path, text, options);
 }
 
-bool ReadFull(int fd, void* data, size_t size) {
-    size_t done = 0;
-    while (done < size) {
-        ssize_t n = read(fd, static_cast<char*>(data) + done, size - done);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            return false;
-        }
-        done += static_cast<size_t>(n);
-    }
-    return true;
-}
-
-// Starts `exe` detached: a child starts a new session and forks the service, so the service is
-// nobody's child here and init reaps it. The service's pid travels back through one pipe; a
-// close-on-exec pipe reports whether exec itself worked. Returns the pid, or -1 with errno.
+// Starts `exe` detached (a session of its own, nobody's child here: init reaps it), with every
+// inherited descriptor closed, so it keeps none of the caller's sockets and locks alive. Returns
+// its pid, or -1 with errno (also when exec failed).
 pid_t SpawnDetached(const std::string& exe, const char* name) {
-    int pid_pipe[2];
-    int exec_pipe[2];
-    if (pipe2(pid_pipe, O_CLOEXEC) != 0) {
-        return -1;
-    }
-    if (pipe2(exec_pipe, O_CLOEXEC) != 0) {
-        int saved = errno;
-        close(pid_pipe[0]);
-        close(pid_pipe[1]);
-        errno = saved;
-        return -1;
-    }
-    pid_t middle = fork();
-    if (middle < 0) {
-        int saved = errno;
-        close(pid_pipe[0]);
-        close(pid_pipe[1]);
-        close(exec_pipe[0]);
-        close(exec_pipe[1]);
-        errno = saved;
-        return -1;
-    }
-    if (middle == 0) {
-        // Only async-signal-safe calls from here on: the caller may have other threads.
-        setsid();
-        pid_t service = fork();
-        if (service == 0) {
-            sigset_t none;
-            sigemptyset(&none);
-            sigprocmask(SIG_SETMASK, &none, nullptr);
-            signal(SIGPIPE, SIG_DFL);
-            int null_fd = open("/dev/null", O_RDWR);
-            if (null_fd >= 0) {
-                dup2(null_fd, 0);
-                dup2(null_fd, 1);
-                dup2(null_fd, 2);
-                if (null_fd > 2) {
-                    close(null_fd);
-                }
-            }
-            // Descriptors the caller left inheritable must not keep its sockets and locks alive.
-            for (int fd = 3; fd < 1024; ++fd) {
-                if (fd != exec_pipe[1]) {
-                    close(fd);
-                }
-            }
-            if (chdir("/") != 0) {
-                // Not fatal: the service chooses its own working directory.
-            }
-            char* const argv[] = {const_cast<char*>(name), nullptr};
-            execv(exe.c_str(), argv);
-            int err = errno;
-            ssize_t ignored = write(exec_pipe[1], &err, sizeof(err));
-            (void)ignored;
-            _exit(127);
-        }
-        ssize_t ignored = write(pid_pipe[1], &service, sizeof(service));
-        (void)ignored;
-        _exit(service < 0 ? 1 : 0);
-    }
-    close(pid_pipe[1]);
-    close(exec_pipe[1]);
-    int status = 0;
-    while (waitpid(middle, &status, 0) < 0 && errno == EINTR) {
-    }
-    pid_t service = -1;
-    bool have_pid = ReadFull(pid_pipe[0], &service, sizeof(service)) && service > 0;
-    close(pid_pipe[0]);
+    s2s_platform::SpawnSpec spec;
+    spec.program = exe;
+    spec.argv = {name};
+    spec.detached = true;
+    spec.close_other_fds = true;
+    spec.chdir = "/";
     int exec_error = 0;
-    bool exec_failed = have_pid && ReadFull(exec_pipe[0], &exec_error, sizeof(exec_error));
-    close(exec_pipe[0]);
-    if (!have_pid) {
-        errno = EAGAIN;
-        return -1;
-    }
-    if (exec_failed) {
+    pid_t pid = s2s_platform::Env::Default()->Spawn(spec, &exec_error);
+    if (pid > 0 && exec_error != 0) {
         errno = exec_error;
         return -1;
     }
-    return service;
+    return pid;
 }
 
 // Waits until `pid` has exited (or turned zombie), at most `limit_ms`. True when it is gone.
@@ -409,8 +296,8 @@ int VLIBServiceStart(const char* name, int flags) {
         return rc == 5 ? Fail(VLIB_ERR_SERVICE_UNKNOWN)
                        : ServiceFailure(__LINE__, "start", name, rc < 0 ? errno : EIO);
     }
-    RunDirLock lock;
-    if (!lock.ok()) {
+    s2s_platform::FileLock lock = LockRunDir();
+    if (!lock.held()) {
         return ServiceFailure(__LINE__, "lock the run directory of", name, errno);
     }
     if (ServiceAlive(name, nullptr)) {
@@ -433,7 +320,7 @@ int VLIBServiceStart(const char* name, int flags) {
     }
     if (WritePidFile(PidFilePath(name), pid) != 0) {
         int saved = errno;
-        kill(pid, SIGTERM);
+        s2s_platform::Env::Default()->Kill(pid, SIGTERM);
         return ServiceFailure(__LINE__, "record the pid of", name, saved);
     }
     return Succeed(0);
@@ -450,8 +337,8 @@ int VLIBServicePause(const char* name) {
         int rc = Systemctl("stop", name, false);
         return rc == 0 ? Succeed(0) : ServiceFailure(__LINE__, "stop", name, rc < 0 ? errno : EIO);
     }
-    RunDirLock lock;
-    if (!lock.ok()) {
+    s2s_platform::FileLock lock = LockRunDir();
+    if (!lock.held()) {
         return ServiceFailure(__LINE__, "lock the run directory of", name, errno);
     }
     std::string pid_file = PidFilePath(name);
@@ -460,14 +347,14 @@ int VLIBServicePause(const char* name) {
         unlink(pid_file.c_str());  // stale or missing
         return Fail(VLIB_ERR_SERVICE_ALREADY);
     }
-    if (kill(pid, SIGTERM) != 0 && errno != ESRCH) {
+    if (s2s_platform::Env::Default()->Kill(pid, SIGTERM) != 0 && errno != ESRCH) {
         return ServiceFailure(__LINE__, "signal", name, errno);
     }
     if (!WaitGone(pid, kStopGraceMs)) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] service.cpp(%d): Service '%s' ignored SIGTERM, killing it\n",
                        __LINE__, name);
-        kill(pid, SIGKILL);
+        s2s_platform::Env::Default()->Kill(pid, SIGKILL);
         if (!WaitGone(pid, kKillWaitMs)) {
             return ServiceFailure(__LINE__, "stop", name, ETIMEDOUT);
         }

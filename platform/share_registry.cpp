@@ -7,6 +7,7 @@
 #include <string>
 
 #include "core/protocol.h"
+#include "platform/env.h"
 #include "platform/platform_internal.h"
 #include "platform/section_file.h"
 #include "s2s_logger.h"
@@ -422,7 +423,7 @@ int VURNShareSet(const char* name, const VLIBSzHash* attrs) {
         std::string path = RegistryPath();
         size_t slash = path.find_last_of('/');
         if (slash != std::string::npos && slash > 0 &&
-            s2s_platform::MakeDirs(path.substr(0, slash)) != 0) {
+            s2s_platform::Env::Default()->MakeDirs(path.substr(0, slash)) != 0) {
             int saved = errno;
             Logger::LogMsg(Logger::Error,
                            "[ERROR] share_registry.cpp(%d): Fail to create the directory of '%s', "

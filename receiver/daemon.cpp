@@ -5,17 +5,13 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
-#include <linux/capability.h>
 #include <netinet/in.h>
 #include <poll.h>
 #include <pwd.h>
 #include <signal.h>
-#include <sys/file.h>
-#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -38,6 +34,7 @@
 #include "core/protocol.h"
 #include "host/pairing_store.h"
 #include "platform/records.h"
+#include "platform/env.h"
 #include "receiver/internal.h"
 #include "rsync/child_process.h"
 #include "s2s_logger.h"
@@ -89,11 +86,7 @@ bool ValidAddress(const std::string& s) {
 }
 
 void MakeDirs(const std::string& dir, mode_t mode) {
-    for (size_t pos = 1; pos <= dir.size(); ++pos) {
-        if (pos == dir.size() || dir[pos] == '/') {
-            mkdir(dir.substr(0, pos).c_str(), mode);
-        }
-    }
+    s2s_platform::Env::Default()->MakeDirs(dir, mode);
 }
 
 std::string Parent(const std::string& path) {
@@ -101,21 +94,13 @@ std::string Parent(const std::string& path) {
     return slash == std::string::npos || slash == 0 ? std::string("/") : path.substr(0, slash);
 }
 
-// Writes a file through a temporary name and a rename, with `mode` from the start.
+// Replaces a file whole, with `mode` from the start. Only called under the administration lock,
+// so a temporary file a writer that died left behind is stale.
 bool WriteFileAtomic(const std::string& path, const std::string& content, mode_t mode) {
-    std::string tmp = path + ".tmp";
-    int fd = open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, mode);
-    if (fd < 0) {
-        return false;
-    }
-    bool ok = fchmod(fd, mode) == 0 && receiver_internal::WriteAll(fd, content);
-    ok = fsync(fd) == 0 && ok;
-    ok = close(fd) == 0 && ok;
-    if (!ok || rename(tmp.c_str(), path.c_str()) != 0) {
-        unlink(tmp.c_str());
-        return false;
-    }
-    return true;
+    s2s_platform::ReplaceOptions options;
+    options.mode = mode;
+    options.sweep_stale = true;
+    return s2s_platform::Env::Default()->ReplaceFile(path, content, options) == 0;
 }
 
 std::string Quote(const std::string& s) {
@@ -437,28 +422,12 @@ class AdminLock {
     AdminLock() {
         const std::string path = S2SPath(S2S_PATH_RECEIVER_LOCK);
         MakeDirs(Parent(path), 0755);
-        fd_ = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
-        if (fd_ >= 0) {
-            int rc;
-            while ((rc = flock(fd_, LOCK_EX)) != 0 && errno == EINTR) {
-            }
-            if (rc != 0) {
-                close(fd_);
-                fd_ = -1;
-            }
-        }
+        lock_ = s2s_platform::Env::Default()->LockPath(path, false);
     }
-    ~AdminLock() {
-        if (fd_ >= 0) {
-            close(fd_);
-        }
-    }
-    AdminLock(const AdminLock&) = delete;
-    AdminLock& operator=(const AdminLock&) = delete;
-    bool held() const { return fd_ >= 0; }
+    bool held() const { return lock_.held(); }
 
   private:
-    int fd_ = -1;
+    s2s_platform::FileLock lock_;
 };
 
 // Key files are private to root: directories 0700, files 0600, whatever an earlier version or a
@@ -776,66 +745,24 @@ int StartLocked(std::string* error) {
     const bool devices = DevicesAllowed(conf);
 
     // The daemon outlives this program in a session of its own and stays in the foreground of
-    // it (--no-detach), so that the pid it writes is the one to stop.
-    std::string configArg = "--config=" + conf;
-    std::vector<char*> argv = {const_cast<char*>(rsync.c_str()), const_cast<char*>("--daemon"),
-                               const_cast<char*>("--no-detach"), &configArg[0], nullptr};
-    // The intermediate child reports the daemon's pid, so that a daemon that dies before it
-    // writes its pid file (a port in use) is noticed at once.
-    int report[2];
-    if (pipe2(report, O_CLOEXEC) != 0) {
-        SetEnabled(false);
-        return Fail(error, std::string("pipe: ") + strerror(errno));
-    }
-    pid_t first = fork();
-    if (first < 0) {
-        close(report[0]);
-        close(report[1]);
-        SetEnabled(false);
-        return Fail(error, std::string("fork: ") + strerror(errno));
-    }
-    if (first == 0) {
-        pid_t daemon = fork();
-        if (daemon != 0) {
-            ssize_t ignored = write(report[1], &daemon, sizeof daemon);
-            (void)ignored;
-            _exit(daemon < 0 ? 1 : 0);
-        }
-        // The daemon leads a session and process group of its own: every connection process
-        // and hook it forks stays in that group, which is how a stop finds and ends them all.
-        if (setsid() < 0) {
-            _exit(1);
-        }
-        // Unless a share asks for them, neither the daemon nor anything it starts can create
-        // device files, whatever a client sends (rsync's option refusal does not hold for -D).
-        if (!devices && prctl(PR_CAPBSET_DROP, CAP_MKNOD, 0, 0, 0) != 0) {
-            _exit(1);
-        }
-        // Module names are matched with ASCII case folding only, as the share registry
-        // assumes (VURNShareModuleKey).
-        setenv("LC_ALL", "C", 1);
-        int devnull = open("/dev/null", O_RDWR);
-        if (devnull >= 0) {
-            dup2(devnull, 0);
-            dup2(devnull, 1);
-            dup2(devnull, 2);
-        }
-        for (int fd = 3; fd < 1024; ++fd) {
-            close(fd);
-        }
-        execv(rsync.c_str(), argv.data());
-        _exit(127);
-    }
-    close(report[1]);
-    pid_t started = -1;
-    if (read(report[0], &started, sizeof started) != static_cast<ssize_t>(sizeof started)) {
-        started = -1;
-    }
-    close(report[0]);
-    int status = 0;
-    while (waitpid(first, &status, 0) < 0 && errno == EINTR) {
-    }
-    if (!WIFEXITED(status) || WEXITSTATUS(status) != 0 || started <= 0) {
+    // it (--no-detach), so that the pid it writes is the one to stop. It leads its session and
+    // process group: every connection process and hook it forks stays in that group, which is
+    // how a stop finds and ends them all.
+    s2s_platform::SpawnSpec spec;
+    spec.program = rsync;
+    spec.argv = {rsync, "--daemon", "--no-detach", "--config=" + conf};
+    spec.detached = true;
+    spec.close_other_fds = true;
+    // Unless a share asks for them, neither the daemon nor anything it starts can create device
+    // files, whatever a client sends (rsync's option refusal does not hold for -D).
+    spec.drop_mknod = !devices;
+    // Module names are matched with ASCII case folding only, as the share registry assumes
+    // (VURNShareModuleKey).
+    spec.set_env = {{"LC_ALL", "C"}};
+    // A daemon that cannot be executed, or dies before it writes its pid file (a port in use),
+    // is noticed below by its end.
+    pid_t started = s2s_platform::Env::Default()->Spawn(spec, nullptr);
+    if (started <= 0) {
         SetEnabled(false);
         return Fail(error, "cannot start the daemon");
     }

@@ -6,7 +6,6 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
-#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -19,7 +18,7 @@
 #include <cstring>
 #include <thread>
 
-extern char** environ;
+#include "platform/env.h"
 
 namespace S2S {
 namespace rsync_internal {
@@ -100,26 +99,17 @@ class LineSplitter {
 
 // True while any process (zombies included) is still in the group.
 bool GroupAlive(pid_t pgid) {
-    return kill(-pgid, 0) == 0 || errno == EPERM;
+    return s2s_platform::Env::Default()->Kill(-pgid, 0) == 0 || errno == EPERM;
 }
 
 // Reaps `pid` without blocking; true once it has been reaped (status in `*status`).
 bool TryReap(pid_t pid, int* status) {
-    for (;;) {
-        pid_t r = waitpid(pid, status, WNOHANG);
-        if (r == pid) {
-            return true;
-        }
-        if (r < 0 && errno == EINTR) {
-            continue;
-        }
-        if (r < 0) {
-            // Already reaped elsewhere: nothing more can be learnt about it.
-            *status = 0;
-            return true;
-        }
-        return false;
+    pid_t r = s2s_platform::Env::Default()->Wait(pid, status, WNOHANG);
+    if (r < 0) {
+        // Already reaped elsewhere: nothing more can be learnt about it.
+        *status = 0;
     }
+    return r != 0;
 }
 
 void DrainAvailable(int fd, LineSplitter* splitter) {
@@ -139,7 +129,7 @@ void DrainAvailable(int fd, LineSplitter* splitter) {
 
 // Ends the group: SIGTERM, a grace period, then SIGKILL; reaps `pid` on the way.
 void StopGroup(pid_t pid, int pidfd, int fd, LineSplitter* splitter, bool* reaped, int* status) {
-    kill(-pid, SIGTERM);
+    s2s_platform::Env::Default()->Kill(-pid, SIGTERM);
     auto deadline = std::chrono::steady_clock::now() + kTermGrace;
     for (;;) {
         if (!*reaped) {
@@ -158,18 +148,17 @@ void StopGroup(pid_t pid, int pidfd, int fd, LineSplitter* splitter, bool* reape
         AwaitExit(*reaped ? -1 : pidfd, static_cast<int>(std::min<long long>(left.count(), 20)));
     }
     if (!*reaped || GroupAlive(pid)) {
-        kill(-pid, SIGKILL);
+        s2s_platform::Env::Default()->Kill(-pid, SIGKILL);
     }
     if (!*reaped) {
-        while (waitpid(pid, status, 0) < 0 && errno == EINTR) {
-        }
+        s2s_platform::Env::Default()->Wait(pid, status, 0);
         *reaped = true;
     }
     // Grandchildren that were re-parented are reaped by their new parent; wait (bounded) until
     // the group is gone so that the caller can rely on it.
     deadline = std::chrono::steady_clock::now() + kKillGrace;
     while (GroupAlive(pid) && std::chrono::steady_clock::now() < deadline) {
-        kill(-pid, SIGKILL);
+        s2s_platform::Env::Default()->Kill(-pid, SIGKILL);
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
 }
@@ -177,30 +166,7 @@ void StopGroup(pid_t pid, int pidfd, int fd, LineSplitter* splitter, bool* reape
 }  // namespace
 
 std::string FindProgram(const std::string& program) {
-    if (program.empty()) {
-        return std::string();
-    }
-    if (program.find('/') != std::string::npos) {
-        return program;
-    }
-    const char* path = std::getenv("PATH");
-    std::string dirs = path != nullptr && *path != '\0' ? path : "/usr/local/bin:/usr/bin:/bin";
-    size_t start = 0;
-    while (start <= dirs.size()) {
-        size_t end = dirs.find(':', start);
-        if (end == std::string::npos) {
-            end = dirs.size();
-        }
-        std::string dir = dirs.substr(start, end - start);
-        if (!dir.empty()) {
-            std::string candidate = dir + "/" + program;
-            if (IsExecutable(candidate)) {
-                return candidate;
-            }
-        }
-        start = end + 1;
-    }
-    return std::string();
+    return s2s_platform::FindProgram(program);
 }
 
 ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& cancel,
@@ -216,37 +182,6 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
         return outcome;
     }
 
-    // Everything the child needs is prepared before fork: after it, only async-signal-safe calls.
-    std::vector<std::string> env_strings;
-    for (char** e = environ; e != nullptr && *e != nullptr; ++e) {
-        std::string entry(*e);
-        std::string name = entry.substr(0, entry.find('='));
-        bool drop = false;
-        for (const auto& unset : job.unset_env) {
-            drop = drop || name == unset;
-        }
-        for (const auto& set : job.set_env) {
-            drop = drop || name == set.first;
-        }
-        if (!drop) {
-            env_strings.push_back(entry);
-        }
-    }
-    for (const auto& set : job.set_env) {
-        env_strings.push_back(set.first + "=" + set.second);
-    }
-    std::vector<char*> envp;
-    for (auto& s : env_strings) {
-        envp.push_back(&s[0]);
-    }
-    envp.push_back(nullptr);
-    std::vector<std::string> argv_strings(job.argv);
-    std::vector<char*> argv;
-    for (auto& s : argv_strings) {
-        argv.push_back(&s[0]);
-    }
-    argv.push_back(nullptr);
-
     int fds[2];
     if (pipe2(fds, O_CLOEXEC) != 0) {
         outcome.error = std::string("pipe: ") + strerror(errno);
@@ -254,47 +189,29 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
     }
     Fd read_end(fds[0]);
     Fd write_end(fds[1]);
-    int devnull = open("/dev/null", O_RDONLY | O_CLOEXEC);
-    if (devnull < 0) {
-        outcome.error = std::string("/dev/null: ") + strerror(errno);
-        return outcome;
-    }
-    Fd null_fd(devnull);
 
-    const pid_t parent = getpid();
-    pid_t pid = fork();
+    // The child leads a process group of its own, so that a cancel ends all it started. It is
+    // told (SIGTERM) when its parent dies, even by SIGKILL, so a killed service leaves no
+    // transfer behind; the kernel ties this to the thread that forked, not the process: callers
+    // wait for the child on the thread that started it, so the thread never ends first.
+    s2s_platform::Env* env = s2s_platform::Env::Default();
+    s2s_platform::SpawnSpec spec;
+    spec.program = program;
+    spec.argv = job.argv;
+    spec.set_env = job.set_env;
+    spec.unset_env = job.unset_env;
+    spec.output_fd = write_end.get();
+    spec.error_fd = write_end.get();
+    spec.own_group = true;
+    spec.die_with_parent = true;
+    // A program that cannot be executed ends with status 127, as from a shell.
+    pid_t pid = env->Spawn(spec, nullptr);
     if (pid < 0) {
         outcome.error = std::string("fork: ") + strerror(errno);
         return outcome;
     }
-    if (pid == 0) {
-        setpgid(0, 0);
-        // The child is told (SIGTERM) when its parent dies, even by SIGKILL, so a killed service
-        // leaves no transfer behind. The kernel ties this to the thread that forked, not the
-        // process: callers wait for the child on the thread that started it, so the thread never
-        // ends first. A parent that died before the request took effect is caught by getppid().
-        if (prctl(PR_SET_PDEATHSIG, SIGTERM) != 0 || getppid() != parent) {
-            _exit(127);
-        }
-        // Default dispositions: the caller may ignore SIGPIPE or block signals.
-        sigset_t none;
-        sigemptyset(&none);
-        sigprocmask(SIG_SETMASK, &none, nullptr);
-        signal(SIGPIPE, SIG_DFL);
-        signal(SIGTERM, SIG_DFL);
-        signal(SIGINT, SIG_DFL);
-        if (dup2(null_fd.get(), 0) < 0 || dup2(write_end.get(), 1) < 0 ||
-            dup2(write_end.get(), 2) < 0) {
-            _exit(127);
-        }
-        execve(program.c_str(), argv.data(), envp.data());
-        _exit(127);
-    }
-    // Both ends set the group so that a cancel right after fork already reaches the child.
-    setpgid(pid, pid);
     outcome.started = true;
     write_end.reset();
-    null_fd.reset();
     fcntl(read_end.get(), F_SETFL, fcntl(read_end.get(), F_GETFL) | O_NONBLOCK);
 
     // The child's end wakes the loop through its pidfd, its output through the pipe: nothing
@@ -351,7 +268,7 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
                 // of the group still holds the pipe open then goes with its leader.
                 DrainAvailable(read_end.get(), &splitter);
                 if (GroupAlive(pid)) {
-                    kill(-pid, SIGKILL);
+                    s2s_platform::Env::Default()->Kill(-pid, SIGKILL);
                 }
                 DrainAvailable(read_end.get(), &splitter);
                 eof = true;
@@ -359,7 +276,7 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
         }
     }
     if (GroupAlive(pid)) {
-        kill(-pid, SIGKILL);
+        s2s_platform::Env::Default()->Kill(-pid, SIGKILL);
     }
     DrainAvailable(read_end.get(), &splitter);
     splitter.Flush();

@@ -1,4 +1,5 @@
-// Directory creation, whole-file replacement and the instance lock for the daemon's files.
+// Directory creation, whole-file replacement (the platform's atomic one) and the instance lock
+// for the daemon's files.
 #include "service/files.h"
 
 #include <fcntl.h>
@@ -9,6 +10,8 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+
+#include "s2s_platform.h"
 
 namespace s2sd {
 
@@ -41,43 +44,9 @@ int MakeDirs(const std::string& dir, mode_t mode, std::string& error) {
 
 int ReplaceFile(const std::string& path, const std::string& content, mode_t mode,
                 std::string& error) {
-    const std::string temp = path + ".new";
-    const int fd = open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, mode);
-    if (fd < 0) {
-        error = Why("cannot create", temp);
+    if (S2SFileReplace(path.c_str(), content.data(), content.size(), mode) != 0) {
+        error = Why("cannot write", path);
         return -1;
-    }
-    bool ok = fchmod(fd, mode) == 0;
-    size_t done = 0;
-    while (ok && done < content.size()) {
-        const ssize_t n = write(fd, content.data() + done, content.size() - done);
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        ok = n > 0;
-        done += n > 0 ? static_cast<size_t>(n) : 0;
-    }
-    ok = ok && fsync(fd) == 0;
-    if (!ok) {
-        error = Why("cannot write", temp);
-    }
-    if (close(fd) != 0 && ok) {
-        error = Why("cannot write", temp);
-        ok = false;
-    }
-    if (ok && rename(temp.c_str(), path.c_str()) != 0) {
-        error = Why("cannot rename to", path);
-        ok = false;
-    }
-    if (!ok) {
-        unlink(temp.c_str());
-        return -1;
-    }
-    const std::string dir = path.substr(0, path.rfind('/') + 1);
-    const int dfd = open(dir.empty() ? "." : dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dfd >= 0) {
-        fsync(dfd);
-        close(dfd);
     }
     return 0;
 }

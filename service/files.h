@@ -13,7 +13,8 @@ namespace s2sd {
 // Creates `dir` and its missing parents with `mode`; an existing directory is left as it is.
 // 0, or -1 with `error` set.
 int MakeDirs(const std::string& dir, mode_t mode, std::string& error);
-// Replaces `path` with `content`, created with `mode` (not subject to the umask).
+// Replaces `path` with `content`, created with `mode` (not subject to the umask), through the
+// platform's atomic replacement (S2SFileReplace).
 int ReplaceFile(const std::string& path, const std::string& content, mode_t mode,
                 std::string& error);
 // The whole file; false when it cannot be read.
