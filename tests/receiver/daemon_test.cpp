@@ -40,6 +40,19 @@ mode_t Mode(const std::string& path) {
 class Receiver : public ::testing::Test {
   protected:
     Receiver() : r_(pair_.Receiver()) {}
+    ~Receiver() override { Tool({"stop"}); }
+    // A TCP socket bound to (`listen`) or connected to the daemon's address.
+    int Socket(bool listen) {
+        sockaddr_in addr{};
+        addr.sin_family = AF_INET;
+        addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        addr.sin_port = htons(static_cast<uint16_t>(pair_.Port()));
+        const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        const sockaddr* a = reinterpret_cast<sockaddr*>(&addr);
+        EXPECT_EQ(listen ? bind(fd, a, sizeof addr) + ::listen(fd, 1) : connect(fd, a, sizeof addr),
+                  0);
+        return fd;
+    }
     ProgramResult Tool(const std::vector<std::string>& args, const std::string& input = "") {
         return r_.Run("s2s-receiver", args, input);
     }
@@ -67,7 +80,6 @@ class Receiver : public ::testing::Test {
         EXPECT_EQ(p.All().find("0badc0de"), std::string::npos) << "another client's reply";
         return {ReadFile(dir + "/reply/result"), ReadFile(dir + "/reply/output")};
     }
-
     s2s_test::PairOptions options_;
     s2s_test::ServerPair pair_;
     s2s_test::Host& r_;
@@ -108,13 +120,11 @@ TEST_F(Receiver, ConfigureWritesModulesAndAPrivateSecret) {
     // A password file with CR LF line ends gives the password the sender reads from it.
     ASSERT_EQ(Tool(configure, "pw crlf\r\n").status, 0);
     EXPECT_EQ(ReadFile(secrets), "s2suser:pw crlf\n");
-
     EXPECT_NE(Tool({"configure", "--user", "bad:user"}, "pw\n").status, 0);
     EXPECT_NE(Tool({"configure", "--user", "u"}, "").status, 0) << "no password";
     EXPECT_NE(Tool({"configure", "--user", "u", "--port", "70000"}, "pw\n").status, 0);
     EXPECT_NE(Tool({"start", "now"}).status, 0);
     EXPECT_EQ(Tool({"--help"}).out.compare(0, 19, "usage: s2s-receiver"), 0);
-
     // A key folder an earlier version left open is made private again.
     chmod(r_.KeyDir().c_str(), 0755);
     WriteFile(r_.KeyDir() + "/old.key", "k");
@@ -122,7 +132,6 @@ TEST_F(Receiver, ConfigureWritesModulesAndAPrivateSecret) {
     ASSERT_EQ(Tool(configure, "pw\n").status, 0);
     EXPECT_EQ(Mode(r_.KeyDir()), 0700u);
     EXPECT_EQ(Mode(r_.KeyDir() + "/old.key"), 0600u);
-
     // Two shares the daemon would serve as one module (a registry edited by hand): refused in
     // plain words, and the configuration written before stays.
     const std::string before = ReadFile(conf);
@@ -143,13 +152,7 @@ TEST_F(Receiver, StartStatusStopKeepOneDaemonAndEndItsConnections) {
     EXPECT_NE(Tool({"start"}).status, 0) << "not configured yet";
     // The port taken: start fails and leaves nothing running.
     {
-        const int fd = socket(AF_INET, SOCK_STREAM, 0);
-        sockaddr_in addr{};
-        addr.sin_family = AF_INET;
-        addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        addr.sin_port = htons(static_cast<uint16_t>(pair_.Port()));
-        ASSERT_EQ(bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
-        ASSERT_EQ(listen(fd, 1), 0);
+        const int fd = Socket(true);
         EXPECT_NE(pair_.Start(), "");
         close(fd);
         EXPECT_EQ(Tool({"status"}).out.compare(0, 17, "service: stopped\n"), 0);
@@ -165,7 +168,6 @@ TEST_F(Receiver, StartStatusStopKeepOneDaemonAndEndItsConnections) {
     }
     EXPECT_EQ(starts[0].status + starts[1].status, 1) << starts[0].All() << starts[1].All();
     EXPECT_NE((starts[0].All() + starts[1].All()).find("running already"), std::string::npos);
-
     // A paired client with a bound share shows in the status.
     EXPECT_EQ(Command("command=\"S2S_PairingMultiSrc\"\nclientID=\"SN1\"\nserverName=\"sender\"\n"
                       "syncShares=\"photos\"\ndryRun=\"no\"\noutfile=\"/x\"\n"),
@@ -181,19 +183,13 @@ TEST_F(Receiver, StartStatusStopKeepOneDaemonAndEndItsConnections) {
               0u)
         << status.out;
     EXPECT_NE(status.out.find(", not finished\n"), std::string::npos) << status.out;
-
     // Connections that have been greeted (the daemon forked a process for each) and then stay
     // silent, as a client in the middle of a long transfer: stop ends them with the daemon.
     const std::string pidFile = r_.Root() + "/var/run/rsyncd.pid";
     const pid_t daemon = std::stoi(ReadFile(pidFile));
     std::vector<int> conns;
     for (int i = 0; i < 2; ++i) {
-        conns.push_back(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-        sockaddr_in addr{};
-        addr.sin_family = AF_INET;
-        addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        addr.sin_port = htons(static_cast<uint16_t>(pair_.Port()));
-        ASSERT_EQ(connect(conns.back(), reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+        conns.push_back(Socket(false));
         char greeting[64];
         ASSERT_GT(read(conns.back(), greeting, sizeof greeting), 0);
     }
@@ -223,7 +219,6 @@ TEST_F(Receiver, StartStatusStopKeepOneDaemonAndEndItsConnections) {
     EXPECT_EQ(Tool({"status"}).out.compare(0, 41, "service: stopped\ntransfers: none running\n"),
               0);
     EXPECT_EQ(Tool({"stop"}).status, 0) << "stopping a stopped daemon is fine";
-
     // A pairing store that cannot be read: start refuses and leaves nothing running, status
     // still tells what runs, and stop stops.
     const std::string store = r_.Root() + "/usr/vurn/etc/vurnS2S.info";
@@ -262,7 +257,6 @@ TEST_F(Receiver, TheDaemonTakesOnlyWhatItShould) {
     EXPECT_EQ(Command(version, "*").first, "") << "a pattern listed the command module";
     EXPECT_EQ(Command(version, "/").first, "") << "the command module was listed";
     EXPECT_EQ(Command(version), std::make_pair(std::string("0\n"), std::string("1\n")));
-
     // A run pairs before its first dry run or data run: the pairing alone brings the served
     // shares up to date, for a share registered after start as for one removed since.
     const std::string src = r_.Root() + "/src";
@@ -285,7 +279,6 @@ TEST_F(Receiver, TheDaemonTakesOnlyWhatItShould) {
                       "shareName=\"vault\"\n")
                   .first,
               "0\n");
-
     ASSERT_EQ(mknod((src + "/null").c_str(), S_IFCHR | 0666, makedev(1, 3)), 0);
     WriteFile(src + "/suid", "#!/bin/sh\n");
     chmod((src + "/suid").c_str(), 04755);
@@ -299,7 +292,6 @@ TEST_F(Receiver, TheDaemonTakesOnlyWhatItShould) {
     EXPECT_EQ(Mode(r_.SharePath("photos") + "/suid"), 0755u);
     EXPECT_EQ(Mode(r_.SharePath("photos") + "/sgid"), 0755u) << "a setgid folder arrived";
     EXPECT_NE(Rsync({"-r", Url("photos/"), r_.Root() + "/back/"}).status, 0) << "read back";
-
     const std::string key = r_.Root() + "/vault.key";
     WriteFile(key, "secret key");
     chmod(key.c_str(), 0644);
@@ -310,7 +302,6 @@ TEST_F(Receiver, TheDaemonTakesOnlyWhatItShould) {
     EXPECT_TRUE(s2s_test::TreeManifest(r_.KeyDir()).empty());
     ASSERT_EQ(Rsync({"--perms", key, Url("@s2s-key/vault/")}).status, 0);
     EXPECT_EQ(Mode(r_.KeyDir() + "/vault/vault.key"), 0600u);
-
     // A transfer held back by a bandwidth limit is running until it is ended.
     WriteFile(src + "/big", std::string(1 << 20, 'b'));
     {
@@ -322,7 +313,6 @@ TEST_F(Receiver, TheDaemonTakesOnlyWhatItShould) {
     }
     EXPECT_TRUE(s2s_test::WaitFor(
         [&] { return Tool({"status"}).out.find("transfers: none running") != std::string::npos; }));
-
     // Configured as an old server, the daemon's command hook answers like one.
     ASSERT_EQ(pair_.Start(true), "");
     EXPECT_EQ(Command(version), std::make_pair(std::string("43\n"), std::string()));

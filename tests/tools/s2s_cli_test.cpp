@@ -1,8 +1,8 @@
 // The s2s program end to end, by exit class: one table of command lines that need no server
 // (help, usage errors, strict task files, password sources, the share registry, next-run's
 // answers, no service), one table of syncs against a real receiver (each class of failure, with
-// its message and JSON), Ctrl-C in the middle of a copy, and the exit codes of the sync service's
-// answers.
+// its message and JSON), and Ctrl-C in the middle of a copy. The sync service's answers and
+// their exit codes are tested against the real service with s2sd.
 #include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/mount.h>
@@ -10,13 +10,11 @@
 #include <sys/stat.h>
 #include <sys/un.h>
 
-#include <atomic>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <functional>
-#include <thread>
 
-#include "s2s_ipc.h"
 #include "support/program.h"
 #include "support/server_pair.h"
 #include "support/tree_manifest.h"
@@ -177,7 +175,6 @@ TEST(Cli, LocalCommandsGiveTheirExitClassAndReason) {
     }
     struct stat st;
     EXPECT_EQ(stat((r + "/volume1/@vault@").c_str(), &st), 0) << "an encrypted share's folder";
-
     // A socket file nobody listens on: the service died.
     const int fd = socket(AF_UNIX, SOCK_STREAM, 0);
     sockaddr_un addr = {};
@@ -214,16 +211,12 @@ class Sync : public ::testing::Test {
             Sender().AddShare(share);
             pair_->Receiver().AddShare(share);
         }
-        WriteFile(Sender().Root() + "/pw", options_.password + "\n");
-        chmod((Sender().Root() + "/pw").c_str(), 0600);
     }
     Host& Sender() { return pair_->Sender(); }
-    // `s2s sync` from `host` (its password in a private file) for the shares of `words`, then
-    // the options there.
-    std::vector<std::string> Args(const Host& host, const std::string& words) {
-        std::vector<std::string> args = {
-            "sync",        "--server-ip",     "127.0.0.1",         "--user",
-            options_.user, "--password-file", host.Root() + "/pw", "--no-progress"};
+    // `s2s sync` for the shares of `words`, then the options there.
+    std::vector<std::string> Args(const std::string& words) {
+        std::vector<std::string> args = {"sync",   "--server-ip", "127.0.0.1",
+                                         "--user", options_.user, "--no-progress"};
         std::istringstream in(words);
         bool options = false;
         for (std::string word; in >> word;) {
@@ -236,7 +229,6 @@ class Sync : public ::testing::Test {
     std::map<std::string, std::string> Copy(const std::string& share) {
         return s2s_test::TreeManifest(pair_->Receiver().SharePath(share));
     }
-
     s2s_test::PairOptions options_;
     std::unique_ptr<s2s_test::ServerPair> pair_;
 };
@@ -253,8 +245,6 @@ TEST_F(Sync, EachFailureHasItsExitClassMessageAndJson) {
     ASSERT_EQ(pair_->Start(), "");
     Host second("second", "SN-SECOND");
     second.AddShare("docs");
-    WriteFile(second.Root() + "/pw", options_.password + "\n");
-    chmod((second.Root() + "/pw").c_str(), 0600);
     const std::string docs = Sender().SharePath("docs");
     const std::string media = Sender().SharePath("media");
     fs::create_directories(docs + "/a/b");
@@ -266,6 +256,7 @@ TEST_F(Sync, EachFailureHasItsExitClassMessageAndJson) {
     ASSERT_EQ(symlink("a/b/1", (docs + "/link").c_str()), 0);
     // Before each row: the sender, with the right password; a row's set-up may change either.
     const Host* from = nullptr;
+    std::string password;
     const std::string tmp = Sender().Root() + "/tmp/S2S";
     std::map<std::string, std::string> copy;
     auto emptied = [&] {
@@ -294,7 +285,7 @@ TEST_F(Sync, EachFailureHasItsExitClassMessageAndJson) {
         {"docs media --json", nullptr, 0, "paired 2 shares", "\"result\": \"ok\"", "[ERROR]"},
         {"docs --json", [&] { from = &second; }, 7,
          "share 'docs' is already paired with another client", "\"result\": \"conflict\""},
-        {"docs", [&] { WriteFile(Sender().Root() + "/pw", "not the password\n"); }, 6,
+        {"docs", [&] { password = "not the password"; }, 6,
          "refused user 's2suser' or its password", "", "not the password"},
         // A version query that fails for an unsafe temporary folder is never an old server.
         {"docs", [&] { chmod(tmp.c_str(), 0777); }, 1, "protocol version could not be read", "",
@@ -318,13 +309,13 @@ TEST_F(Sync, EachFailureHasItsExitClassMessageAndJson) {
     for (const auto& row : rows) {
         SCOPED_TRACE("exit " + std::to_string(row.status) + ": " + row.args);
         from = &Sender();
-        WriteFile(Sender().Root() + "/pw", options_.password + "\n");
+        password = options_.password;
         chmod(tmp.c_str(), 0700);
         copy = Copy("docs");
         if (row.before) {
             row.before();
         }
-        const ProgramResult r = from->Run("s2s", Args(*from, row.args));
+        const ProgramResult r = from->Run("s2s", Args(row.args), "", {{"S2S_PASSWORD", password}});
         EXPECT_EQ(r.status, row.status) << r.All();
         EXPECT_NE(r.err.find(row.err), std::string::npos) << r.err;
         EXPECT_NE(r.out.find(row.out), std::string::npos) << r.out;
@@ -348,19 +339,19 @@ TEST_F(Sync, CtrlCStopsTheCopyAndMarksNothingComplete) {
     const std::string big = Sender().SharePath("docs") + "/big.bin";
     RandomFile(big, 48u << 20);
     // Limited to 16 MiB/s, the copy cannot end before its partial file has been seen.
-    std::vector<std::string> argv =
-        Args(Sender(), "docs media --compress --json --max-bandwidth 16384");
+    WriteFile(Sender().Root() + "/pw", options_.password + "\n");
+    chmod((Sender().Root() + "/pw").c_str(), 0600);
+    std::vector<std::string> argv = Args(
+        "docs media --compress --json --max-bandwidth 16384 "
+        "--password-file " +
+        Sender().Root() + "/pw");
     argv.insert(argv.begin(), s2s_test::ToolPath("s2s"));
     s2s_test::Program sync(argv, Sender().Env());
     const std::string copy = pair_->Receiver().SharePath("docs");
-    ASSERT_TRUE(s2s_test::WaitFor(
+    ASSERT_TRUE(s2s_test::WaitFor(  // rsync's temporary file sorts first
         [&] {
-            for (const auto& entry : s2s_test::TreeManifest(copy)) {
-                if (entry.first.compare(0, 2, "/.") == 0) {
-                    return true;  // rsync's temporary file
-                }
-            }
-            return false;
+            const auto tree = s2s_test::TreeManifest(copy);
+            return !tree.empty() && tree.begin()->first[1] == '.';
         },
         std::chrono::seconds(60)));
     // Frozen, the sending rsync is surely still copying when the interrupt arrives: stopping the
@@ -383,55 +374,6 @@ TEST_F(Sync, CtrlCStopsTheCopyAndMarksNothingComplete) {
     }));
     EXPECT_EQ(pair_->Receiver().Run("s2s-receiver", {"status"}).out.find("last sync completed"),
               std::string::npos);
-}
-
-// The sync service's control socket answering every request with the next status of a list.
-class FakeService {
-  public:
-    FakeService(const std::string& root, std::vector<unsigned> statuses)
-        : statuses_(std::move(statuses)) {
-        fs::create_directories(root + "/run/s2s");
-        chmod((root + "/run/s2s").c_str(), 0700);
-        EXPECT_EQ(listener_.prepare(root + "/run/s2s/s2sd.sock"), 0);
-        thread_ = std::thread([this] {
-            for (unsigned status : statuses_) {
-                S2S::IPCSender peer;
-                S2S::PObject request;
-                S2S::PObject reply;
-                if (peer.assign(listener_.accept()) != 0 || peer.recv(request) != 0) {
-                    return;
-                }
-                reply["status"] = status;
-                reply["message"] = "told " + std::to_string(status);
-                peer.send(reply);
-            }
-        });
-    }
-    ~FakeService() { thread_.join(); }
-
-  private:
-    std::vector<unsigned> statuses_;
-    S2S::IPCListener listener_;
-    std::thread thread_;
-};
-
-// Each status of the control protocol has its exit code, and the service's message is shown.
-TEST(Cli, ServiceAnswersMapToExitCodes) {
-    Host host("cli", "SN-CLI");
-    const std::vector<std::pair<unsigned, int>> cases = {
-        {0, 0}, {1, 24}, {2, 3}, {3, 21}, {4, 22}, {5, 23}, {6, 24}, {7, 24}, {99, 24}};
-    std::vector<unsigned> statuses;
-    for (const auto& c : cases) {
-        statuses.push_back(c.first);
-    }
-    FakeService service(host.Root(), statuses);
-    for (const auto& c : cases) {
-        const ProgramResult r = host.Run("s2s", {"task", "cancel", "7"});
-        EXPECT_EQ(r.status, c.second) << c.first << " " << r.All();
-        EXPECT_TRUE(c.first == 0 ||
-                    r.err.find("told " + std::to_string(c.first)) != std::string::npos)
-            << r.err;
-    }
 }
 
 }  // namespace

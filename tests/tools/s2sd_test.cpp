@@ -71,22 +71,25 @@ class Daemon {
     std::string log_;
 };
 
-PObject Command(const char* command) {
+PObject Command(const char* command, const char* key = nullptr, const PObject& value = PObject()) {
     PObject request;
     request[Control::kKeyCommand] = command;
+    if (key != nullptr) {
+        request[key] = value;
+    }
     return request;
 }
 
 // `s2s task add` of a task for `share` from `file` (JSON) with the password `password`.
 std::vector<std::string> AddArgs(const Host& host, const std::string& share,
                                  const std::string& task, const std::string& password) {
-    WriteFile(host.Root() + "/task.json", task);
-    WriteFile(host.Root() + "/pw", password + "\n");
-    chmod((host.Root() + "/pw").c_str(), 0600);
-    return {"task",        "add",       "--task",          host.Root() + "/task.json",
-            "--server-ip", "127.0.0.1", "--user",          "s2suser",
-            "--share",     share,       "--password-file", host.Root() + "/pw",
-            "--json"};
+    static int n = 0;
+    const std::string file = host.Root() + "/task" + std::to_string(++n);
+    WriteFile(file + ".json", task);
+    WriteFile(file + ".pw", password + "\n");
+    chmod((file + ".pw").c_str(), 0600);
+    return {"task",    "add",     "--task", file + ".json",    "--server-ip", "127.0.0.1", "--user",
+            "s2suser", "--share", share,    "--password-file", file + ".pw",  "--json"};
 }
 
 TEST(S2sd, ControlSocketServesHostileClientsAndTheFrontEnd) {
@@ -100,17 +103,12 @@ TEST(S2sd, ControlSocketServesHostileClientsAndTheFrontEnd) {
     // A client that connects and says nothing holds no one up.
     S2S::IPCSender silent;
     ASSERT_EQ(silent.connect(socket), 0);
-
     PObject nested = Command(Control::kList);
     PObject* inner = &nested["x"];
     for (int i = 0; i < 40; ++i) {
         inner = &(*inner)["y"];
         *inner = PObject();
     }
-    PObject showText = Command(Control::kShow);
-    showText[Control::kKeyTaskId] = "1";
-    PObject addText = Command(Control::kAdd);
-    addText[Control::kKeyTask] = "a task";
     PObject numberCommand;
     numberCommand[Control::kKeyCommand] = 5ULL;
     const struct {
@@ -121,8 +119,10 @@ TEST(S2sd, ControlSocketServesHostileClientsAndTheFrontEnd) {
         {PObject("list"), Control::kBadRequest, "not a map"},
         {numberCommand, Control::kBadRequest, "command"},
         {Command("frobnicate"), Control::kBadRequest, "unknown command 'frobnicate'"},
-        {showText, Control::kBadRequest, "'task_id' must be an integer"},
-        {addText, Control::kBadRequest, "'task' must be a task map"},
+        {Command(Control::kShow, Control::kKeyTaskId, PObject("1")), Control::kBadRequest,
+         "'task_id' must be an integer"},
+        {Command(Control::kAdd, Control::kKeyTask, PObject("a task")), Control::kBadRequest,
+         "'task' must be a task map"},
         {Command(Control::kShow), Control::kBadRequest, "'task_id' is missing"},
         {nested, Control::kTooLarge, "nests deeper"},
     };
@@ -157,7 +157,6 @@ TEST(S2sd, ControlSocketServesHostileClientsAndTheFrontEnd) {
     PObject told;  // the silent client is told in the end
     ASSERT_EQ(silent.recv(told), 0);
     EXPECT_NE(told[Control::kKeyMessage].asString().find("no complete request"), std::string::npos);
-
     // The front end: the password travels beside the task into a root-only file and never
     // comes back; an update changes only what it is given.
     json doc;
@@ -185,13 +184,17 @@ TEST(S2sd, ControlSocketServesHostileClientsAndTheFrontEnd) {
         {AddArgs(host, "docs", R"({"name": "../nightly"})", "pw"), 3, "not one a receiver takes"},
         {{"task", "show", "99"}, 21, ""},
         {{"task", "cancel", id}, 23, ""},
+        {AddArgs(host, "docs", task, "pw"), 24, ""},
     };
     for (const auto& e : errors) {
+        if (e.status == 24) {
+            fs::remove_all(host.Root() + Control::kPasswordDir);  // a file in the way
+            WriteFile(host.Root() + Control::kPasswordDir, "");
+        }
         r = daemon.S2s(e.args);
         EXPECT_EQ(r.status, e.status) << r.All();
         EXPECT_NE(r.err.find(e.words), std::string::npos) << r.err;
     }
-
     // A second daemon on the same root, in the foreground or detaching, is refused before it
     // touches the socket; the first goes on serving.
     for (const char* mode : {"--verbose", "--daemon"}) {
@@ -250,7 +253,6 @@ class WithReceiver : public ::testing::Test {
         return WaitFor([&] { return s2s_test::ReadFile(copy_ + path) == content; },
                        std::chrono::seconds(60));
     }
-
     std::unique_ptr<s2s_test::ServerPair> pair_;
     std::unique_ptr<Daemon> daemon_;
     std::string source_;
@@ -267,7 +269,6 @@ TEST_F(WithReceiver, RealTimeTaskSendsWhatChanged) {
     const std::string id = Add(R"({"name": "live", "schedule_mode": 1})");
     ASSERT_TRUE(WaitForRuns(id, 1)) << daemon_->Log();
     EXPECT_EQ(Runs(id)[0]["result"], 0) << Runs(id).dump();
-
     fs::create_directories(source_ + "/new");
     ASSERT_TRUE(WaitFor([&] { return access((copy_ + "/new").c_str(), F_OK) == 0; },
                         std::chrono::seconds(60)));
@@ -276,7 +277,6 @@ TEST_F(WithReceiver, RealTimeTaskSendsWhatChanged) {
     // That run sent the one file, not the share's 50 KB.
     const std::string log = s2s_test::ReadFile(pair_->Sender().Root() + "/var/log/s2s_rsync.log");
     EXPECT_NE(log.find("total size 13\n"), std::string::npos) << log;
-
     ASSERT_EQ(unlink((source_ + "/file7").c_str()), 0);
     ASSERT_TRUE(WaitFor([&] { return access((copy_ + "/file7").c_str(), F_OK) != 0; },
                         std::chrono::seconds(60)));
@@ -296,26 +296,18 @@ TEST_F(WithReceiver, StoppedOrKilledDuringARunTheTaskAndHistorySurvive) {
     random.read(&content[0], static_cast<std::streamsize>(content.size()));
     WriteFile(source_ + "/big", content);
     const std::string id = Add(R"({"name": "slow", "schedule_mode": 0, "max_bandwidth": 1024})");
-    auto copying = [&] {
-        return WaitFor(
-            [&] {
-                for (const auto& entry : s2s_test::TreeManifest(copy_)) {
-                    if (entry.first.compare(0, 2, "/.") == 0) {
-                        return true;
-                    }
-                }
-                return false;
-            },
-            std::chrono::seconds(60));
-    };
-    auto rsyncs = [&] { return s2s_test::RunProgram({"/usr/bin/pgrep", "-f", source_}).out; };
     ASSERT_EQ(daemon_->S2s({"task", "run", id}).status, 0);
-    ASSERT_TRUE(copying()) << daemon_->Log();
+    ASSERT_TRUE(WaitFor(  // rsync's temporary file sorts first
+        [&] {
+            const auto tree = s2s_test::TreeManifest(copy_);
+            return !tree.empty() && tree.begin()->first[1] == '.';
+        },
+        std::chrono::seconds(60)))
+        << "rsync's temporary file never came: " << daemon_->Log();
     const ProgramResult busy = daemon_->S2s({"task", "remove", id});
     EXPECT_EQ(busy.status, 22) << busy.All();
-
     EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
-    EXPECT_EQ(rsyncs(), "");
+    EXPECT_EQ(s2s_test::RunProgram({"/usr/bin/pgrep", "-f", source_}).out, "");
     EXPECT_EQ(pair_->Receiver().Run("s2s-receiver", {"status"}).out.find("last sync completed"),
               std::string::npos);
     daemon_->Start();
@@ -323,12 +315,7 @@ TEST_F(WithReceiver, StoppedOrKilledDuringARunTheTaskAndHistorySurvive) {
     ASSERT_TRUE(WaitFor([&] { return Runs(id).size() == 2; })) << daemon_->Log();
     EXPECT_EQ(daemon_->Stop(SIGKILL), 128 + SIGKILL);
     // SIGKILL leaves the daemon no chance to stop its rsync; the administrator's kill does.
-    for (std::istringstream pids(rsyncs()); pids;) {
-        pid_t pid = 0;
-        if (pids >> pid) {
-            kill(pid, SIGKILL);
-        }
-    }
+    s2s_test::RunProgram({"/usr/bin/pkill", "-KILL", "-f", source_});
     daemon_->Start();
     const json runs = Runs(id);
     ASSERT_EQ(runs.size(), 2u) << runs.dump();
