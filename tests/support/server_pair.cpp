@@ -107,7 +107,7 @@ std::string ServerPair::StartSshd() {
         "  echo \"${u%:*}:x:${u#*:}:${u#*:}::/:/bin/sh\" >> passwd; done\n"
         "mount --bind shadow /etc/shadow; mount --bind passwd /etc/passwd\n"
         "mount -t tmpfs tmpfs /run; mkdir /run/sshd\n"
-        "exec /usr/sbin/sshd -D -E sshd.log -f sshd_config\n";
+        "exec /usr/sbin/sshd -D -e -f sshd_config 2>sshd.log\n";
     sshd_.reset(new Program(
         {"/usr/bin/unshare", "--mount", "--propagation", "private", "/bin/sh", "-c", script, d}, {},
         options_.password + "\n"));
