@@ -6,11 +6,8 @@
 #include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/mount.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -176,14 +173,8 @@ TEST(Cli, LocalCommandsGiveTheirExitClassAndReason) {
     struct stat st;
     EXPECT_EQ(stat((r + "/volume1/@vault@").c_str(), &st), 0) << "an encrypted share's folder";
     // A socket file nobody listens on: the service died.
-    const int fd = socket(AF_UNIX, SOCK_STREAM, 0);
-    sockaddr_un addr = {};
-    addr.sun_family = AF_UNIX;
     fs::create_directories(r + "/run/s2s");
-    chmod((r + "/run/s2s").c_str(), 0700);
-    std::strncpy(addr.sun_path, (r + "/run/s2s/s2sd.sock").c_str(), sizeof(addr.sun_path) - 1);
-    ASSERT_EQ(bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)), 0);
-    close(fd);
+    ASSERT_EQ(mknod((r + "/run/s2s/s2sd.sock").c_str(), S_IFSOCK | 0600, 0), 0);
     const ProgramResult p = host.Run("s2s", {"pause"});
     EXPECT_EQ(p.status, 20) << p.All();
     EXPECT_NE(p.err.find("refuses connections"), std::string::npos) << p.err;
@@ -226,6 +217,7 @@ class Sync : public ::testing::Test {
         }
         return args;
     }
+    std::string Status() { return pair_->Receiver().Run("s2s-receiver", {"status"}).out; }
     std::map<std::string, std::string> Copy(const std::string& share) {
         return s2s_test::TreeManifest(pair_->Receiver().SharePath(share));
     }
@@ -298,6 +290,7 @@ TEST_F(Sync, EachFailureHasItsExitClassMessageAndJson) {
         // An emptied folder, or a volume that should be a mount point and is not: what lies
         // there is not the share, and would wipe the receiver's copy.
         {"docs --json", emptied, 12, "--allow-empty-source", "\"guard\": \"empty-source\""},
+        {"docs --allow-empty-source", nullptr, 0, ""},
         {"media --json --allow-empty-source", unmounted, 12, "",
          "\"guard\": \"volume-not-mounted\""},
         // No serial number, and no MAC address in this network: no client ID.
@@ -323,14 +316,15 @@ TEST_F(Sync, EachFailureHasItsExitClassMessageAndJson) {
         if (row.status == 0) {
             EXPECT_EQ(Copy("docs"), s2s_test::TreeManifest(docs));
             EXPECT_EQ(Copy("media"), s2s_test::TreeManifest(media));
-            EXPECT_NE(pair_->Receiver()
-                          .Run("s2s-receiver", {"status"})
-                          .out.find("share: docs bound to SN-SENDER-0001, last sync completed"),
+            EXPECT_NE(Status().find("share: docs bound to SN-SENDER-0001, last sync completed"),
                       std::string::npos);
         } else {
             EXPECT_EQ(Copy("docs"), copy) << "the receiver's copy changed";
         }
     }
+    EXPECT_EQ(Status().find("small bound to SN-SENDER-0001, last sync completed"),
+              std::string::npos)
+        << "a share whose copy failed was marked complete";
 }
 
 // Ctrl-C stops the copy: exit 130, no rsync left on either side, nothing marked complete.
@@ -339,12 +333,11 @@ TEST_F(Sync, CtrlCStopsTheCopyAndMarksNothingComplete) {
     const std::string big = Sender().SharePath("docs") + "/big.bin";
     RandomFile(big, 48u << 20);
     // Limited to 16 MiB/s, the copy cannot end before its partial file has been seen.
-    WriteFile(Sender().Root() + "/pw", options_.password + "\n");
-    chmod((Sender().Root() + "/pw").c_str(), 0600);
-    std::vector<std::string> argv = Args(
-        "docs media --compress --json --max-bandwidth 16384 "
-        "--password-file " +
-        Sender().Root() + "/pw");
+    const std::string pw = Sender().Root() + "/pw";
+    WriteFile(pw, options_.password + "\n");
+    chmod(pw.c_str(), 0600);
+    std::vector<std::string> argv =
+        Args("docs media --compress --json --max-bandwidth 16384 --password-file " + pw);
     argv.insert(argv.begin(), s2s_test::ToolPath("s2s"));
     s2s_test::Program sync(argv, Sender().Env());
     const std::string copy = pair_->Receiver().SharePath("docs");
@@ -372,8 +365,7 @@ TEST_F(Sync, CtrlCStopsTheCopyAndMarksNothingComplete) {
     EXPECT_TRUE(s2s_test::WaitFor([&] {
         return s2s_test::RunProgram({"/usr/bin/pgrep", "-f", big}).status == 1;
     }));
-    EXPECT_EQ(pair_->Receiver().Run("s2s-receiver", {"status"}).out.find("last sync completed"),
-              std::string::npos);
+    EXPECT_EQ(Status().find("last sync completed"), std::string::npos);
 }
 
 }  // namespace

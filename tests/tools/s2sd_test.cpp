@@ -166,11 +166,17 @@ TEST(S2sd, ControlSocketServesHostileClientsAndTheFrontEnd) {
     const std::string id = std::to_string(doc["task_id"].get<unsigned>());
     ASSERT_EQ(stat((host.Root() + Control::kPasswordDir + "/" + id).c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0600u);
-    EXPECT_EQ(daemon.S2s({"task", "update", id, "--max-bandwidth", "100"}).status, 0);
+    EXPECT_EQ(daemon
+                  .S2s({"task", "update", id, "--max-bandwidth", "100", "--allow-empty-source",
+                        "--max-delete", "20%"})
+                  .status,
+              0);
     r = daemon.S2s({"task", "show", id, "--json"}, &doc);
     EXPECT_EQ(doc["name"], "nightly") << r.out;
     EXPECT_EQ(doc["compress"], true) << r.out;
     EXPECT_EQ(doc["max_bandwidth"], 100) << r.out;
+    EXPECT_EQ(doc["allow_empty_source"], true) << r.out;
+    EXPECT_EQ(doc["max_delete"], "20%") << r.out;
     EXPECT_EQ(doc["state"], "idle") << r.out;
     EXPECT_EQ(r.out.find("secret-pw"), std::string::npos);
     r = daemon.S2s({"task", "list"});
