@@ -1,8 +1,6 @@
-// s2s-receiver and its rsync daemon as a client meets them: the configuration it writes (modules,
-// a private secret), start / status / stop (one daemon per root, stop ends the connections too,
-// an unreadable pairing store), and what a client can do through the daemon (command replies by
-// token only, pushes into registered shares only, no device files or setuid bits, keys only into
-// an encrypted share's key folder, old-server answers).
+// s2s-receiver and its rsync daemon as a client meets them: the configuration it writes, start /
+// status / stop (one daemon, connections ended with it, an unreadable pairing store), and what a
+// client can and cannot do through the daemon (replies by token, pushes, keys, old-server answers).
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <sys/socket.h>

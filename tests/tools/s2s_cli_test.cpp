@@ -1,8 +1,6 @@
-// The s2s program end to end, by exit class: one table of command lines that need no server
-// (help, usage errors, strict task files, password sources, the share registry, next-run's
-// answers, no service), one table of syncs against a real receiver (each class of failure, with
-// its message and JSON), and Ctrl-C in the middle of a copy. The sync service's answers and
-// their exit codes are tested against the real service with s2sd.
+// The s2s program end to end, by exit class: one table of local command lines (help, usage,
+// strict task files, passwords, the share registry, next-run, no service), one table of syncs
+// against a real receiver, and Ctrl-C mid-copy. Service answers are tested with s2sd.
 #include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/mount.h>

@@ -292,6 +292,10 @@ TEST_F(WithReceiver, RealTimeTaskSendsWhatChanged) {
     fs::create_directories(source_);
     WriteFile(source_ + "/back", "after the return");
     EXPECT_TRUE(Arrived("/back", "after the return")) << daemon_->Log();
+    ASSERT_TRUE(WaitForRuns(id, runs + 2)) << daemon_->Log();
+    const std::string history = daemon_->S2s({"task", "history", id, "--count", "1"}).out;
+    EXPECT_NE(history.find("  ok (0)\n     docs  result 0  1 files  16 B  "), std::string::npos)
+        << history;
 }
 
 // SIGTERM cancels the run (no rsync left, the share not complete); kill -9 leaves a run that
@@ -331,6 +335,7 @@ TEST_F(WithReceiver, StoppedOrKilledDuringARunTheTaskAndHistorySurvive) {
     json shown;
     daemon_->S2s({"task", "show", id, "--json"}, &shown);
     EXPECT_EQ(shown["name"], "slow");
+    EXPECT_EQ(daemon_->S2s({"task", "status", "--watch"}).status, 0) << "nothing runs";
 }
 
 }  // namespace
