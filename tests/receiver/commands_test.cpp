@@ -205,8 +205,7 @@ TEST_F(Handlers, CommandExchangeAnswersInOrder) {
             EXPECT_EQ(State(r.what), r.state);
         }
     }
-    // What one client may create in the store is bounded: a task more than its share is refused
-    // with its own code; known tasks and other clients go on.
+    // One client's tasks in the store are bounded (216); known tasks and other clients go on.
     for (int i = 1; i < 64; ++i) {
         ASSERT_EQ(Send(Task("A", "t" + std::to_string(i))).result, 0) << i;
     }

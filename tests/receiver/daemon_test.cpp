@@ -133,8 +133,8 @@ TEST_F(Receiver, ConfigureWritesModulesAndAPrivateSecret) {
     ASSERT_EQ(Tool(configure, "pw\n").status, 0);
     EXPECT_EQ(Mode(r_.KeyDir()), 0700u);
     EXPECT_EQ(Mode(r_.KeyDir() + "/old.key"), 0600u);
-    // Two shares the daemon would serve as one module (a registry edited by hand): refused in
-    // plain words, and the configuration written before stays.
+    // Two shares served as one module (a hand-edited registry): refused, the old configuration
+    // stays.
     const std::string before = ReadFile(conf);
     WriteFile(r_.Root() + "/etc/s2s/shares.conf", "[docs]\n\tpath=\"" + r_.SharePath("photos") +
                                                       "\"\n[DO CS]\n\tpath=\"" +

@@ -345,8 +345,7 @@ TEST_F(Sync, CtrlCStopsTheCopyAndMarksNothingComplete) {
             return !tree.empty() && tree.begin()->first[1] == '.';
         },
         std::chrono::seconds(60)));
-    // Frozen, the sending rsync is surely still copying when the interrupt arrives: stopping the
-    // run must not depend on its cooperation.
+    // The sending rsync is frozen: stopping the run must not depend on its cooperation.
     pid_t rsync = -1;
     std::ifstream children("/proc/" + std::to_string(sync.Pid()) + "/task/" +
                            std::to_string(sync.Pid()) + "/children");

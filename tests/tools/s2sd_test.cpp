@@ -201,8 +201,7 @@ TEST(S2sd, ControlSocketServesHostileClientsAndTheFrontEnd) {
         EXPECT_EQ(r.status, e.status) << r.All();
         EXPECT_NE(r.err.find(e.words), std::string::npos) << r.err;
     }
-    // A second daemon on the same root, in the foreground or detaching, is refused before it
-    // touches the socket; the first goes on serving.
+    // A second daemon on the same root (foreground or detaching) is refused; the first serves on.
     for (const char* mode : {"--verbose", "--daemon"}) {
         r = host.Run("s2sd", {mode});
         EXPECT_EQ(r.status, 1) << mode;
