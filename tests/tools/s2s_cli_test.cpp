@@ -180,10 +180,9 @@ TEST(Cli, LocalCommandsGiveTheirExitClassAndReason) {
 
 // Incompressible bytes: a compressed copy stays slow enough to be caught in the middle.
 void RandomFile(const std::string& path, size_t size) {
-    std::ifstream in("/dev/urandom", std::ios::binary);
-    std::string content(size, '\0');
-    in.read(&content[0], static_cast<std::streamsize>(size));
-    WriteFile(path, content);
+    WriteFile(
+        path,
+        s2s_test::RunProgram({"/usr/bin/head", "-c", std::to_string(size), "/dev/urandom"}).out);
 }
 
 // A sending host and the receiver's daemon on the standard port, in a private network.

@@ -6,7 +6,6 @@
 #include <sys/stat.h>
 
 #include <filesystem>
-#include <fstream>
 #include <nlohmann/json.hpp>
 
 #include "s2s_control.h"
@@ -41,9 +40,15 @@ class Daemon {
             {s2s_test::ToolPath("s2sd"), "--delay", "1", "--verbose"}, host_.Env()));
         EXPECT_TRUE(WaitFor([&] { return access(socket.c_str(), F_OK) == 0; }));
     }
+    ~Daemon() {
+        if (program_) {
+            Stop(SIGTERM);  // a clean end, as a service manager would
+        }
+    }
     int Stop(int signo) {
         kill(program_->Pid(), signo);
         const ProgramResult r = program_->Wait();
+        program_.reset();
         log_ += r.err;
         return r.status;
     }
@@ -300,10 +305,8 @@ TEST_F(WithReceiver, RealTimeTaskSendsWhatChanged) {
 // SIGTERM cancels the run (no rsync left, the share not complete); kill -9 leaves a run that
 // the restarted daemon records as interrupted; the task and its history survive both.
 TEST_F(WithReceiver, StoppedOrKilledDuringARunTheTaskAndHistorySurvive) {
-    std::ifstream random("/dev/urandom", std::ios::binary);
-    std::string content(8u << 20, '\0');
-    random.read(&content[0], static_cast<std::streamsize>(content.size()));
-    WriteFile(source_ + "/big", content);
+    WriteFile(source_ + "/big",
+              s2s_test::RunProgram({"/usr/bin/head", "-c", "8M", "/dev/urandom"}).out);
     const std::string id = Add(R"({"name": "slow", "schedule_mode": 0, "max_bandwidth": 1024})");
     ASSERT_EQ(daemon_->S2s({"task", "run", id}).status, 0);
     ASSERT_TRUE(WaitFor(  // rsync's temporary file sorts first
