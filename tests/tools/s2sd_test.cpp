@@ -303,7 +303,8 @@ TEST_F(WithReceiver, RealTimeTaskSendsWhatChanged) {
 }
 
 // SIGTERM cancels the run (no rsync left, the share not complete); kill -9 leaves a run that
-// the restarted daemon records as interrupted; the task and its history survive both.
+// the restarted daemon records as interrupted; the task and its history survive both, and a
+// later run refused by the source check is recorded with its reason.
 TEST_F(WithReceiver, StoppedOrKilledDuringARunTheTaskAndHistorySurvive) {
     WriteFile(source_ + "/big",
               s2s_test::RunProgram({"/usr/bin/head", "-c", "8M", "/dev/urandom"}).out);
@@ -325,6 +326,7 @@ TEST_F(WithReceiver, StoppedOrKilledDuringARunTheTaskAndHistorySurvive) {
     daemon_->Start();
     ASSERT_EQ(daemon_->S2s({"task", "run", id}).status, 0);
     ASSERT_TRUE(WaitFor([&] { return Runs(id).size() == 2; })) << daemon_->Log();
+    EXPECT_NE(daemon_->S2s({"task", "status", id}).out.find("running"), std::string::npos);
     EXPECT_EQ(daemon_->Stop(SIGKILL), 128 + SIGKILL);
     // SIGKILL leaves the daemon no chance to stop its rsync; the administrator's kill does.
     s2s_test::RunProgram({"/usr/bin/pkill", "-KILL", "-f", source_});
@@ -338,6 +340,13 @@ TEST_F(WithReceiver, StoppedOrKilledDuringARunTheTaskAndHistorySurvive) {
     daemon_->S2s({"task", "show", id, "--json"}, &shown);
     EXPECT_EQ(shown["name"], "slow");
     EXPECT_EQ(daemon_->S2s({"task", "status", "--watch"}).status, 0) << "nothing runs";
+    // The folder emptied over the receiver's copy: the run is refused, and the history says why.
+    fs::remove(source_ + "/big");
+    WriteFile(copy_ + "/kept", "the receiver's copy");
+    ASSERT_EQ(daemon_->S2s({"task", "run", id}).status, 0);
+    ASSERT_TRUE(WaitForRuns(id, 3)) << daemon_->Log();
+    const std::string history = daemon_->S2s({"task", "history", id, "--count", "1"}).out;
+    EXPECT_NE(history.find("refused: empty-source, would delete 1"), std::string::npos) << history;
 }
 
 }  // namespace
