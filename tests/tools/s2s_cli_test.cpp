@@ -206,8 +206,8 @@ class Sync : public ::testing::Test {
     Host& Sender() { return pair_->Sender(); }
     // `s2s sync` for the shares of `words`, then the options there.
     std::vector<std::string> Args(const std::string& words) {
-        std::vector<std::string> args = {"sync",   "--server-ip", "127.0.0.1",
-                                         "--user", options_.user, "--no-progress"};
+        std::vector<std::string> args = {"sync", "--server-ip", "127.0.0.1", "--user",
+                                         options_.user};
         std::istringstream in(words);
         bool options = false;
         for (std::string word; in >> word;) {
@@ -295,7 +295,8 @@ TEST_F(Sync, EachFailureHasItsExitClassMessageAndJson) {
          "\"guard\": \"volume-not-mounted\""},
         // No serial number, and no MAC address in this network: no client ID.
         {"media", [&] { Sender().WriteHostConf(""); }, 1, "no client ID could be found"},
-        {"media --max-delete 2", threeDeleted, 13, "would delete 3 entries of the receiver's 10"},
+        {"media --max-delete 29%", threeDeleted, 13, "would delete 3 entries of the receiver's 10"},
+        {"media --max-delete 30%", nullptr, 0, ""},
         {"media --json", [&] { pair_->Stop(); }, 5, "the server did not answer: socket-io (10)",
          "\"result\": \"unreachable\"", "[ERROR]"},
     };
