@@ -1,470 +1,352 @@
-// s2sd as a program: the control socket under hostile clients and a second instance refused, a
-// real-time task on a real inotify watch (kept when the share's folder goes away and comes back),
-// and a kill -9 during a run followed by a restart.
+// s2sd as a program: its control socket under hostile clients, one instance per root, the s2s
+// front end managing tasks through it (add with a private password, update, show, list, errors),
+// a real-time task on a real inotify watch against a receiver, and SIGTERM (and kill -9) during a
+// run followed by a restart.
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <sys/un.h>
+#include <sys/stat.h>
 
-#include <sstream>
-#include <thread>
+#include <filesystem>
+#include <nlohmann/json.hpp>
 
 #include "s2s_control.h"
 #include "s2s_control_client.h"
 #include "s2s_ipc.h"
 #include "s2s_task_run.h"
-#include "tools/s2s_scenario.h"
+#include "support/server_pair.h"
+#include "support/tree_manifest.h"
 
 namespace {
 
-using namespace s2s_scenario;
+namespace fs = std::filesystem;
+
 namespace Control = S2S::Control;
+using nlohmann::json;
 using S2S::PObject;
+using s2s_test::Host;
+using s2s_test::ProgramResult;
 using s2s_test::WaitFor;
 using s2s_test::WriteFile;
 
-const char kUser[] = "backup";
-const char kPassword[] = "correct horse battery";
-
-// A sending host with s2sd running under its root.
+// s2sd running under a host's root.
 class Daemon {
   public:
-    explicit Daemon(const Host& host) : host_(host), env_("S2S_ROOT", host.Root().c_str()) {}
-    ~Daemon() { Stop(SIGTERM); }
-
+    explicit Daemon(const Host& host) : host_(host), env_("S2S_ROOT", host.Root().c_str()) {
+        Start();
+    }
     void Start() {
-        const std::string socket = Socket();
+        const std::string socket = host_.Root() + Control::kSocketPath;
         unlink(socket.c_str());
-        child_.reset(new Child({Tool("s2sd"), "--delay", "1", "--verbose"}, host_.Env(),
-                               host_.Root() + "/logs"));
-        ASSERT_TRUE(WaitFor([&] { return IsPathThere(socket); })) << child_->Err();
+        program_.reset(new s2s_test::Program(
+            {s2s_test::ToolPath("s2sd"), "--delay", "1", "--verbose"}, host_.Env()));
+        EXPECT_TRUE(WaitFor([&] { return access(socket.c_str(), F_OK) == 0; }));
+    }
+    ~Daemon() {
+        if (program_) {
+            Stop(SIGTERM);  // a clean end, as a service manager would
+        }
     }
     int Stop(int signo) {
-        if (!child_) {
-            return -1;
-        }
-        child_->Signal(signo);
-        const int status = child_->Wait();
-        log_ += child_->Err();
-        child_.reset();
-        return status;
+        kill(program_->Pid(), signo);
+        const ProgramResult r = program_->Wait();
+        program_.reset();
+        log_ += r.err;
+        return r.status;
     }
-    std::string Socket() const { return host_.Root() + Control::kSocketPath; }
-    pid_t Pid() const { return child_ ? child_->Pid() : -1; }
-    std::string Log() const { return log_ + (child_ ? child_->Err() : ""); }
-
+    pid_t Pid() const { return program_->Pid(); }
+    const std::string& Log() const { return log_; }
     PObject Call(const PObject& request) {
         PObject reply;
         std::string error;
         EXPECT_EQ(Control::Request(request, reply, error), 0) << error;
         return reply;
     }
+    // s2s with this host's root; the parsed JSON when it printed some.
+    ProgramResult S2s(const std::vector<std::string>& args, json* doc = nullptr) {
+        const ProgramResult r = host_.Run("s2s", args);
+        if (doc != nullptr) {
+            *doc = json::parse(r.out, nullptr, false);
+        }
+        return r;
+    }
 
   private:
     const Host& host_;
     s2s_test::ScopedEnv env_;
-    std::unique_ptr<Child> child_;
+    std::unique_ptr<s2s_test::Program> program_;
     std::string log_;
 };
 
-PObject Command(const char* command) {
+PObject Command(const char* command, const char* key = nullptr, const PObject& value = PObject()) {
     PObject request;
     request[Control::kKeyCommand] = command;
+    if (key != nullptr) {
+        request[key] = value;
+    }
     return request;
 }
 
-PObject TaskRequest(const char* command, const std::vector<std::string>& shares, int mode) {
-    PObject task;
-    task["name"] = "nightly";
-    task["server_ip"] = "127.0.0.1";
-    task["user"] = kUser;
-    task["schedule_mode"] = static_cast<unsigned long long>(mode);
-    PObject::Array list;
-    for (const std::string& share : shares) {
-        list.push_back(PObject(share));
-    }
-    task["share_list"] = list;
-    PObject request = Command(command);
-    request[Control::kKeyTask] = task;
-    request[Control::kKeyPassword] = kPassword;
-    return request;
+// `s2s task add` of a task for `share` from `file` (JSON) with the password `password`.
+std::vector<std::string> AddArgs(const Host& host, const std::string& share,
+                                 const std::string& task, const std::string& password) {
+    static int n = 0;
+    const std::string file = host.Root() + "/task" + std::to_string(++n);
+    WriteFile(file + ".json", task);
+    WriteFile(file + ".pw", password + "\n");
+    chmod((file + ".pw").c_str(), 0600);
+    return {"task",    "add",     "--task", file + ".json",    "--server-ip", "127.0.0.1", "--user",
+            "s2suser", "--share", share,    "--password-file", file + ".pw",  "--json"};
 }
 
-unsigned long long StatusOf(const PObject& reply) {
-    return reply[Control::kKeyStatus].asUInt64();
-}
-
-class ControlSocket : public ::testing::Test {
-  protected:
-    ControlSocket() : host_("s2sd", "SN-S2SD"), daemon_(host_) {}
-    void SetUp() override {
-        host_.AddShare("docs");
-        daemon_.Start();
-    }
-
-    Host host_;
-    Daemon daemon_;
-};
-
-TEST_F(ControlSocket, HostileRequestsGetAClearErrorAndTheDaemonGoesOnServing) {
+TEST(S2sd, ControlSocketServesHostileClientsAndTheFrontEnd) {
+    Host host("s2sd", "SN-S2SD");
+    host.AddShare("docs");
+    Daemon daemon(host);
+    const std::string socket = host.Root() + Control::kSocketPath;
     struct stat st;
-    ASSERT_EQ(stat(daemon_.Socket().c_str(), &st), 0);
+    ASSERT_EQ(stat(socket.c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0600u);
-
     // A client that connects and says nothing holds no one up.
     S2S::IPCSender silent;
-    ASSERT_EQ(silent.connect(daemon_.Socket()), 0);
-
+    ASSERT_EQ(silent.connect(socket), 0);
     PObject nested = Command(Control::kList);
     PObject* inner = &nested["x"];
     for (int i = 0; i < 40; ++i) {
-        (*inner)["y"] = PObject();
         inner = &(*inner)["y"];
+        *inner = PObject();
     }
-    PObject show_text = Command(Control::kShow);
-    show_text[Control::kKeyTaskId] = "1";
-    PObject add_text = Command(Control::kAdd);
-    add_text[Control::kKeyTask] = "a task";
-    PObject add_bad_key = TaskRequest(Control::kAdd, {"docs"}, 0);
-    add_bad_key[Control::kKeyTask]["ssh_port"] = "22";
-    PObject add_invalid = TaskRequest(Control::kAdd, {"nosuchshare"}, 0);
-    PObject add_bad_name = TaskRequest(Control::kAdd, {"docs"}, 0);
-    add_bad_name[Control::kKeyTask]["name"] = "../nightly";  // the receiver would refuse it
-    PObject number_command;
-    number_command[Control::kKeyCommand] = 5ULL;
+    PObject numberCommand;
+    numberCommand[Control::kKeyCommand] = 5ULL;
     const struct {
         PObject request;
         unsigned long long status;
         const char* words;
     } cases[] = {
         {PObject("list"), Control::kBadRequest, "not a map"},
-        {number_command, Control::kBadRequest, "command"},
+        {numberCommand, Control::kBadRequest, "command"},
         {Command("frobnicate"), Control::kBadRequest, "unknown command 'frobnicate'"},
-        {show_text, Control::kBadRequest, "'task_id' must be an integer"},
-        {add_text, Control::kBadRequest, "'task' must be a task map"},
-        {add_bad_key, Control::kBadRequest, "'ssh_port' has the wrong type"},
-        {add_invalid, Control::kInvalidTask, "share 'nosuchshare' is not valid"},
-        {add_bad_name, Control::kInvalidTask, "not one a receiver takes"},
+        {Command(Control::kShow, Control::kKeyTaskId, PObject("1")), Control::kBadRequest,
+         "'task_id' must be an integer"},
+        {Command(Control::kAdd, Control::kKeyTask, PObject("a task")), Control::kBadRequest,
+         "'task' must be a task map"},
         {Command(Control::kShow), Control::kBadRequest, "'task_id' is missing"},
         {nested, Control::kTooLarge, "nests deeper"},
     };
     for (const auto& c : cases) {
-        const PObject reply = daemon_.Call(c.request);
-        EXPECT_EQ(StatusOf(reply), c.status) << c.request.toString();
+        const PObject reply = daemon.Call(c.request);
+        EXPECT_EQ(reply[Control::kKeyStatus].asUInt64(), c.status) << c.request.toString();
         EXPECT_NE(reply[Control::kKeyMessage].asString().find(c.words), std::string::npos)
             << reply[Control::kKeyMessage].asString();
     }
-
-    // 100 MB in one request.
     {
-        PObject big = Command(Control::kList);
-        PObject::Array chunks(1600, PObject(std::string(65000, 'x')));
-        big["junk"] = chunks;
+        PObject big = Command(Control::kList);  // 100 MB in one request
+        big["junk"] = PObject::Array(1600, PObject(std::string(65000, 'x')));
         S2S::IPCSender sender;
-        ASSERT_EQ(sender.connect(daemon_.Socket()), 0);
         PObject reply;
+        ASSERT_EQ(sender.connect(socket), 0);
         ASSERT_EQ(sender.send(big, true, reply), 0);
-        EXPECT_EQ(StatusOf(reply), Control::kTooLarge) << reply.toString();
+        EXPECT_EQ(reply[Control::kKeyStatus].asUInt64(), Control::kTooLarge);
     }
-
-    // 200 clients at once, each answered.
     {
-        std::vector<std::unique_ptr<S2S::IPCSender>> clients;
+        std::vector<std::unique_ptr<S2S::IPCSender>> clients;  // 200 at once, each answered
         for (int i = 0; i < 200; ++i) {
             clients.emplace_back(new S2S::IPCSender);
-            ASSERT_EQ(clients.back()->connect(daemon_.Socket()), 0) << i;
-        }
-        for (auto& client : clients) {
-            ASSERT_EQ(client->send(Command(Control::kList)), 0);
+            ASSERT_EQ(clients.back()->connect(socket), 0) << i;
+            ASSERT_EQ(clients.back()->send(Command(Control::kList)), 0);
         }
         for (auto& client : clients) {
             PObject reply;
             ASSERT_EQ(client->recv(reply), 0);
-            EXPECT_EQ(StatusOf(reply), Control::kOk);
+            EXPECT_EQ(reply[Control::kKeyStatus].asUInt64(), Control::kOk);
         }
     }
-
-    // The silent client is told in the end, and the daemon still answers.
-    PObject told;
+    PObject told;  // the silent client is told in the end
     ASSERT_EQ(silent.recv(told), 0);
-    EXPECT_EQ(StatusOf(told), Control::kBadRequest);
     EXPECT_NE(told[Control::kKeyMessage].asString().find("no complete request"), std::string::npos);
-
-    const PObject added = daemon_.Call(TaskRequest(Control::kAdd, {"docs"}, 0));
-    ASSERT_EQ(StatusOf(added), Control::kOk) << added.toString();
-    PObject show = Command(Control::kShow);
-    show[Control::kKeyTaskId] = added[Control::kKeyTaskId];
-    const PObject shown = daemon_.Call(show);
-    EXPECT_EQ(shown[Control::kKeyTask]["name"].asString(), "nightly");
-    EXPECT_EQ(shown[Control::kKeyTask][Control::kKeyState].asString(), "idle");
-    // The password is kept in a root-only file and never comes back.
-    EXPECT_FALSE(shown[Control::kKeyTask].hasMember("pswd"));
-    const std::string password_file = host_.Root() + Control::kPasswordDir + "/" +
-                                      std::to_string(added[Control::kKeyTaskId].asUInt64());
-    ASSERT_EQ(stat(password_file.c_str(), &st), 0);
+    // The front end: the password travels beside the task into a root-only file and never
+    // comes back; an update changes only what it is given.
+    json doc;
+    const std::string task = R"({"name": "nightly", "schedule_mode": 0, "compress": true})";
+    ProgramResult r = daemon.S2s(AddArgs(host, "docs", task, "secret-pw"), &doc);
+    ASSERT_EQ(r.status, 0) << r.All();
+    const std::string id = std::to_string(doc["task_id"].get<unsigned>());
+    ASSERT_EQ(stat((host.Root() + Control::kPasswordDir + "/" + id).c_str(), &st), 0);
     EXPECT_EQ(st.st_mode & 0777, 0600u);
-    EXPECT_EQ(daemon_.Log().find(kPassword), std::string::npos);
-
-    // A second daemon on the same root, in the foreground or detaching, is refused before it
-    // touches the socket; the first goes on serving.
-    for (const char* mode : {"--verbose", "--daemon"}) {
-        Child second({Tool("s2sd"), mode}, host_.Env(), host_.Root() + "/logs");
-        EXPECT_EQ(second.Wait(), 1) << mode;
-        EXPECT_NE(second.Err().find("s2sd is already running (pid " +
-                                    std::to_string(daemon_.Pid()) + ")"),
-                  std::string::npos)
-            << second.Err();
+    EXPECT_EQ(daemon
+                  .S2s({"task", "update", id, "--max-bandwidth", "100", "--allow-empty-source",
+                        "--max-delete", "20%"})
+                  .status,
+              0);
+    r = daemon.S2s({"task", "show", id, "--json"}, &doc);
+    EXPECT_EQ(doc["name"], "nightly") << r.out;
+    EXPECT_EQ(doc["compress"], true) << r.out;
+    EXPECT_EQ(doc["max_bandwidth"], 100) << r.out;
+    EXPECT_EQ(doc["allow_empty_source"], true) << r.out;
+    EXPECT_EQ(doc["max_delete"], "20%") << r.out;
+    EXPECT_EQ(doc["state"], "idle") << r.out;
+    EXPECT_EQ(r.out.find("secret-pw"), std::string::npos);
+    r = daemon.S2s({"task", "list"});
+    EXPECT_NE(r.out.find("nightly"), std::string::npos) << r.All();
+    const struct {
+        std::vector<std::string> args;
+        int status;
+        const char* words;
+    } errors[] = {
+        {AddArgs(host, "nosuchshare", task, "pw"), 3, "share 'nosuchshare' is not valid"},
+        {AddArgs(host, "docs", R"({"name": "../nightly"})", "pw"), 3, "not one a receiver takes"},
+        {{"task", "show", "99"}, 21, ""},
+        {{"task", "cancel", id}, 23, ""},
+        {AddArgs(host, "docs", task, "pw"), 24, ""},
+    };
+    for (const auto& e : errors) {
+        if (e.status == 24) {
+            fs::remove_all(host.Root() + Control::kPasswordDir);  // a file in the way
+            WriteFile(host.Root() + Control::kPasswordDir, "");
+        }
+        r = daemon.S2s(e.args);
+        EXPECT_EQ(r.status, e.status) << r.All();
+        EXPECT_NE(r.err.find(e.words), std::string::npos) << r.err;
     }
-    EXPECT_EQ(StatusOf(daemon_.Call(Command(Control::kList))), Control::kOk);
-    EXPECT_EQ(daemon_.Stop(SIGTERM), 0);
+    // A second daemon on the same root (foreground or detaching) is refused; the first serves on.
+    for (const char* mode : {"--verbose", "--daemon"}) {
+        r = host.Run("s2sd", {mode});
+        EXPECT_EQ(r.status, 1) << mode;
+        EXPECT_NE(r.err.find("s2sd is already running (pid " + std::to_string(daemon.Pid()) + ")"),
+                  std::string::npos)
+            << r.err;
+    }
+    EXPECT_EQ(daemon.Call(Command(Control::kList))[Control::kKeyStatus].asUInt64(), Control::kOk);
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+    EXPECT_EQ(daemon.Log().find("secret-pw"), std::string::npos);
 }
 
-// A sending host with s2sd and a receiving host, in a network namespace of their own.
-class DaemonScenario : public ::testing::Test {
+// A sending host with s2sd and a receiver, in a network of their own.
+class WithReceiver : public ::testing::Test {
   protected:
     void SetUp() override {
-        if (!EnterPrivateNetwork()) {
-            GTEST_SKIP() << "needs root and network namespaces";
+        s2s_test::PairOptions options;
+        options.standardPort = true;
+        const std::string why = s2s_test::ServerPair::Unavailable(options);
+        if (!why.empty()) {
+            GTEST_SKIP() << why;
         }
-        receiver_.reset(new Receiver(kUser, kPassword));
-        sender_.reset(new Sender("sender", "SN-SENDER-D", kPassword));
-        sender_->AddShare("docs");
-        receiver_->AddShare("docs");
-        ASSERT_EQ(receiver_->Configure().status, 0);
-        ASSERT_EQ(receiver_->Start().status, 0);
-        daemon_.reset(new Daemon(*sender_));
-        daemon_->Start();
+        pair_.reset(new s2s_test::ServerPair(options));
+        source_ = pair_->Sender().AddShare("docs");
+        copy_ = pair_->Receiver().AddShare("docs");
+        ASSERT_EQ(pair_->Start(), "");
+        daemon_.reset(new Daemon(pair_->Sender()));
     }
-
-    // The runs of task `id`, newest first.
-    PObject::Array Runs(const PObject& id) {
-        PObject history = Command(Control::kHistory);
-        history[Control::kKeyTaskId] = id;
-        return daemon_->Call(history)[Control::kKeyRuns].asArray();
+    std::string Add(const std::string& task) {
+        json doc;
+        const ProgramResult r =
+            daemon_->S2s(AddArgs(pair_->Sender(), "docs", task, "pw-9Xq2r"), &doc);
+        EXPECT_EQ(r.status, 0) << r.All();
+        return r.status == 0 ? std::to_string(doc["task_id"].get<unsigned>()) : "0";
     }
-    // Waits until task `id` has `count` runs, the newest one ended, and the task is no longer
-    // running (the run is recorded a moment before its task is free to run again).
-    bool WaitForRuns(const PObject& id, size_t count, std::chrono::seconds limit) {
-        PObject status = Command(Control::kStatus);
-        status[Control::kKeyTaskId] = id;
+    // The task's runs, newest first.
+    json Runs(const std::string& id) {
+        json doc;
+        daemon_->S2s({"task", "history", id, "--json"}, &doc);
+        return doc.is_array() ? doc : json::array();
+    }
+    // Waits until the task has `count` runs and is no longer running.
+    bool WaitForRuns(const std::string& id, size_t count) {
         return WaitFor(
             [&] {
-                const PObject::Array runs = Runs(id);
-                const PObject reply = daemon_->Call(status);
-                const PObject::Array& tasks = reply[Control::kKeyTasks].asArray();
-                return runs.size() >= count && runs[0][Control::kKeyEnd].asUInt64() != 0 &&
-                       tasks.size() == 1 &&
-                       tasks[0][Control::kKeyState].asString() != Control::kStateRunning;
+                json status;
+                daemon_->S2s({"task", "status", id, "--json"}, &status);
+                return Runs(id).size() >= count &&
+                       status.dump().find("\"running\"") == std::string::npos;
             },
-            limit);
+            std::chrono::seconds(60));
     }
-
-    std::unique_ptr<Receiver> receiver_;
-    std::unique_ptr<Sender> sender_;
+    bool Arrived(const std::string& path, const std::string& content) {
+        return WaitFor([&] { return s2s_test::ReadFile(copy_ + path) == content; },
+                       std::chrono::seconds(60));
+    }
+    std::unique_ptr<s2s_test::ServerPair> pair_;
     std::unique_ptr<Daemon> daemon_;
+    std::string source_;
+    std::string copy_;
 };
 
-// The "total size" (of the files in its list) that the sender's rsync logged for the run whose
-// itemised lines name `path`; -1 when no such run is logged.
-long long LoggedTotalSize(const std::string& log, const std::string& path) {
-    std::istringstream in(log);
-    std::string line;
-    std::string pid;
-    long long total = -1;
-    while (std::getline(in, line)) {
-        const size_t open = line.find('[');
-        const size_t close = line.find(']', open);
-        if (open == std::string::npos || close == std::string::npos) {
-            continue;
-        }
-        const std::string id = line.substr(open, close - open);
-        if (line.size() > path.size() &&
-            line.compare(line.size() - path.size(), path.size(), path) == 0) {
-            pid = id;
-        }
-        const size_t size = line.find("total size ");
-        if (id == pid && size != std::string::npos) {
-            total = std::stoll(line.substr(size + 11));
-        }
+// A real-time task syncs whole at once, then sends what changed: a file in a directory that
+// appeared (watched too), a deletion, and the folder gone and back (a volume unmounted and
+// mounted again).
+TEST_F(WithReceiver, RealTimeTaskSendsWhatChanged) {
+    for (int i = 0; i < 50; ++i) {
+        WriteFile(source_ + "/file" + std::to_string(i), std::string(1000, 'a' + i % 26));
     }
-    return total;
-}
-
-TEST_F(DaemonScenario, RealTimeTaskSendsOnlyWhatChangedIncludingNewDirectoriesAndDeletions) {
-    const std::string source = sender_->SharePath("docs");
-    const std::string copy = receiver_->SharePath("docs");
-    GenerateFiles(source, 200, 1000);
-    const PObject added = daemon_->Call(TaskRequest(Control::kAdd, {"docs"}, 1));
-    ASSERT_EQ(StatusOf(added), Control::kOk) << added.toString();
-    const PObject id = added[Control::kKeyTaskId];
-    // A new real-time task is synced whole at once.
-    ASSERT_TRUE(WaitForRuns(id, 1, std::chrono::seconds(60))) << daemon_->Log();
-    EXPECT_EQ(Runs(id)[0][Control::kKeyResult].asUInt64(), 0u) << daemon_->Log();
-
-    MakeDirs(source + "/new");
-    ASSERT_TRUE(WaitFor([&] { return IsPathThere(copy + "/new"); }, std::chrono::seconds(60)))
-        << daemon_->Log();
-    // The directory that appeared is watched too, and the run sends that one file, not the
-    // share's 200 KB.
-    WriteFile(source + "/new/later", "written later");
-    ASSERT_TRUE(WaitFor([&] { return s2s_test::ReadFile(copy + "/new/later") == "written later"; },
-                        std::chrono::seconds(60)))
-        << daemon_->Log();
-    const std::string log = s2s_test::ReadFile(sender_->Root() + "/var/log/s2s_rsync.log");
-    EXPECT_EQ(LoggedTotalSize(log, "new/later"), 13) << log;
-    // What rsync read for so short a run is counted once it has ended.
-    ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(60))) << daemon_->Log();
-    EXPECT_GE(Runs(id)[0][Control::kKeyShares].asArray()[0][Control::kKeyReadBytes].asUInt64(), 13u)
-        << Runs(id)[0].toString();
-
-    // A file deleted on the sender goes from the receiver; the rest stays.
-    ASSERT_EQ(unlink((source + "/file7").c_str()), 0);
-    ASSERT_TRUE(WaitFor([&] { return !IsPathThere(copy + "/file7"); }, std::chrono::seconds(60)))
-        << daemon_->Log();
-    ASSERT_TRUE(WaitForRuns(id, 4, std::chrono::seconds(60))) << daemon_->Log();
-    EXPECT_EQ(Manifest(copy), Manifest(source));
-
-    // The share's folder goes away and comes back (a volume unmounted and mounted again): it is
-    // watched again and what it holds then is synced.
-    const std::string folder = source;
+    const std::string id = Add(R"({"name": "live", "schedule_mode": 1})");
+    ASSERT_TRUE(WaitForRuns(id, 1)) << daemon_->Log();
+    EXPECT_EQ(Runs(id)[0]["result"], 0) << Runs(id).dump();
+    fs::create_directories(source_ + "/new");
+    ASSERT_TRUE(WaitFor([&] { return access((copy_ + "/new").c_str(), F_OK) == 0; },
+                        std::chrono::seconds(60)));
+    WriteFile(source_ + "/new/later", "written later");
+    ASSERT_TRUE(Arrived("/new/later", "written later")) << daemon_->Log();
+    // That run sent the one file, not the share's 50 KB.
+    const std::string log = s2s_test::ReadFile(pair_->Sender().Root() + "/var/log/s2s_rsync.log");
+    EXPECT_NE(log.find("total size 13\n"), std::string::npos) << log;
+    ASSERT_EQ(unlink((source_ + "/file7").c_str()), 0);
+    ASSERT_TRUE(WaitFor([&] { return access((copy_ + "/file7").c_str(), F_OK) != 0; },
+                        std::chrono::seconds(60)));
     const size_t runs = Runs(id).size();
-    s2s_test::RemoveTree(folder);
-    // The removal itself is a change; its run ends before the folder comes back.
-    ASSERT_TRUE(WaitForRuns(id, runs + 1, std::chrono::seconds(60))) << daemon_->Log();
-    MakeDirs(folder);
-    WriteFile(folder + "/back", "after the return");
-    EXPECT_TRUE(WaitFor([&] { return IsPathThere(receiver_->SharePath("docs") + "/back"); },
-                        std::chrono::seconds(60)))
-        << daemon_->Log();
-    EXPECT_NE(daemon_->Log().find("[NOTE] realtime_watch.cpp"), std::string::npos);
+    s2s_test::RemoveTree(source_);
+    ASSERT_TRUE(WaitForRuns(id, runs + 1)) << daemon_->Log();
+    fs::create_directories(source_);
+    WriteFile(source_ + "/back", "after the return");
+    EXPECT_TRUE(Arrived("/back", "after the return")) << daemon_->Log();
+    ASSERT_TRUE(WaitForRuns(id, runs + 2)) << daemon_->Log();
+    const std::string history = daemon_->S2s({"task", "history", id, "--count", "1"}).out;
+    EXPECT_NE(history.find("  ok (0)\n     docs  result 0  1 files  16 B  "), std::string::npos)
+        << history;
 }
 
-TEST_F(DaemonScenario, ATasksGuardOptionsKeepTheReceiversCopyAndTheRefusalIsRecorded) {
-    const std::string source = sender_->SharePath("docs");
-    GenerateFiles(source, 5, 100);
-    const PObject added = daemon_->Call(TaskRequest(Control::kAdd, {"docs"}, 0));
-    ASSERT_EQ(StatusOf(added), Control::kOk) << added.toString();
-    const PObject id = added[Control::kKeyTaskId];
-    PObject run = Command(Control::kRun);
-    run[Control::kKeyTaskId] = id;
-    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
-    ASSERT_TRUE(WaitForRuns(id, 1, std::chrono::seconds(60))) << daemon_->Log();
-    const auto copy = Manifest(receiver_->SharePath("docs"));
-    ASSERT_EQ(copy.size(), 5u) << daemon_->Log();
-
-    // The folder emptied: the run is refused and the receiver's copy stays whole.
-    for (int i = 0; i < 5; ++i) {
-        ASSERT_EQ(unlink((source + "/file" + std::to_string(i)).c_str()), 0);
-    }
-    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
-    ASSERT_TRUE(WaitForRuns(id, 2, std::chrono::seconds(60))) << daemon_->Log();
-    PObject last = Runs(id)[0];
-    EXPECT_EQ(last[Control::kKeyResult].asUInt64(),
-              static_cast<unsigned long long>(S2S::RunFailure::kUnsafeSource));
-    EXPECT_EQ(last[Control::kKeyShares].asArray()[0][Control::kKeyGuard].asString(), "empty-source")
-        << last.toString();
-    EXPECT_EQ(Manifest(receiver_->SharePath("docs")), copy);
-
-    // Emptiness allowed but at most 2 deletions: refused by the limit, still nothing deleted.
-    PObject update = TaskRequest(Control::kUpdate, {"docs"}, 0);
-    update[Control::kKeyTaskId] = id;
-    update[Control::kKeyTask][Control::kKeyAllowEmptySource] = true;
-    update[Control::kKeyTask][Control::kKeyMaxDelete] = "2";
-    ASSERT_EQ(StatusOf(daemon_->Call(update)), Control::kOk);
-    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
-    ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(60))) << daemon_->Log();
-    last = Runs(id)[0];
-    EXPECT_EQ(last[Control::kKeyResult].asUInt64(),
-              static_cast<unsigned long long>(S2S::RunFailure::kMaxDelete));
-    EXPECT_EQ(last[Control::kKeyShares].asArray()[0][Control::kKeyGuard].asString(), "max-delete");
-    EXPECT_EQ(last[Control::kKeyShares].asArray()[0][Control::kKeyWouldDelete].asUInt64(), 5u);
-    EXPECT_EQ(Manifest(receiver_->SharePath("docs")), copy);
-    PObject status = Command(Control::kStatus);
-    status[Control::kKeyTaskId] = id;
-    const PObject entry = daemon_->Call(status)[Control::kKeyTasks].asArray()[0];
-    EXPECT_EQ(entry[Control::kKeyLastResult].asUInt64(), last[Control::kKeyResult].asUInt64());
-    EXPECT_NE(entry[Control::kKeyLastMessage].asString().find("delete"), std::string::npos)
-        << entry.toString();
-
-    // The options survive a restart; an update that leaves them out keeps them; a bad limit is
-    // an invalid task.
-    EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
-    daemon_->Start();
-    update[Control::kKeyTask].asMap().erase(Control::kKeyAllowEmptySource);
-    update[Control::kKeyTask].asMap().erase(Control::kKeyMaxDelete);
-    ASSERT_EQ(StatusOf(daemon_->Call(update)), Control::kOk);
-    PObject show = Command(Control::kShow);
-    show[Control::kKeyTaskId] = id;
-    const PObject task = daemon_->Call(show)[Control::kKeyTask];
-    EXPECT_TRUE(task[Control::kKeyAllowEmptySource].asBool());
-    EXPECT_EQ(task[Control::kKeyMaxDelete].asString(), "2");
-    update[Control::kKeyTask][Control::kKeyMaxDelete] = "150%";
-    const PObject refused = daemon_->Call(update);
-    EXPECT_EQ(StatusOf(refused), Control::kInvalidTask);
-    EXPECT_NE(refused[Control::kKeyMessage].asString().find("max_delete"), std::string::npos);
-}
-
-TEST_F(DaemonScenario, StoppedOrKilledDuringARunTheTaskAndHistorySurviveAndTheNextRunCompletes) {
-    WriteRandomFile(sender_->SharePath("docs") + "/big", 300u << 20);
-    PObject request = TaskRequest(Control::kAdd, {"docs"}, 0);
-    request[Control::kKeyTask]["compress"] = 1ULL;
-    const PObject added = daemon_->Call(request);
-    ASSERT_EQ(StatusOf(added), Control::kOk) << added.toString();
-    const PObject id = added[Control::kKeyTaskId];
-    PObject run = Command(Control::kRun);
-    run[Control::kKeyTaskId] = id;
-    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
-    const auto copying = [&] {
-        return WaitFor([&] { return HasPartialFile(receiver_->SharePath("docs")); },
-                       std::chrono::seconds(60));
-    };
-    ASSERT_TRUE(copying()) << daemon_->Log();
-
-    // SIGTERM: the transfer is cancelled, no rsync is left behind, the share is not complete.
-    EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
-    EXPECT_TRUE(ProcessesMentioning(sender_->SharePath("docs")).empty());
-    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
-              std::string::npos);
-    daemon_->Start();
-    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
-    // The copy is under way again (its progress shows in the status).
-    PObject status = Command(Control::kStatus);
-    status[Control::kKeyTaskId] = id;
-    ASSERT_TRUE(WaitFor(
+// SIGTERM cancels the run (no rsync left, the share not complete); kill -9 leaves a run that
+// the restarted daemon records as interrupted; the task and its history survive both, and a
+// later run refused by the source check is recorded with its reason.
+TEST_F(WithReceiver, StoppedOrKilledDuringARunTheTaskAndHistorySurvive) {
+    WriteFile(source_ + "/big",
+              s2s_test::RunProgram({"/usr/bin/head", "-c", "8M", "/dev/urandom"}).out);
+    const std::string id = Add(R"({"name": "slow", "schedule_mode": 0, "max_bandwidth": 1024})");
+    ASSERT_EQ(daemon_->S2s({"task", "run", id}).status, 0);
+    ASSERT_TRUE(WaitFor(  // rsync's temporary file sorts first
         [&] {
-            const PObject reply = daemon_->Call(status);
-            const PObject::Array& tasks = reply[Control::kKeyTasks].asArray();
-            return tasks.size() == 1 && tasks[0][Control::kKeyShare].asString() == "docs" &&
-                   tasks[0][Control::kKeyBytesDone].asUInt64() > 0;
+            const auto tree = s2s_test::TreeManifest(copy_);
+            return !tree.empty() && tree.begin()->first[1] == '.';
         },
         std::chrono::seconds(60)))
-        << daemon_->Log();
-
+        << "rsync's temporary file never came: " << daemon_->Log();
+    const ProgramResult busy = daemon_->S2s({"task", "remove", id});
+    EXPECT_EQ(busy.status, 22) << busy.All();
+    EXPECT_EQ(daemon_->Stop(SIGTERM), 0);
+    EXPECT_EQ(s2s_test::RunProgram({"/usr/bin/pgrep", "-f", source_}).out, "");
+    EXPECT_EQ(pair_->Receiver().Run("s2s-receiver", {"status"}).out.find("last sync completed"),
+              std::string::npos);
+    daemon_->Start();
+    ASSERT_EQ(daemon_->S2s({"task", "run", id}).status, 0);
+    ASSERT_TRUE(WaitFor([&] { return Runs(id).size() == 2; })) << daemon_->Log();
+    EXPECT_NE(daemon_->S2s({"task", "status", id}).out.find("running"), std::string::npos);
     EXPECT_EQ(daemon_->Stop(SIGKILL), 128 + SIGKILL);
     // SIGKILL leaves the daemon no chance to stop its rsync; the administrator's kill does.
-    for (pid_t pid : ProcessesMentioning(sender_->SharePath("docs"))) {
-        kill(pid, SIGKILL);
-    }
+    s2s_test::RunProgram({"/usr/bin/pkill", "-KILL", "-f", source_});
     daemon_->Start();
-
-    PObject show = Command(Control::kShow);
-    show[Control::kKeyTaskId] = id;
-    EXPECT_EQ(daemon_->Call(show)[Control::kKeyTask]["name"].asString(), "nightly");
-    PObject::Array runs = Runs(id);
-    ASSERT_EQ(runs.size(), 2u);
-    EXPECT_EQ(runs[0][Control::kKeyResult].asUInt64(), 99u);  // interrupted
-    EXPECT_NE(runs[0][Control::kKeyEnd].asUInt64(), 0u);
-    EXPECT_EQ(runs[1][Control::kKeyResult].asUInt64(),
-              static_cast<unsigned long long>(S2S::RunFailure::kCancelled));
-    EXPECT_EQ(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
-              std::string::npos);
-
-    ASSERT_EQ(StatusOf(daemon_->Call(run)), Control::kOk);
-    ASSERT_TRUE(WaitForRuns(id, 3, std::chrono::seconds(300))) << daemon_->Log();
-    runs = Runs(id);
-    EXPECT_EQ(runs[0][Control::kKeyResult].asUInt64(), 0u) << runs[0].toString();
-    EXPECT_EQ(Manifest(sender_->SharePath("docs")), Manifest(receiver_->SharePath("docs")));
-    EXPECT_NE(receiver_->Status().out.find("share: docs bound to SN-SENDER-D, last sync completed"),
-              std::string::npos);
+    const json runs = Runs(id);
+    ASSERT_EQ(runs.size(), 2u) << runs.dump();
+    EXPECT_EQ(runs[0]["result"], 99) << "interrupted";
+    EXPECT_NE(runs[0]["end"], 0);
+    EXPECT_EQ(runs[1]["result"], static_cast<int>(S2S::RunFailure::kCancelled));
+    json shown;
+    daemon_->S2s({"task", "show", id, "--json"}, &shown);
+    EXPECT_EQ(shown["name"], "slow");
+    EXPECT_EQ(daemon_->S2s({"task", "status", "--watch"}).status, 0) << "nothing runs";
+    // The folder emptied over the receiver's copy: the run is refused, and the history says why.
+    fs::remove(source_ + "/big");
+    WriteFile(copy_ + "/kept", "the receiver's copy");
+    ASSERT_EQ(daemon_->S2s({"task", "run", id}).status, 0);
+    ASSERT_TRUE(WaitForRuns(id, 3)) << daemon_->Log();
+    const std::string history = daemon_->S2s({"task", "history", id, "--count", "1"}).out;
+    EXPECT_NE(history.find("refused: empty-source, would delete 1"), std::string::npos) << history;
 }
 
 }  // namespace
