@@ -36,7 +36,6 @@
 #include "platform/records.h"
 #include "platform/env.h"
 #include "receiver/internal.h"
-#include "rsync/child_process.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"
 #include "s2s_receiver.h"
@@ -734,7 +733,7 @@ int StartLocked(std::string* error) {
                                "): the daemon was not started");
     }
     unlink(S2SPath(S2S_PATH_RSYNCD_PID));
-    std::string rsync = rsync_internal::FindProgram("rsync");
+    std::string rsync = s2s_platform::FindProgram("rsync");
     if (rsync.empty()) {
         SetEnabled(false);
         return Fail(error, "rsync is not installed");
