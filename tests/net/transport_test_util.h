@@ -30,25 +30,6 @@ class TransportEnvironment : public ::testing::Environment {
 inline ::testing::Environment* const kTransportEnvironment =
     ::testing::AddGlobalTestEnvironment(new TransportEnvironment);  // gtest owns it
 
-// Sends the library's log to a private file at `level` for the object's lifetime.
-class LogCapture {
-  public:
-    explicit LogCapture(int level = S2S::Logger::Debug) : dir_("s2s-net-log") {
-        path_ = dir_ / "log";
-        S2S::Logger::Initialize(S2S::Logger::File, level, path_, 2);
-    }
-    ~LogCapture() { S2S::Logger::Destroy(); }
-    LogCapture(const LogCapture&) = delete;
-    LogCapture& operator=(const LogCapture&) = delete;
-
-    std::string Text() const { return ReadFile(path_); }
-    bool Contains(const std::string& text) const { return Text().find(text) != std::string::npos; }
-
-  private:
-    TempDir dir_;
-    std::string path_;
-};
-
 // Two connected stream sockets; whichever end was not released is closed on destruction.
 class SocketPair {
   public:

@@ -15,7 +15,7 @@ namespace {
 
 using S2S::Schedule;
 using s2s_test::Local;
-using s2s_test::LogCapture;
+using LogCapture = s2s_test::StampFreeLogCapture;
 using s2s_test::ScopedTZ;
 using s2s_test::Utc;
 

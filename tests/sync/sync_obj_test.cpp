@@ -18,7 +18,7 @@ using S2S::Share;
 using S2S::SyncInfo;
 using S2S::SyncTask;
 using S2S::TaskInfo;
-using s2s_test::LogCapture;
+using LogCapture = s2s_test::StampFreeLogCapture;
 using s2s_test::ScopedEnv;
 using s2s_test::ScopedTZ;
 using s2s_test::TempDir;

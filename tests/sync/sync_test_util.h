@@ -39,18 +39,18 @@ class ScopedTZ {
 
 // Sends the library's log to a private file at level DEBUG; Text() is what was logged, without
 // the time stamps. Puts the logger back to its initial state (syslog, level 3) afterwards.
-class LogCapture {
+class StampFreeLogCapture {
   public:
-    LogCapture() : dir_("s2s-sync-log") {
+    StampFreeLogCapture() : dir_("s2s-sync-log") {
         path_ = dir_ / "log";
         S2S::Logger::Initialize(S2S::Logger::File, S2S::Logger::Debug, path_, 5);
     }
-    ~LogCapture() {
+    ~StampFreeLogCapture() {
         S2S::Logger::Destroy();
         S2S::Logger::Initialize(S2S::Logger::Syslog, S2S::Logger::Error, "", 0);
     }
-    LogCapture(const LogCapture&) = delete;
-    LogCapture& operator=(const LogCapture&) = delete;
+    StampFreeLogCapture(const StampFreeLogCapture&) = delete;
+    StampFreeLogCapture& operator=(const StampFreeLogCapture&) = delete;
 
     std::string Text() const {
         static const std::regex stamp("[A-Z][a-z]{2} [ 0-9][0-9] [0-9]{2}:[0-9]{2}:[0-9]{2} ");
