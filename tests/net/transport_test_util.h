@@ -1,4 +1,4 @@
-// Helpers of the transport tests: a log captured in a file, connected socket pairs, a peer thread
+// Helpers of the transport tests: connected socket pairs, a peer thread
 // that is always joined, and a process-wide SIGPIPE disposition (the library leaves it alone; a
 // program using it ignores the signal, as these tests do).
 #ifndef S2S_TESTS_NET_TRANSPORT_TEST_UTIL_H
