@@ -45,7 +45,7 @@ class HostQueries : public ::testing::Test {
         EXPECT_EQ(system(("mkdir -p '" + path.substr(0, path.rfind('/')) + "'").c_str()), 0);
         WriteFile(path, text);
     }
-    void AddShare(const char* name, std::initializer_list<std::pair<const char*, const char*>> kv) {
+    void AddShare(const char* name, std::initializer_list<std::pair<const char*, std::string>> kv) {
         Table attrs(kv);
         ASSERT_EQ(VURNShareSet(name, attrs.get()), 0);
     }

@@ -1,3 +1,7 @@
+// Channel, the buffered socket: byte order of integers, the write and read rings (flushing,
+// wrapping, partial reads kept), large transfers through small rings, opening by address, path
+// and descriptor with their refusals, closed-channel I/O, inactivity timeouts, the abort flag,
+// connect timeouts, and subclasses replacing any step.
 #include "s2s_channel.h"
 
 #include <arpa/inet.h>

@@ -1,3 +1,6 @@
+// IPC senders and listeners: request and reply over TCP loopback and over a domain socket to
+// another process, one-way messages, listener files (never replaced, only sockets removed), port
+// probing, readiness waits, failures of fixed-port sockets and senders, and the virtual receive.
 #include "s2s_ipc.h"
 
 #include <arpa/inet.h>
@@ -91,10 +94,8 @@ TEST(IPCTest, RequestAndReplyOverDomainSocketWithServerInAnotherProcess) {
     std::string path = dir / "daemon.sock";
     IPCListener listener;
     ASSERT_EQ(0, listener.prepare(path));
-    pid_t child = fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
-        // The serving process: answers one request, then leaves without running test teardown.
+    // The serving process: answers one request.
+    s2s_test::Child child([&] {
         int fd = listener.isReady() ? listener.accept() : -1;
         IPCSender server;
         PObject request;
@@ -102,17 +103,15 @@ TEST(IPCTest, RequestAndReplyOverDomainSocketWithServerInAnotherProcess) {
         request["pid"] = static_cast<unsigned long long>(getpid());
         ok = ok && server.send(request) == 0;
         server.close();
-        _exit(ok ? 0 : 1);
-    }
+        return ok ? 0 : 1;
+    });
     IPCSender client;
     ASSERT_EQ(0, client.connect(path));
     PObject reply;
     ASSERT_EQ(0, client.send(Request(), true, reply));
-    EXPECT_EQ(static_cast<unsigned long long>(child), reply["pid"].asUInt64());
+    EXPECT_EQ(static_cast<unsigned long long>(child.pid()), reply["pid"].asUInt64());
     EXPECT_EQ("status", reply["action"].asString());
-    int status = 0;
-    ASSERT_EQ(child, waitpid(child, &status, 0));
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+    EXPECT_EQ(0, child.Wait());
 
     // Closing removes the socket file (the child's copy of the listener did not).
     EXPECT_TRUE(Exists(path));

@@ -1,3 +1,7 @@
+// PStream, the wire format of local messages: one golden encoding per kind, the map-key rule,
+// round trips across small rings, malformed streams in one table (status, log line, what
+// arrived), key paths in error logs, truncated and stalled peers, receive limits, depth without
+// the call stack, status read from another thread, replaced channel steps, masked passwords.
 #include "s2s_stream.h"
 
 #include <gtest/gtest.h>
@@ -5,7 +9,6 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <random>
 #include <string>
 #include <vector>
 
@@ -120,46 +123,36 @@ TEST(PStreamTest, NestedValuesRoundTripAcrossSmallRings) {
     EXPECT_EQ(task.toString(), back.toString());
 }
 
-TEST(PStreamTest, StringsKeepOnlyTheBytesBeforeANul) {
-    PObject back;
-    ASSERT_EQ(0, Decode(Bytes({0x10, 0x00, 0x04, 'a', 'b', 0x00, 'c'}), back));
-    EXPECT_TRUE(back.isString());
-    EXPECT_EQ("ab", back.asString());
-    // The bytes after the NUL were consumed: the next value follows them.
-    ASSERT_EQ(0, Decode(Bytes({0x41, 0x10, 0x00, 0x02, 0x00, 'x', 0x01, 0x01, 0x05, 0x40}),
-                        back = PObject()));
-    EXPECT_EQ("[\"\", 5]", back.toString());
-}
-
-TEST(PStreamTest, NullWithLengthIsAProtocolError) {
-    LogCapture log;
-    PObject back("before");
-    EXPECT_EQ(S2S::kStatusProtocolError, Decode(Bytes({0x00, 0x05}), back));
-    EXPECT_TRUE(log.Contains("[ERROR] s2s_stream.cpp("));
-    EXPECT_TRUE(log.Contains("): expect length 0, but we've got 5\n"));
-    EXPECT_TRUE(log.Contains("): Error stack: \n"));
-    EXPECT_EQ("before", back.asString());
-}
-
-TEST(PStreamTest, IntegerLengthAboveEightIsRefused) {
-    PObject back;
-    EXPECT_EQ(S2S::kStatusProtocolError,
-              Decode(Bytes({0x01, 0x09, 1, 2, 3, 4, 5, 6, 7, 8, 9}), back));
-    ASSERT_EQ(0, Decode(Bytes({0x01, 0x00}), back));  // no value bytes: 0
-    EXPECT_TRUE(back.isInteger());
-    EXPECT_EQ(0u, back.asUInt64());
-}
-
-TEST(PStreamTest, FailingArrayElementIsNotAppended) {
-    PObject back;
-    EXPECT_EQ(S2S::kStatusProtocolError, Decode(Bytes({0x41, 0x01, 0x01, 0x09, 0x07, 0x40}), back));
-    EXPECT_EQ("[9]", back.toString());
-    // The end tag where a value belongs is an unknown value too.
-    EXPECT_EQ(S2S::kStatusProtocolError, Decode(Bytes({0x40}), back = PObject()));
-    // A nested array that fails is dropped whole.
-    EXPECT_EQ(S2S::kStatusProtocolError,
-              Decode(Bytes({0x41, 0x41, 0x41, 0x01, 0x01, 0x01, 0x41, 0x99}), back = PObject()));
-    EXPECT_EQ("[]", back.toString());
+// Streams that break the format: each ends with its status, its log line and what was received
+// so far kept (a failing array element is not appended; a failing nested array is dropped whole).
+TEST(PStreamTest, MalformedStreamsEndWithTheirStatusLogLineAndWhatArrived) {
+    struct Case {
+        std::string bytes;
+        int status;
+        const char *log, *received;
+    };
+    const int kProtocol = S2S::kStatusProtocolError;
+    const Case cases[] = {
+        {Bytes({0x00, 0x05}), kProtocol, "): expect length 0, but we've got 5\n", "\"before\""},
+        {Bytes({0x01, 0x09, 1, 2, 3, 4, 5, 6, 7, 8, 9}), kProtocol, "", "0"},
+        {Bytes({0x01, 0x00}), 0, "", "0"},  // no value bytes: 0
+        {Bytes({0x41, 0x01, 0x01, 0x09, 0x07, 0x40}), kProtocol, "", "[9]"},
+        {Bytes({0x40}), kProtocol, "", "\"before\""},  // the end tag where a value belongs
+        {Bytes({0x41, 0x41, 0x41, 0x01, 0x01, 0x01, 0x41, 0x99}), kProtocol, "", "[]"},
+        {Bytes({0x42, 0x01, 0x01, 0x01, 0x40}), kProtocol,
+         "): PStream: expect string, but get tag 1\n", "{}"},
+        // A string keeps only the bytes before a NUL; the rest is consumed all the same.
+        {Bytes({0x10, 0x00, 0x04, 'a', 'b', 0x00, 'c'}), 0, "", "\"ab\""},
+        {Bytes({0x41, 0x10, 0x00, 0x02, 0x00, 'x', 0x01, 0x01, 0x05, 0x40}), 0, "", "[\"\", 5]"},
+    };
+    for (const Case& c : cases) {
+        LogCapture log;
+        PObject back("before");
+        EXPECT_EQ(c.status, Decode(c.bytes, back)) << c.received;
+        EXPECT_TRUE(log.Contains(c.log)) << c.log;
+        EXPECT_EQ(c.status == 0, !log.Contains("): Error stack: ")) << c.received;
+        EXPECT_EQ(c.received, back.toString());
+    }
 }
 
 TEST(PStreamTest, FailureInsideMapsLogsTheKeyPath) {
@@ -178,13 +171,6 @@ TEST(PStreamTest, FailureInsideMapsLogsTheKeyPath) {
     EXPECT_EQ("", stream.GetHistory());
     // The entries received so far stay; the failing key holds what arrived of its value.
     EXPECT_EQ("{\"a\": {\"b\": {\"c\": null}}}", back.toString());
-}
-
-TEST(PStreamTest, MapEntryMustStartWithAString) {
-    LogCapture log;
-    PObject back;
-    EXPECT_EQ(S2S::kStatusProtocolError, Decode(Bytes({0x42, 0x01, 0x01, 0x01, 0x40}), back));
-    EXPECT_TRUE(log.Contains("): PStream: expect string, but get tag 1\n"));
 }
 
 TEST(PStreamTest, ReceivingIntoContainersAddsToThem) {
@@ -282,22 +268,6 @@ TEST(PStreamTest, SendFailureLogsTheKeyPathOfTheFailingValue) {
     EXPECT_EQ(S2S::kStatusIOError, stream.Send(channel, message));
     EXPECT_TRUE(log.Contains("): Error stack: a.b\n"));
     EXPECT_EQ("", stream.GetHistory());
-}
-
-TEST(PStreamTest, GarbageNeverCrashes) {
-    LogCapture log(S2S::Logger::Error);
-    std::mt19937 random(1234);
-    for (int round = 0; round < 300; ++round) {
-        std::string bytes(random() % 64, '\0');
-        for (char& c : bytes) {
-            // Mostly tags, so that the decoder goes deep into the format.
-            static const char kTags[] = {0x00, 0x01, 0x10, 0x40, 0x41, 0x42, 0x02, 0x08};
-            c = random() % 3 ? kTags[random() % 8] : static_cast<char>(random());
-        }
-        PObject back;
-        int ret = Decode(bytes, back, 32);
-        EXPECT_TRUE(ret == 0 || ret == S2S::kStatusIOError || ret == S2S::kStatusProtocolError);
-    }
 }
 
 TEST(PStreamTest, ReceiveLimitsRefuseDeepAndLongMessages) {
@@ -497,21 +467,6 @@ TEST(PStreamTest, ReplacedChannelStepsSeeEveryByte) {
               back.toString());
 }
 
-TEST(PStreamTest, DebugLinesFollowTheValues) {
-    LogCapture log(S2S::Logger::Debug);
-    PObject message;
-    message["a"] = Array({PObject(7ULL), PObject("s")});
-    PObject back;
-    ASSERT_EQ(0, Decode(Encode(message), back));
-    std::string text = log.Text();
-    for (const char* line :
-         {"[DEBUG] s2s_stream.cpp(", "): {\n", "):   \"a\"\n", "):   [\n", "):     7\n",
-          "):     \"s\"\n", "):   ]\n", "): }\n", "[DEBUG] s2s_channel.cpp(", "): Write: write ",
-          "): FlushWrite: flush at least 0 bytes\n", "): ReadMore: read at least "}) {
-        EXPECT_NE(std::string::npos, text.find(line)) << line;
-    }
-}
-
 // A task map's password travels under "pswd"; other maps use names such as "Password". The
 // debug lines of both ends show the keys and a mask, never the password itself.
 TEST(PStreamTest, DebugLinesNeverShowPasswords) {
@@ -569,22 +524,11 @@ TEST(PStreamTest, DebugLinesNeverShowPasswords) {
     }
 }
 
-TEST(PStreamTest, ConstantsAndSkip) {
-    EXPECT_EQ(0x01, PStream::GetTag<unsigned long long>());
-    EXPECT_EQ(0x10, PStream::GetTag<std::string>());
-    EXPECT_EQ(0x41, PStream::GetTag<PObject::Array>());
-    EXPECT_EQ(0x42, PStream::GetTag<PObject::Map>());
-    EXPECT_EQ(3, PStream::GetType<unsigned long long>());
-    EXPECT_EQ(4, PStream::GetType<std::string>());
-    EXPECT_EQ(1, PStream::GetType<PObject::Array>());
-    EXPECT_EQ(2, PStream::GetType<PObject::Map>());
-    unsigned major = 9;
-    unsigned minor = 9;
-    unsigned patch = 9;
+TEST(PStreamTest, VersionAndSkipOfAnUnknownTag) {
+    unsigned major = 9, minor = 9, patch = 9;
     PStream::GetVersion(major, minor, patch);
-    EXPECT_EQ(1u, major);
-    EXPECT_EQ(0u, minor);
-    EXPECT_EQ(0u, patch);
+    EXPECT_EQ("1.0.0",
+              std::to_string(major) + "." + std::to_string(minor) + "." + std::to_string(patch));
     Channel channel(16);
     PStream stream;
     EXPECT_EQ(S2S::kStatusProtocolError, stream.Skip(channel, 0x07));

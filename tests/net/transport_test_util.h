@@ -1,4 +1,4 @@
-// Helpers of the transport tests: a log captured in a file, connected socket pairs, a peer thread
+// Helpers of the transport tests: connected socket pairs, a peer thread
 // that is always joined, and a process-wide SIGPIPE disposition (the library leaves it alone; a
 // program using it ignores the signal, as these tests do).
 #ifndef S2S_TESTS_NET_TRANSPORT_TEST_UTIL_H
@@ -29,25 +29,6 @@ class TransportEnvironment : public ::testing::Environment {
 };
 inline ::testing::Environment* const kTransportEnvironment =
     ::testing::AddGlobalTestEnvironment(new TransportEnvironment);  // gtest owns it
-
-// Sends the library's log to a private file at `level` for the object's lifetime.
-class LogCapture {
-  public:
-    explicit LogCapture(int level = S2S::Logger::Debug) : dir_("s2s-net-log") {
-        path_ = dir_ / "log";
-        S2S::Logger::Initialize(S2S::Logger::File, level, path_, 2);
-    }
-    ~LogCapture() { S2S::Logger::Destroy(); }
-    LogCapture(const LogCapture&) = delete;
-    LogCapture& operator=(const LogCapture&) = delete;
-
-    std::string Text() const { return ReadFile(path_); }
-    bool Contains(const std::string& text) const { return Text().find(text) != std::string::npos; }
-
-  private:
-    TempDir dir_;
-    std::string path_;
-};
 
 // Two connected stream sockets; whichever end was not released is closed on destruction.
 class SocketPair {

@@ -1,104 +1,77 @@
+// The shared test helpers of test_util.h.
 #include "support/test_util.h"
 
 #include <arpa/inet.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
-
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
-#include <stdexcept>
 #include <thread>
-#include <vector>
 
 namespace s2s_test {
 
-TempDir::TempDir(const std::string& prefix) {
-    const char* base = std::getenv("TMPDIR");
-    std::string pattern =
-        std::string(base != nullptr && *base != '\0' ? base : "/tmp") + "/" + prefix + ".XXXXXX";
-    std::vector<char> buffer(pattern.begin(), pattern.end());
-    buffer.push_back('\0');
-    if (mkdtemp(buffer.data()) == nullptr) {
-        throw std::runtime_error("mkdtemp failed for " + pattern);
+bool WaitFor(const std::function<bool()>& done, std::chrono::milliseconds limit) {
+    const auto deadline = std::chrono::steady_clock::now() + limit;
+    bool ok = false;
+    for (auto pause = std::chrono::milliseconds(1);
+         !(ok = done()) && std::chrono::steady_clock::now() < deadline;) {
+        std::this_thread::sleep_for(pause = std::min(pause * 2, std::chrono::milliseconds(50)));
     }
-    path_ = buffer.data();
+    return ok;
 }
-
-TempDir::~TempDir() {
-    RemoveTree(path_);
-}
-
-ScopedEnv::ScopedEnv(const std::string& name, const char* value) : name_(name) {
-    const char* old = std::getenv(name.c_str());
-    had_old_ = old != nullptr;
-    if (had_old_) {
-        old_ = old;
-    }
-    if (value != nullptr) {
-        setenv(name.c_str(), value, 1);
-    } else {
-        unsetenv(name.c_str());
-    }
-}
-
-ScopedEnv::~ScopedEnv() {
-    if (had_old_) {
-        setenv(name_.c_str(), old_.c_str(), 1);
-    } else {
-        unsetenv(name_.c_str());
-    }
-}
-
 int FreeTcpPort() {
     int fd = socket(AF_INET, SOCK_STREAM, 0);
-    if (fd < 0) {
-        throw std::runtime_error("socket failed");
-    }
-    sockaddr_in addr{};
-    addr.sin_family = AF_INET;
-    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    addr.sin_port = 0;
+    sockaddr_in addr{AF_INET, 0, {htonl(INADDR_LOOPBACK)}, {}};
     socklen_t len = sizeof(addr);
-    if (bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 ||
-        getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
-        close(fd);
-        throw std::runtime_error("bind to a free port failed");
+    bool ok = fd >= 0 && bind(fd, reinterpret_cast<sockaddr*>(&addr), len) == 0 &&
+              getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) == 0;
+    if (fd < 0 || close(fd) != 0 || !ok) {
+        throw std::runtime_error("no free loopback port");
     }
-    close(fd);
     return ntohs(addr.sin_port);
 }
-
-bool WaitFor(const std::function<bool()>& done, std::chrono::milliseconds limit) {
-    auto deadline = std::chrono::steady_clock::now() + limit;
-    auto pause = std::chrono::milliseconds(1);
-    while (!done()) {
-        if (std::chrono::steady_clock::now() >= deadline) {
-            return false;
-        }
-        std::this_thread::sleep_for(pause);
-        pause = std::min(pause * 2, std::chrono::milliseconds(50));
-    }
-    return true;
-}
-
 std::string ReadFile(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
     std::ostringstream content;
-    content << in.rdbuf();
+    content << std::ifstream(path, std::ios::binary).rdbuf();
     return content.str();
 }
-
 void WriteFile(const std::string& path, const std::string& content) {
-    std::ofstream out(path, std::ios::binary | std::ios::trunc);
-    out << content;
+    std::ofstream(path, std::ios::binary | std::ios::trunc) << content;
 }
-
+void MakeDirs(const std::string& path, mode_t mode) {
+    for (size_t end = path.find('/', 1); end != std::string::npos; end = path.find('/', end + 1)) {
+        mkdir(path.substr(0, end).c_str(), mode);
+    }
+    if (mkdir(path.c_str(), mode) != 0 && !std::filesystem::is_directory(path)) {
+        throw std::runtime_error("cannot create " + path);
+    }
+}
 void RemoveTree(const std::string& path) {
     std::error_code ignored;
     std::filesystem::remove_all(path, ignored);
+}
+Child::Child(const std::function<int()>& body) : pid_(fork()) {
+    if (pid_ == 0) {
+        int code = 120;
+        try {
+            code = body();
+        } catch (...) {
+        }
+        _exit(code);
+    }
+}
+int Child::Wait(std::chrono::milliseconds limit) {
+    int status = 0;
+    bool done = pid_ > 0 && WaitFor([&] { return waitpid(pid_, &status, WNOHANG) == pid_; }, limit);
+    if (pid_ > 0 && !done) {
+        kill(pid_, SIGKILL);
+        waitpid(pid_, &status, 0);
+    }
+    pid_ = -1;
+    return !done ? -2 : WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 }  // namespace s2s_test
