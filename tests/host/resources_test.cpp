@@ -101,8 +101,9 @@ TEST_F(HostRoot, FactoryLocksExcludeEachOtherAndDestroyingAHeldOneReleasesAWaiti
     auto blocked = std::async(std::launch::async, [&] { return mine.ExLock(); });
     EXPECT_EQ(blocked.wait_for(std::chrono::milliseconds(100)), std::future_status::timeout);
     ASSERT_EQ(write(go[1], "1", 1), 1);  // the holder destroys its lock
-    EXPECT_EQ(blocked.get(), 0);
+    EXPECT_EQ(blocked.wait_for(std::chrono::seconds(10)), std::future_status::ready);
     ASSERT_EQ(write(go[1], "2", 1), 1);  // now it may exit
+    EXPECT_EQ(blocked.get(), 0);
     EXPECT_EQ(holder.Wait(), 0);
     close(locked[0]), close(locked[1]), close(go[0]), close(go[1]);
 }

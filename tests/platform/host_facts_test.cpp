@@ -124,8 +124,7 @@ TEST_F(HostFacts, VolumeOfAPathIsItsListedVolumeOrItsMountPoint) {
     EXPECT_TRUE(volume.rfind(std::string(rec.path), 0) == 0 && stat(rec.path, &a) == 0 &&
                 stat(volume.c_str(), &b) == 0 && a.st_dev == b.st_dev)
         << rec.path;
-    ASSERT_EQ(VolumePathParseEx("/proc/self", &rec), 0);
-    EXPECT_STREQ(rec.path, "/proc");
+    EXPECT_TRUE(VolumePathParseEx("/proc/self", &rec) == 0 && std::string(rec.path) == "/proc");
     EXPECT_EQ(VURNVolumeIsMounted("/proc"), 1);
     const std::tuple<std::string, std::string, int, int> cases[] = {
         {volume + "/", "external", VURN_VOLUME_TYPE_EXTERNAL, 0},
