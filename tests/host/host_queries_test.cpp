@@ -117,7 +117,7 @@ TEST_F(HostQueries, ValidSharesAreOnInternalVolumesOrInAPortBoxsShareBin) {
     S2S::VolumeInfo volume;
     ASSERT_EQ(S2S::GetVolumeInfo("docs", volume), 0);
     EXPECT_EQ(volume.GetPath(), volume_);
-    EXPECT_EQ(volume.GetName(), volume_.substr(1));
+    EXPECT_EQ(volume.GetName() + std::to_string(volume.GetType()), volume_.substr(1) + "1");
 }
 
 // Servers keep client IDs in 36-byte fields: at most 35 characters of the serial, except in HA
