@@ -1,625 +1,338 @@
-// The pairing store's behaviour on real files under a temporary S2S_ROOT: the layout it writes,
-// its result codes and messages, the move to the multi-client scheme, the share pairing rules,
-// the server status, and what bad input does (and does not do) to the file.
-#include <dlfcn.h>
-#include <gmock/gmock.h>
+// The pairing store on real files under S2S_ROOT: records survive writes of other records, pairing
+// moves through its states (one client, many, shares bound to one), the status follows the switch,
+// the daemon and the heartbeats, and what the file or its reader cannot take is refused unwritten.
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstddef>
-#include <cstdio>
 #include <ctime>
+#include <map>
 #include <string>
+#include <tuple>
+#include <vector>
 
-#include "tests/host/pairing_store_test_support.h"
+#include "host/pairing_store.h"
+#include "s2s_server.h"
+#include "support/test_util.h"
 
 namespace {
 
-using pairing_test::List;
-using pairing_test::MessageCapture;
-using pairing_test::Pairs;
-using pairing_test::ReadSection;
-using pairing_test::SectionNames;
-using pairing_test::StoreFile;
-using pairing_test::StoreRoot;
-using pairing_test::Table;
-using pairing_test::Update;
-using ::testing::ElementsAre;
-using Messages = std::vector<std::string>;
+using s2s_test::Table;
+using Pairs = std::map<std::string, std::string>;
+using Names = std::vector<std::string>;
 
 constexpr const char* kMarker = "S2SMULTI-SRC-SUPPORT";
 
-static_assert(offsetof(s2s_svr_status, running) == 0, "status record layout");
-static_assert(offsetof(s2s_svr_status, busy) == 4, "status record layout");
-static_assert(offsetof(s2s_svr_status, client_id) == 8, "status record layout");
-static_assert(offsetof(s2s_svr_status, server_name) == 16, "status record layout");
+// The items of `list`, which is freed.
+Names Take(VLIBSzList* list) {
+    Names out;
+    for (int i = 0; i < VLIBCSzListCount(list); ++i) {
+        out.push_back(VLIBCSzListGet(list, i));
+    }
+    VLIBCSzListFree(list);
+    return out;
+}
 
-class PairingStoreTest : public ::testing::Test {
+// S2SCheckIfSharePaired of `shares` for `client`: its result, then the shares it refused.
+Names Check(const Names& shares, const char* client) {
+    VLIBSzList* in = VLIBCSzListAlloc(4);
+    VLIBSzList* refused = VLIBCSzListAlloc(4);
+    VLIBCSzListPush(&refused, "left over");  // emptied first
+    for (const std::string& share : shares) {
+        VLIBCSzListPush(&in, share.c_str());
+    }
+    Names out{std::to_string(S2SCheckIfSharePaired(in, client, &refused))};
+    Take(in);
+    const Names got = Take(refused);
+    out.insert(out.end(), got.begin(), got.end());
+    return out;
+}
+
+class PairingStore : public ::testing::Test {
   protected:
-    StoreRoot root_;
-    MessageCapture messages_;
+    PairingStore() : env_("S2S_ROOT", root_.path().c_str()) {
+        s2s_test::MakeDirs(root_ / "usr/vurn/etc");
+        s2s_test::MakeDirs(root_ / "var/run");
+        previous_ = S2S::PairingStore::SetMessageSink([](const char*) {});  // keep syslog quiet
+    }
+    ~PairingStore() override { S2S::PairingStore::SetMessageSink(previous_); }
+
+    static std::string File() { return S2SPath(S2S_PATH_PAIRING_STORE); }
+    static std::string Contents() { return s2s_test::ReadFile(File()); }
+    static int Update(const std::string& section,
+                      std::initializer_list<std::pair<const char*, std::string>> pairs) {
+        Table table(pairs);
+        return S2SUpdateServerInfo(section.c_str(), table.get());
+    }
+    // The pairs of a section as the store reads them.
+    static Pairs Read(const std::string& section) {
+        Table table;
+        S2SGetServerInfo(section.c_str(), table.ptr());
+        Pairs out;
+        for (int i = 0; i < VLIBCSzHashCount(table.get()); ++i) {
+            out[VLIBCSzHashKeyAt(table.get(), i)] = VLIBCSzHashValueAt(table.get(), i);
+        }
+        return out;
+    }
+    static Names Sections() {
+        VLIBSzList* names = VLIBCSzListAlloc(4);
+        VLIBCFileEnumSection(File().c_str(), &names);  // an unreadable file: none
+        return Take(names);
+    }
+
+    s2s_test::TempDir root_;
+    s2s_test::ScopedEnv env_;
+    S2S::PairingStore::MessageSink previous_;
 };
 
-// --- the file -----------------------------------------------------------------------------------
+// The store is made empty once, without a shell: a root whose name the shell would read as more
+// than one word, or as a second command, is no command. Only regular files count as existing.
+TEST_F(PairingStore, CheckServerInfoCreatesTheFileEmptyOnceAndUsesNoShell) {
+    EXPECT_EQ(isFileExist(File().c_str()), 0);
+    EXPECT_EQ(S2SCheckServerInfo(), 0);
+    EXPECT_EQ(isFileExist(File().c_str()), 1);
+    ASSERT_EQ(mkfifo((root_ / "fifo").c_str(), 0600), 0);
+    EXPECT_EQ(isFileExist((root_ / "fifo").c_str()) + isFileExist(root_.path().c_str()), 0);
+    EXPECT_EQ(Contents(), "");
+    ASSERT_EQ(Update("TASK_t", {{"status", "idle"}}), 0);
+    EXPECT_EQ(S2SCheckServerInfo(), 0);
+    EXPECT_EQ(Read("TASK_t").size(), 1u);  // kept
 
-TEST_F(PairingStoreTest, IsFileExistAcceptsOnlyRegularFiles) {
-    const std::string dir = root_.path();
-    s2s_test::WriteFile(dir + "/plain", "x");
-    ASSERT_EQ(0, symlink((dir + "/plain").c_str(), (dir + "/link").c_str()));
-    ASSERT_EQ(0, symlink((dir + "/gone").c_str(), (dir + "/dangling").c_str()));
-    ASSERT_EQ(0, mkfifo((dir + "/fifo").c_str(), 0600));
-
-    EXPECT_EQ(1, isFileExist((dir + "/plain").c_str()));
-    EXPECT_EQ(1, isFileExist((dir + "/link").c_str()));
-    EXPECT_EQ(0, isFileExist(nullptr));
-    EXPECT_EQ(0, isFileExist(""));
-    EXPECT_EQ(0, isFileExist((dir + "/missing").c_str()));
-    EXPECT_EQ(0, isFileExist((dir + "/dangling").c_str()));
-    EXPECT_EQ(0, isFileExist(dir.c_str()));
-    EXPECT_EQ(0, isFileExist((dir + "/fifo").c_str()));
-}
-
-TEST_F(PairingStoreTest, CheckServerInfoCreatesTheFileEmptyAndKeepsAnExistingOne) {
-    EXPECT_EQ(std::string(root_.path()) + "/usr/vurn/etc/vurnS2S.info", StoreFile());
-    EXPECT_EQ(0, S2SCheckServerInfo());
-    EXPECT_EQ(1, isFileExist(StoreFile()));
-    EXPECT_EQ("", root_.Contents());
-
-    ASSERT_EQ(0, Update("TASK_t", {{"status", "idle"}}));
-    const std::string before = root_.Contents();
-    EXPECT_EQ(0, S2SCheckServerInfo());
-    EXPECT_EQ(before, root_.Contents());
-}
-
-TEST_F(PairingStoreTest, CreatingTheFileNeverHandsTheRootToTheShell) {
-    // A root whose name the shell would read as more than one word, or as a second command.
-    const std::string odd = root_.path() + "/it's a;touch injected";
-    for (const char* dir : {"", "/usr", "/usr/vurn", "/usr/vurn/etc"}) {
-        ASSERT_EQ(0, mkdir((odd + dir).c_str(), 0755));
-    }
+    const std::string odd = root_ / "it's a;touch injected";
+    s2s_test::MakeDirs(odd + "/usr/vurn/etc");
     s2s_test::ScopedEnv env("S2S_ROOT", odd.c_str());
-    char cwd[4096];
-    ASSERT_NE(nullptr, getcwd(cwd, sizeof(cwd)));
-    ASSERT_EQ(0, chdir(root_.path().c_str()));
-    EXPECT_EQ(0, S2SCheckServerInfo());
-    ASSERT_EQ(0, chdir(cwd));
-    EXPECT_EQ(1, isFileExist((odd + "/usr/vurn/etc/vurnS2S.info").c_str()));
-    EXPECT_NE(0, access((root_.path() + "/injected").c_str(), F_OK));
+    ASSERT_EQ(chdir(root_.path().c_str()), 0);
+    EXPECT_EQ(S2SCheckServerInfo(), 0);
+    EXPECT_EQ(isFileExist((odd + "/usr/vurn/etc/vurnS2S.info").c_str()), 1);
+    EXPECT_NE(access((root_ / "injected").c_str(), F_OK), 0);
+    ASSERT_EQ(chdir("/"), 0);
 }
 
-TEST_F(PairingStoreTest, WithoutAFileStatusIsUnreadableAndNotRunning) {
-    s2s_svr_status status = {7, 7, nullptr, nullptr};
-    EXPECT_EQ(-1, s2s_svr_get_status(&status));
-    EXPECT_EQ(0, status.running);
-    EXPECT_EQ(nullptr, status.client_id);
-    EXPECT_EQ(1, isFileExist(StoreFile()));  // created on first use
-    EXPECT_EQ(0, s2s_svr_put_status(&status));
-}
-
-TEST_F(PairingStoreTest, UpdateWritesTheLineFormatAndKeepsOtherKeysAndSections) {
-    ASSERT_EQ(0, Update("SHARE_docs", {{"CompleteID", "A"}, {"RunningID", "A"}}));
-    ASSERT_EQ(0, Update("TASK_7", {{"status", "idle"}}));
-    EXPECT_NE(std::string::npos, root_.Contents().find("\tCompleteID=\"A\"\n\tRunningID=\"A\"\n"));
-
-    ASSERT_EQ(0, Update("SHARE_docs", {{"RunningID", ""}, {"Extra", "x y"}}));
-    int found = 0;
-    EXPECT_EQ((Pairs{{"CompleteID", "A"}, {"RunningID", ""}, {"Extra", "x y"}}),
-              ReadSection("SHARE_docs", &found));
-    EXPECT_GT(found, 0);
-    EXPECT_EQ((Pairs{{"status", "idle"}}), ReadSection("TASK_7"));
-    EXPECT_THAT(SectionNames(), ElementsAre("SHARE_docs", "TASK_7"));
-    EXPECT_TRUE(messages_.Take().empty());
-}
-
-TEST_F(PairingStoreTest, TaskAndShareUpdatesNameTheirSections) {
-    Table values({{"status", "1700000000"}});
-    EXPECT_EQ(0, S2SServerUpdateTask("nightly", values.get()));
-    EXPECT_EQ(0, S2SServerUpdateShare("photos", values.get()));
-    EXPECT_THAT(SectionNames(), ElementsAre("TASK_nightly", "SHARE_photos"));
-    EXPECT_EQ(-1, S2SServerUpdateTask(nullptr, values.get()));
-    EXPECT_EQ(-1, S2SServerUpdateShare(nullptr, values.get()));
-    EXPECT_EQ(-1, S2SServerUpdateShare("photos", nullptr));
-}
-
-TEST_F(PairingStoreTest, GetServerInfoTellsAbsentFromPresent) {
-    int found = 99;
-    EXPECT_EQ(Pairs{}, ReadSection("PairedClientInfo", &found));
-    EXPECT_EQ(0, found);
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"s2sEnabled", "yes"}}));
-    EXPECT_EQ((Pairs{{"s2sEnabled", "yes"}}), ReadSection("PairedClientInfo", &found));
-    EXPECT_GT(found, 0);
-
+TEST_F(PairingStore, UpdatesKeepOtherKeysAndSectionsAndReadBackAsWritten) {
     Table table;
-    EXPECT_LT(S2SGetServerInfo(nullptr, table.slot()), 0);
-    EXPECT_LT(S2SGetServerInfo("PairedClientInfo", nullptr), 0);
-}
-
-TEST_F(PairingStoreTest, ServerGetShareReadsOneValue) {
-    ASSERT_EQ(0, Update("SHARE_docs", {{"RunningID", "client-1"}}));
+    EXPECT_EQ(S2SGetServerInfo("SHARE_docs", table.ptr()), 0);  // absent
+    ASSERT_EQ(Update("SHARE_docs", {{"CompleteID", "A"}, {"RunningID", "A"}}), 0);
+    Table task({{"status", "1700000000"}});
+    ASSERT_EQ(S2SServerUpdateTask("7", task.get()), 0);
+    EXPECT_NE(Contents().find("\tCompleteID=\"A\"\n\tRunningID=\"A\"\n"), std::string::npos);
+    ASSERT_EQ(Update("SHARE_docs", {{"RunningID", ""}, {"Extra", "x y"}}), 0);
+    EXPECT_GT(S2SGetServerInfo("SHARE_docs", table.ptr()), 0);
+    EXPECT_EQ(Read("SHARE_docs"),
+              (Pairs{{"CompleteID", "A"}, {"RunningID", ""}, {"Extra", "x y"}}));
+    EXPECT_EQ(Read("TASK_7"), (Pairs{{"status", "1700000000"}}));
+    EXPECT_EQ(Sections(), (Names{"SHARE_docs", "TASK_7"}));
     char buf[36];
-    EXPECT_EQ(8, S2SServerGetShare("docs", "RunningID", buf, sizeof(buf)));
-    EXPECT_STREQ("client-1", buf);
-
-    EXPECT_LT(S2SServerGetShare("docs", "CompleteID", buf, sizeof(buf)), 0);
-    EXPECT_EQ(VLIB_ERR_NOT_FOUND, VLIBCErrGet());
-    EXPECT_LT(S2SServerGetShare("other", "RunningID", buf, sizeof(buf)), 0);
-    EXPECT_EQ(VLIB_ERR_NOT_FOUND, VLIBCErrGet());
-
-    EXPECT_EQ(-1, S2SServerGetShare(nullptr, "RunningID", buf, sizeof(buf)));
-    EXPECT_EQ(-1, S2SServerGetShare("docs", nullptr, buf, sizeof(buf)));
-    EXPECT_EQ(-1, S2SServerGetShare("docs", "RunningID", nullptr, sizeof(buf)));
-    EXPECT_EQ(-1, S2SServerGetShare("docs", "RunningID", buf, 0));
+    EXPECT_TRUE(S2SServerGetShare("docs", "CompleteID", buf, sizeof(buf)) == 1 && buf[0] == 'A');
+    EXPECT_LT(S2SServerGetShare("docs", "Missing", buf, sizeof(buf)), 0);
+    EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_NOT_FOUND);
+    EXPECT_EQ(S2SServerGetShare("docs", "RunningID", buf, 0), -1);
+    // Long values and the file syntax's own characters in values come back unchanged.
+    const std::string big(4096, 'v'), quoted = "say \"hi\" = [ok] ; # not a comment";
+    ASSERT_EQ(Update("TASK_big", {{"status", big}, {"note", quoted}}), 0);
+    EXPECT_EQ(Read("TASK_big"), (Pairs{{"status", big}, {"note", quoted}}));
 }
 
-TEST_F(PairingStoreTest, UpdateFailuresAreReportedAndLeaveTheFileAsItWas) {
-    ASSERT_EQ(0, Update("SHARE_docs", {{"RunningID", "A"}}));
-    const std::string before = root_.Contents();
-    const std::string file = StoreFile();
-    messages_.Take();
+// Share names with the file syntax's characters stay in a section of their own; names, keys and
+// values the file cannot carry, null arguments, a file that would outgrow its reader, and any
+// write to a malformed file are refused and leave the file as it was.
+TEST_F(PairingStore, WhatTheFileOrItsReaderCannotTakeIsRefusedWithoutTouchingIt) {
+    ASSERT_EQ(Update("SHARE_neighbour", {{"RunningID", "N"}}), 0);
+    for (const char* name : {"a]b", "[x]", "a=b", "q\"uote", "it's", "sp ace", "semi;colon"}) {
+        Table values({{"RunningID", std::string("id-") + name}});
+        ASSERT_EQ(S2SServerUpdateShare(name, values.get()), 0) << name;
+        EXPECT_EQ(Read(std::string("SHARE_") + name)["RunningID"], std::string("id-") + name);
+    }
+    EXPECT_EQ(Read("SHARE_neighbour"), (Pairs{{"RunningID", "N"}}));
+    const std::string before = Contents();
+    Table plain({{"RunningID", "A"}});
+    for (const char* name : {"new\nline", "cr\rshare", "neighbour]\n[SHARE_x"}) {
+        EXPECT_EQ(S2SServerUpdateShare(name, plain.get()), -1);
+    }
+    EXPECT_EQ(S2SServerUpdateTask("trailing ", plain.get()), -1);
+    EXPECT_EQ(Update("SHARE_neighbour", {{"RunningID", "two\nlines"}}), -1);
+    EXPECT_EQ(Update("SHARE_neighbour", {{"key=", "v"}}), -1);
+    EXPECT_EQ(Update("SHARE_neighbour", {{"RunningID", std::string(9000, 'v')}}), -1);
+    EXPECT_TRUE(Update("", {{"k", "v"}}) == -1 && S2SUpdateServerInfo("SHARE_docs", nullptr) == -1);
+    EXPECT_TRUE(S2SServerUpdateTask(nullptr, plain.get()) == -1 &&
+                S2SServerUpdateShare(nullptr, plain.get()) == -1);
+    EXPECT_LT(S2SGetServerInfo(nullptr, plain.ptr()), 0);
+    EXPECT_EQ(Contents(), before);
 
-    Table values({{"k", "v"}});
-    EXPECT_EQ(-1, S2SUpdateServerInfo("", values.get()));
-    EXPECT_THAT(messages_.Take(), ElementsAre("VLIBCFileAddSection() failed!! szFile=[" + file +
-                                                  "], section=[], errno=[0x0100]",
-                                              "Set section [ ] value into [" + file + "] error."));
-    EXPECT_EQ(-1, S2SUpdateServerInfo(nullptr, values.get()));
-    EXPECT_EQ(-1, S2SUpdateServerInfo("SHARE_docs", nullptr));
-    EXPECT_THAT(messages_.Take(),
-                ElementsAre("Set section [ ] value into [" + file + "] error.",
-                            "Set section [SHARE_docs ] value into [" + file + "] error."));
-
-    // A key the file syntax cannot carry, on an existing section.
-    EXPECT_EQ(-1, Update("SHARE_docs", {{"a=b", "v"}}));
-    EXPECT_THAT(messages_.Take(),
-                ElementsAre("VLIBCFileSetSection() failed!! szFile=[" + file +
-                                "], section=[SHARE_docs], errno=[0x0100]",
-                            "Set section [SHARE_docs ] value into [" + file + "] error."));
-    EXPECT_EQ(before, root_.Contents());
-}
-
-// The store's reader takes at most VLIB_SECTION_FILE_MAX bytes: a write that would pass it is
-// refused before anything is written, with an error that says so, and a write that fits still
-// goes through.
-TEST_F(PairingStoreTest, AWriteThatWouldOutgrowTheReaderIsRefused) {
-    const std::string file = StoreFile();
+    // The reader takes at most VLIB_SECTION_FILE_MAX bytes: a write that would pass it is refused
+    // before anything is written, and one that fits still goes through.
     std::string text = "[BIG]\n";
-    const std::string value(8000, 'v');
     for (int i = 0; text.size() + 8100 < VLIB_SECTION_FILE_MAX - 100; ++i) {
-        text += "\tk" + std::to_string(i) + "=\"" + value + "\"\n";
+        text += "\tk" + std::to_string(i) + "=\"" + std::string(8000, 'v') + "\"\n";
     }
     text += "\tpad=\"" + std::string(VLIB_SECTION_FILE_MAX - 100 - text.size() - 8, 'p') + "\"\n";
-    ASSERT_EQ(text.size(), VLIB_SECTION_FILE_MAX - 100);
-    s2s_test::WriteFile(file, text);
-    EXPECT_EQ(-1, Update("SHARE_docs", {{"RunningID", std::string(200, 'A')}}));
+    s2s_test::WriteFile(File(), text);
+    EXPECT_EQ(Update("SHARE_docs", {{"RunningID", std::string(200, 'A')}}), -1);
     EXPECT_EQ(VLIBCErrGet(), VLIB_ERR_TOO_LARGE);
-    EXPECT_EQ(s2s_test::ReadFile(file), text);
-    EXPECT_EQ(0, Update("SHARE_docs", {{"RunningID", "A"}}));
-    messages_.Take();
-}
+    EXPECT_EQ(Contents(), text);
+    EXPECT_EQ(Update("SHARE_docs", {{"RunningID", "A"}}), 0);
 
-TEST_F(PairingStoreTest, AMalformedFileIsNeverRewritten) {
-    s2s_test::WriteFile(StoreFile(), "[SHARE_docs]\n\tRunningID=\"A\"\nthis is no section file\n");
-    const std::string before = root_.Contents();
-    const std::string file = StoreFile();
-
-    EXPECT_EQ(-1, Update("SHARE_new", {{"RunningID", "B"}}));
-    Messages got = messages_.Take();
-    ASSERT_EQ(2u, got.size());
-    EXPECT_EQ(
-        "VLIBCFileGetSection error. filePath:[" + file + "] szOldSecName:[SHARE_new]  iRet:[-1]",
-        got[0]);
-    EXPECT_EQ(205, S2SServerUpdatePairInfo("A", "serverA"));
-    EXPECT_EQ(-1, S2SServerIfOldClientPaired());
-    EXPECT_THAT(messages_.Take(), testing::Contains("Get server paired-info error."));
-    EXPECT_EQ(-1, s2s_svr_reset_pair());
-    EXPECT_EQ(before, root_.Contents());
-}
-
-// --- pairing ------------------------------------------------------------------------------------
-
-TEST_F(PairingStoreTest, SetPairValueSetsTheClientAndKeepsTheSwitch) {
-    EXPECT_EQ(201, S2SServerSetPairValue(nullptr));
-    Table onlyId({{"clientID", "A"}});
-    EXPECT_EQ(202, S2SServerSetPairValue(onlyId.get()));
-    Table onlyName({{"serverName", "a"}});
-    EXPECT_EQ(202, S2SServerSetPairValue(onlyName.get()));
-    EXPECT_EQ(0, ReadSection("PairedClientInfo").size());
-
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"s2sEnabled", "yes"}}));
-    Table pair({{"clientID", "A"}, {"serverName", "serverA"}, {"other", "ignored"}});
-    EXPECT_EQ(0, S2SServerSetPairValue(pair.get()));
-    EXPECT_EQ((Pairs{{"s2sEnabled", "yes"}, {"clientID", "A"}, {"serverName", "serverA"}}),
-              ReadSection("PairedClientInfo"));
-
-    Table broken({{"clientID", "A\nB"}, {"serverName", "serverA"}});
-    EXPECT_EQ(205, S2SServerSetPairValue(broken.get()));
-    EXPECT_EQ("A", ReadSection("PairedClientInfo")["clientID"]);
-}
-
-TEST_F(PairingStoreTest, SetPairValueReportsAnUnreadableFile) {
-    s2s_test::WriteFile(StoreFile(), "garbage\n");
+    // A malformed file is never rewritten.
+    const std::string broken = "[SHARE_docs]\n\tRunningID=\"A\"\nthis is no section file\n";
+    s2s_test::WriteFile(File(), broken);
+    EXPECT_EQ(Update("SHARE_new", {{"RunningID", "B"}}), -1);
+    EXPECT_EQ(S2SServerUpdatePairInfo("A", "serverA"), 205);
     Table pair({{"clientID", "A"}, {"serverName", "serverA"}});
-    EXPECT_EQ(206, S2SServerSetPairValue(pair.get()));
-    EXPECT_EQ("garbage\n", root_.Contents());
+    EXPECT_EQ(S2SServerSetPairValue(pair.get()), 206);
+    EXPECT_EQ(S2SServerIfOldClientPaired(), -1);
+    EXPECT_EQ(s2s_svr_reset_pair(), -1);
+    s2s_svr_status status = {7, 7, nullptr, nullptr};
+    EXPECT_EQ(s2s_svr_get_status(&status), -1);
+    EXPECT_EQ(status.running, 0);
+    EXPECT_EQ(Contents(), broken);
 }
 
-TEST_F(PairingStoreTest, UpdatePairInfoRecordsAClientInTheMultiClientScheme) {
-    EXPECT_EQ(201, S2SServerUpdatePairInfo(nullptr, "s"));
-    EXPECT_EQ(201, S2SServerUpdatePairInfo("", "s"));
-    EXPECT_EQ(201, S2SServerUpdatePairInfo("A", nullptr));
-    EXPECT_EQ(201, S2SServerUpdatePairInfo("A", ""));
-    EXPECT_EQ("", root_.Contents());
+TEST_F(PairingStore, ASingleClientIsSetBesideTheSwitchAndMovedOnceToTheMultiClientScheme) {
+    EXPECT_EQ(S2SServerSetPairValue(nullptr), 201);
+    Table only_id({{"clientID", "A"}});
+    EXPECT_EQ(S2SServerSetPairValue(only_id.get()), 202);
+    EXPECT_EQ(Read("PairedClientInfo").size(), 0u);
+    ASSERT_EQ(Update("PairedClientInfo", {{"s2sEnabled", "yes"}}), 0);
+    EXPECT_EQ(S2SServerIfOldClientPaired(), 0);
+    Table broken({{"clientID", "A\nB"}, {"serverName", "serverA"}});
+    EXPECT_EQ(S2SServerSetPairValue(broken.get()), 205);
+    Table pair({{"clientID", "A"}, {"serverName", "serverA"}, {"other", "ignored"}});
+    ASSERT_EQ(S2SServerSetPairValue(pair.get()), 0);
+    EXPECT_EQ(Read("PairedClientInfo"),
+              (Pairs{{"s2sEnabled", "yes"}, {"clientID", "A"}, {"serverName", "serverA"}}));
+    ASSERT_EQ(Update("SHARE_docs", {{"RunningID", "A"}}), 0);
+    EXPECT_EQ(S2SServerIfOldClientPaired(), 1);
 
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"s2sEnabled", "yes"}}));
-    EXPECT_EQ(0, S2SServerUpdatePairInfo("A", "serverA"));
-    EXPECT_EQ(0, S2SServerUpdatePairInfo("B", "serverB"));
-    EXPECT_EQ(0, S2SServerUpdatePairInfo("A", "serverA2"));
-    EXPECT_THAT(SectionNames(), ElementsAre("PairedClientInfo", "CLIENTID_A", "CLIENTID_B"));
-    EXPECT_EQ((Pairs{{"ServerName", "serverA2"}}), ReadSection("CLIENTID_A"));
-    EXPECT_EQ((Pairs{{"s2sEnabled", "yes"}, {"clientID", kMarker}, {"serverName", kMarker}}),
-              ReadSection("PairedClientInfo"));
+    EXPECT_EQ(s2s_svr_reset_pair(), 0);
+    EXPECT_EQ(S2SServerIfOldClientPaired(), 0);
+    EXPECT_EQ(Sections(), (Names{"PairedClientInfo", "SHARE_docs", "CLIENTID_A"}));
+    EXPECT_EQ(Read("CLIENTID_A"), (Pairs{{"ServerName", "serverA"}}));
+    EXPECT_EQ(Read("PairedClientInfo"),
+              (Pairs{{"s2sEnabled", "yes"}, {"clientID", kMarker}, {"serverName", kMarker}}));
 
-    // A client ID that cannot name a section is refused before anything is written.
-    const std::string before = root_.Contents();
-    EXPECT_EQ(205, S2SServerUpdatePairInfo("C\nD", "serverC"));
-    EXPECT_EQ(before, root_.Contents());
+    // Without a whole client the store is still marked; a client's section is never duplicated.
+    s2s_test::WriteFile(File(), "");
+    EXPECT_EQ(s2s_svr_reset_pair(), 0);
+    EXPECT_EQ(Read("PairedClientInfo"), (Pairs{{"clientID", kMarker}, {"serverName", kMarker}}));
+    s2s_test::WriteFile(File(), "");
+    ASSERT_EQ(Update("PairedClientInfo", {{"clientID", "A"}}), 0);
+    EXPECT_EQ(s2s_svr_reset_pair(), 0);
+    EXPECT_EQ(Sections(), Names{"PairedClientInfo"});
+    EXPECT_EQ(Read("PairedClientInfo"), (Pairs{{"clientID", kMarker}, {"serverName", kMarker}}));
+    s2s_test::WriteFile(File(), "");
+    ASSERT_EQ(S2SServerUpdatePairInfo("A", "old name"), 0);
+    ASSERT_EQ(Update("PairedClientInfo", {{"clientID", "A"}, {"serverName", "serverA"}}), 0);
+    EXPECT_EQ(s2s_svr_reset_pair(), 0);
+    EXPECT_EQ(Sections(), (Names{"CLIENTID_A", "PairedClientInfo"}));
+    EXPECT_EQ(Read("CLIENTID_A"), (Pairs{{"ServerName", "serverA"}}));
 }
 
-TEST_F(PairingStoreTest, IfOldClientPairedTellsWhetherASingleClientIsRecorded) {
-    struct Case {
-        const char* clientId;
-        const char* serverName;
-        int expected;
-    };
-    const Case cases[] = {
-        {nullptr, nullptr, 0}, {"A", nullptr, 0}, {nullptr, "a", 0},
-        {"", "a", 0},          {"A", "", 0},      {kMarker, kMarker, 0},
-        {kMarker, "a", 1},     {"A", "a", 1},     {"A", kMarker, 1},
-    };
-    for (const Case& c : cases) {
-        s2s_test::WriteFile(StoreFile(), "");
-        Table pair;
-        VLIBCSzHashSetValue(pair.slot(), "s2sEnabled", "yes");
-        if (c.clientId != nullptr) {
-            VLIBCSzHashSetValue(pair.slot(), "clientID", c.clientId);
-        }
-        if (c.serverName != nullptr) {
-            VLIBCSzHashSetValue(pair.slot(), "serverName", c.serverName);
-        }
-        ASSERT_EQ(0, S2SUpdateServerInfo("PairedClientInfo", pair.get()));
-        EXPECT_EQ(c.expected, S2SServerIfOldClientPaired())
-            << (c.clientId ? c.clientId : "(none)") << " / "
-            << (c.serverName ? c.serverName : "(none)");
+TEST_F(PairingStore, UpdatePairInfoRecordsClientsInTheMultiClientScheme) {
+    EXPECT_TRUE(S2SServerUpdatePairInfo("", "s") == 201 &&
+                S2SServerUpdatePairInfo("A", nullptr) == 201);
+    EXPECT_EQ(Contents(), "");
+    ASSERT_EQ(Update("PairedClientInfo", {{"s2sEnabled", "yes"}}), 0);
+    EXPECT_TRUE(S2SServerUpdatePairInfo("A", "serverA") == 0 &&
+                S2SServerUpdatePairInfo("B", "serverB") == 0 &&
+                S2SServerUpdatePairInfo("A", "serverA2") == 0);
+    EXPECT_EQ(Sections(), (Names{"PairedClientInfo", "CLIENTID_A", "CLIENTID_B"}));
+    EXPECT_EQ(Read("CLIENTID_A"), (Pairs{{"ServerName", "serverA2"}}));
+    EXPECT_EQ(Read("PairedClientInfo"),
+              (Pairs{{"s2sEnabled", "yes"}, {"clientID", kMarker}, {"serverName", kMarker}}));
+    const std::string before = Contents();
+    EXPECT_EQ(S2SServerUpdatePairInfo("C\nD", "serverC"), 205);
+    EXPECT_EQ(Contents(), before);
+}
+
+TEST_F(PairingStore, AnOldClientIsPairedOnlyWithAnIdAndANameNotBothTheMarker) {
+    // clientID and serverName as stored ("-": absent), and whether an old client is paired.
+    const std::string m = kMarker;
+    const std::tuple<std::string, std::string, int> cases[] = {
+        {"-", "-", 0}, {"A", "-", 0}, {"", "a", 0}, {m, m, 0},
+        {m, "a", 1},   {"A", m, 1},   {"A", "a", 1}};
+    for (const auto& [id, name, expected] : cases) {
+        std::string text = "[PairedClientInfo]\n\ts2sEnabled=\"yes\"\n";
+        text += id == "-" ? "" : "\tclientID=\"" + id + "\"\n";
+        text += name == "-" ? "" : "\tserverName=\"" + name + "\"\n";
+        s2s_test::WriteFile(File(), text);
+        EXPECT_EQ(S2SServerIfOldClientPaired(), expected) << id << " / " << name;
     }
-    s2s_test::WriteFile(StoreFile(), "");
-    EXPECT_EQ(0, S2SServerIfOldClientPaired());  // no pairing section at all
+    s2s_test::WriteFile(File(), "");
+    EXPECT_EQ(S2SServerIfOldClientPaired(), 0);  // no pairing section at all
 }
 
-TEST_F(PairingStoreTest, ResetPairMovesTheSingleClientToItsOwnSection) {
-    ASSERT_EQ(0, Update("PairedClientInfo",
-                        {{"s2sEnabled", "yes"}, {"clientID", "A"}, {"serverName", "serverA"}}));
-    ASSERT_EQ(0, Update("SHARE_docs", {{"RunningID", "A"}}));
-    ASSERT_EQ(1, S2SServerIfOldClientPaired());
-
-    EXPECT_EQ(0, s2s_svr_reset_pair());
-    EXPECT_EQ(0, S2SServerIfOldClientPaired());
-    EXPECT_THAT(SectionNames(), ElementsAre("PairedClientInfo", "SHARE_docs", "CLIENTID_A"));
-    EXPECT_EQ((Pairs{{"ServerName", "serverA"}}), ReadSection("CLIENTID_A"));
-    EXPECT_EQ((Pairs{{"s2sEnabled", "yes"}, {"clientID", kMarker}, {"serverName", kMarker}}),
-              ReadSection("PairedClientInfo"));
-    EXPECT_TRUE(messages_.Take().empty());
-
-    // Again on a converted store: the marker is taken for a client, as callers know.
-    EXPECT_EQ(0, s2s_svr_reset_pair());
-    EXPECT_THAT(SectionNames(), ElementsAre("PairedClientInfo", "SHARE_docs", "CLIENTID_A",
-                                            "CLIENTID_S2SMULTI-SRC-SUPPORT"));
-}
-
-TEST_F(PairingStoreTest, ResetPairWithoutAClientStillMarksTheStore) {
-    EXPECT_EQ(0, s2s_svr_reset_pair());
-    EXPECT_THAT(messages_.Take(), ElementsAre("Failed to get clientID from hash."));
-    EXPECT_THAT(SectionNames(), ElementsAre("PairedClientInfo"));
-    EXPECT_EQ((Pairs{{"clientID", kMarker}, {"serverName", kMarker}}),
-              ReadSection("PairedClientInfo"));
-
-    s2s_test::WriteFile(StoreFile(), "");
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"clientID", "A"}}));
-    EXPECT_EQ(0, s2s_svr_reset_pair());
-    EXPECT_THAT(messages_.Take(), ElementsAre("Failed to get serverName from hash."));
-    EXPECT_THAT(SectionNames(), ElementsAre("PairedClientInfo"));
-}
-
-TEST_F(PairingStoreTest, ResetPairDoesNotDuplicateAnExistingClientSection) {
-    ASSERT_EQ(0, S2SServerUpdatePairInfo("A", "old name"));
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"clientID", "A"}, {"serverName", "serverA"}}));
-    EXPECT_EQ(0, s2s_svr_reset_pair());
-    EXPECT_THAT(SectionNames(), ElementsAre("CLIENTID_A", "PairedClientInfo"));
-    EXPECT_EQ((Pairs{{"ServerName", "serverA"}}), ReadSection("CLIENTID_A"));
-}
-
-// --- share pairing ------------------------------------------------------------------------------
-
-TEST_F(PairingStoreTest, CheckIfSharePairedRefusesMissingArguments) {
-    List shares({"docs"});
-    List empty;
-    List refused;
-    EXPECT_EQ(201, S2SCheckIfSharePaired(nullptr, "A", refused.slot()));
-    EXPECT_EQ(201, S2SCheckIfSharePaired(empty.get(), "A", refused.slot()));
-    EXPECT_EQ(201, S2SCheckIfSharePaired(shares.get(), nullptr, refused.slot()));
-    EXPECT_EQ(201, S2SCheckIfSharePaired(shares.get(), "", refused.slot()));
-    EXPECT_EQ(201, S2SCheckIfSharePaired(shares.get(), "A", nullptr));
-    EXPECT_EQ(Messages(5, "Input parameters are null or empty!"), messages_.Take());
-}
-
-TEST_F(PairingStoreTest, CheckIfSharePairedAppliesTheShareStatusRules) {
-    // share: CompleteID / RunningID as stored.
-    ASSERT_EQ(0, Update("SHARE_runA", {{"CompleteID", ""}, {"RunningID", "A"}}));
-    ASSERT_EQ(0, Update("SHARE_runB", {{"CompleteID", ""}, {"RunningID", "B"}}));
-    ASSERT_EQ(0, Update("SHARE_doneB", {{"CompleteID", "B"}, {"RunningID", "B"}}));
-    ASSERT_EQ(0, Update("SHARE_doneAnowB", {{"CompleteID", "A"}, {"RunningID", "B"}}));
-    ASSERT_EQ(0, Update("SHARE_doneBidle", {{"CompleteID", "B"}, {"RunningID", ""}}));
-    ASSERT_EQ(0, Update("SHARE_blank", {{"CompleteID", ""}, {"RunningID", ""}}));
-    ASSERT_EQ(0, Update("SHARE_noComplete", {{"RunningID", "B"}}));
-
-    List refused({"left over"});
-    List mine({"runA", "blank", "doneBidle", "noComplete", "nosection"});
-    EXPECT_EQ(0, S2SCheckIfSharePaired(mine.get(), "A", refused.slot()));
-    EXPECT_TRUE(refused.Items().empty());
-
-    List all({"runA", "runB", "doneB", "doneAnowB", "doneBidle", "blank", "nosection"});
-    EXPECT_EQ(214, S2SCheckIfSharePaired(all.get(), "A", refused.slot()));
-    EXPECT_THAT(refused.Items(), ElementsAre("runB", "doneB", "doneAnowB"));
-    EXPECT_EQ(214, S2SCheckIfSharePaired(all.get(), "B", refused.slot()));
-    EXPECT_THAT(refused.Items(), ElementsAre("runA"));
-    EXPECT_TRUE(messages_.Take().empty());
-
-    // The caller may hand in no list and get a new one.
-    VLIBSzList* fresh = nullptr;
-    EXPECT_EQ(214, S2SCheckIfSharePaired(all.get(), "C", &fresh));
-    EXPECT_EQ(4, VLIBCSzListCount(fresh));
-    VLIBCSzListFree(fresh);
-}
-
-TEST_F(PairingStoreTest, CheckIfSharePairedReportsUnreadableShares) {
-    ASSERT_EQ(0, Update("SHARE_half", {{"CompleteID", "A"}}));
-    List shares({"half"});
-    List refused;
-    EXPECT_EQ(206, S2SCheckIfSharePaired(shares.get(), "A", refused.slot()));
-    EXPECT_THAT(messages_.Take(), ElementsAre("Failed to get section [SHARE_half] RunningID value.",
-                                              "getSharePairStatus error"));
-
-    // IDs are read into 36-byte buffers: a longer stored ID cannot be read.
-    ASSERT_EQ(0, Update("SHARE_long", {{"CompleteID", std::string(36, 'x')}, {"RunningID", "A"}}));
-    List longShare({"long"});
-    EXPECT_EQ(206, S2SCheckIfSharePaired(longShare.get(), "A", refused.slot()));
-    EXPECT_THAT(messages_.Take(),
-                ElementsAre("Failed to get section [SHARE_long] CompleteID value.",
-                            "getSharePairStatus error"));
-}
-
-TEST_F(PairingStoreTest, AnEmptyShareNameTakesThePreviousSharesStatus) {
-    ASSERT_EQ(0, Update("SHARE_runB", {{"CompleteID", ""}, {"RunningID", "B"}}));
-    List shares({"runB", ""});
-    List refused;
-    EXPECT_EQ(214, S2SCheckIfSharePaired(shares.get(), "A", refused.slot()));
-    EXPECT_THAT(refused.Items(), ElementsAre("runB", ""));
-    EXPECT_THAT(messages_.Take(), ElementsAre("Parameter error on getSharePairStatus."));
-
-    List first({"", "nosection"});
-    EXPECT_EQ(0, S2SCheckIfSharePaired(first.get(), "A", refused.slot()));
-}
-
-// --- status -------------------------------------------------------------------------------------
-
-class PairingStatusTest : public PairingStoreTest {
-  protected:
-    std::string PidFile() const { return root_.path() + "/var/run/rsyncd.pid"; }
-
-    // Status with the owner and service switch given; the record is released here.
-    s2s_svr_status Status(int* result = nullptr) {
-        s2s_svr_status status = {-1, -1, nullptr, nullptr};
-        int got = s2s_svr_get_status(&status);
-        if (result != nullptr) {
-            *result = got;
-        }
-        last_client_ = status.client_id != nullptr ? status.client_id : "(null)";
-        last_server_ = status.server_name != nullptr ? status.server_name : "(null)";
-        s2s_svr_put_status(&status);
-        EXPECT_EQ(nullptr, status.client_id);
-        return status;
+// A share is another client's while that client runs it, or once it completed it and nobody
+// else runs it; a share without a section is free.
+TEST_F(PairingStore, SharesBoundToAnotherClientAreRefused) {
+    // A share's CompleteID and RunningID.
+    const std::tuple<const char*, const char*, const char*> ids[] = {
+        {"runA", "", "A"},       {"runB", "", "B"},      {"doneB", "B", "B"},
+        {"doneAnowB", "A", "B"}, {"doneBidle", "B", ""}, {"blank", "", ""}};
+    for (const auto& [share, complete, running] : ids) {
+        Table values({{"CompleteID", complete}, {"RunningID", running}});
+        ASSERT_EQ(S2SServerUpdateShare(share, values.get()), 0);
     }
-
-    std::string last_client_;
-    std::string last_server_;
-};
-
-TEST_F(PairingStatusTest, RunningNeedsTheSwitchOnAndALiveRsyncDaemon) {
-    ASSERT_EQ(0, Update("PairedClientInfo",
-                        {{"s2sEnabled", "yes"}, {"clientID", "A"}, {"serverName", "serverA"}}));
-    int result = -9;
-    EXPECT_EQ(0, Status(&result).running);  // no pid file
-    EXPECT_EQ(0, result);
-    EXPECT_EQ("A", last_client_);
-    EXPECT_EQ("serverA", last_server_);
-
-    s2s_test::WriteFile(PidFile(), std::to_string(getpid()) + "\n");
-    EXPECT_EQ(1, Status().running);
-
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"s2sEnabled", "Yes"}}));
-    EXPECT_EQ(0, Status().running);
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"s2sEnabled", "no"}}));
-    EXPECT_EQ(0, Status().running);
-
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"s2sEnabled", "yes"}}));
-    pid_t gone = fork();
-    if (gone == 0) {
-        _exit(0);
-    }
-    ASSERT_EQ(gone, waitpid(gone, nullptr, 0));
-    s2s_test::WriteFile(PidFile(), std::to_string(gone) + "\n");
-    EXPECT_EQ(0, Status().running);
-}
-
-TEST_F(PairingStatusTest, AbsentOwnerKeysGiveNullStrings) {
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"s2sEnabled", "yes"}}));
-    int result = -9;
-    Status(&result);
-    EXPECT_EQ(0, result);
-    EXPECT_EQ("(null)", last_client_);
-    EXPECT_EQ("(null)", last_server_);
-    EXPECT_EQ(-1, s2s_svr_get_status(nullptr));
-    EXPECT_EQ(0, s2s_svr_put_status(nullptr));
-}
-
-TEST_F(PairingStatusTest, BusyFollowsTheHeartbeatWindow) {
-    ASSERT_EQ(0, Update("PairedClientInfo", {{"s2sEnabled", "no"}}));
-    EXPECT_EQ(0, Status().busy);
-    ASSERT_EQ(0, Update("TASK_idle", {{"status", "idle"}}));
-    ASSERT_EQ(0, Update("TASK_none", {{"other", "1"}}));
-    ASSERT_EQ(0, Update("SHARE_TASK_x", {{"status", std::to_string(time(nullptr))}}));
-    EXPECT_EQ(0, Status().busy);
-
-    ASSERT_EQ(0, Update("TASK_old", {{"status", std::to_string(time(nullptr) - 120)}}));
-    EXPECT_EQ(0, Status().busy);
-    ASSERT_EQ(0, Update("TASK_old", {{"status", "garbage"}}));
-    EXPECT_EQ(0, Status().busy);
-
-    // 119 seconds old is still busy; the clock may tick between writing and reading, so the
-    // check counts only when it did not.
-    for (int attempt = 0;; ++attempt) {
-        const time_t before = time(nullptr);
-        ASSERT_EQ(0, Update("TASK_recent", {{"status", std::to_string(before - 119)}}));
-        const int busy = Status().busy;
-        if (time(nullptr) == before) {
-            EXPECT_EQ(1, busy);
-            break;
-        }
-        ASSERT_LT(attempt, 20);
-    }
-    ASSERT_EQ(0, Update("TASK_recent", {{"status", "idle"}}));
-    EXPECT_EQ(0, Status().busy);
-
-    ASSERT_EQ(0, Update("TASK_future", {{"status", std::to_string(time(nullptr) + 3600)}}));
-    EXPECT_EQ(1, Status().busy);
-}
-
-// --- bad input ----------------------------------------------------------------------------------
-
-TEST_F(PairingStoreTest, ShareNamesWithSyntaxCharactersStayInTheirOwnSection) {
-    ASSERT_EQ(0, Update("SHARE_neighbour", {{"RunningID", "N"}}));
-    const char* names[] = {"a]b", "[x]", "a=b", "q\"uote", "it's", "sp ace", "semi;colon"};
-    for (const char* name : names) {
-        Table values({{"RunningID", std::string("id-") + name}, {"CompleteID", ""}});
-        ASSERT_EQ(0, S2SServerUpdateShare(name, values.get())) << name;
-    }
-    for (const char* name : names) {
-        char buf[64];
-        ASSERT_GE(S2SServerGetShare(name, "RunningID", buf, sizeof(buf)), 0) << name;
-        EXPECT_EQ(std::string("id-") + name, buf);
-        List shares({name});
-        List refused;
-        EXPECT_EQ(214, S2SCheckIfSharePaired(shares.get(), "other", refused.slot())) << name;
-        EXPECT_EQ(0, S2SCheckIfSharePaired(shares.get(), (std::string("id-") + name).c_str(),
-                                           refused.slot()))
-            << name;
-    }
-    EXPECT_EQ((Pairs{{"RunningID", "N"}}), ReadSection("SHARE_neighbour"));
-    EXPECT_EQ(8u, SectionNames().size());
-}
-
-TEST_F(PairingStoreTest, InputTheFileCannotCarryIsRefusedWithoutTouchingIt) {
-    ASSERT_EQ(0, Update("SHARE_neighbour", {{"RunningID", "N"}}));
-    const std::string before = root_.Contents();
-    Table plain({{"RunningID", "A"}});
-
-    EXPECT_EQ(-1, S2SServerUpdateShare("new\nline", plain.get()));
-    EXPECT_EQ(-1, S2SServerUpdateShare("cr\rshare", plain.get()));
-    EXPECT_EQ(-1, S2SServerUpdateShare("neighbour]\n[SHARE_x", plain.get()));
-    EXPECT_EQ(-1, S2SServerUpdateTask("trailing ", plain.get()));
-    EXPECT_EQ(-1, Update("SHARE_neighbour", {{"RunningID", "two\nlines"}}));
-    EXPECT_EQ(-1, Update("SHARE_neighbour", {{"key=", "v"}}));
-    EXPECT_EQ(-1, Update("SHARE_neighbour", {{"RunningID", std::string(9000, 'v')}}));
-    EXPECT_EQ(before, root_.Contents());
-
-    // Such a share can have no section, so nobody holds it.
-    List shares({"new\nline"});
-    List refused;
-    EXPECT_EQ(0, S2SCheckIfSharePaired(shares.get(), "A", refused.slot()));
-    EXPECT_EQ(before, root_.Contents());
-}
-
-TEST_F(PairingStoreTest, LongAndQuotedValuesRoundTrip) {
-    const std::string big(4096, 'v');
-    const std::string quoted = "say \"hi\" = [ok] ; # not a comment";
-    ASSERT_EQ(0, Update("TASK_big", {{"status", big}, {"note", quoted}}));
-    ASSERT_EQ(0, Update("TASK_next", {{"status", "idle"}}));
-    EXPECT_EQ((Pairs{{"status", big}, {"note", quoted}}), ReadSection("TASK_big"));
-    EXPECT_EQ((Pairs{{"status", "idle"}}), ReadSection("TASK_next"));
-    ASSERT_EQ(0, S2SServerUpdatePairInfo(std::string(200, 'c').c_str(), big.c_str()));
-    EXPECT_EQ(big, ReadSection("CLIENTID_" + std::string(200, 'c'))["ServerName"]);
-}
-
-// --- the C interface ----------------------------------------------------------------------------
-
-TEST(PairingStoreInterfaceTest, TheSharedLibraryExportsUnmangledNames) {
-    void* lib = dlopen(S2S_BINARY_DIR "/libs2s.so", RTLD_NOW | RTLD_LOCAL);
-    ASSERT_NE(nullptr, lib) << dlerror();
-    for (const char* name :
-         {"isFileExist", "S2SCheckServerInfo", "S2SGetServerInfo", "S2SServerGetShare",
-          "S2SUpdateServerInfo", "S2SServerUpdateTask", "S2SServerUpdateShare",
-          "S2SServerSetPairValue", "S2SServerUpdatePairInfo", "S2SServerIfOldClientPaired",
-          "s2s_svr_reset_pair", "S2SCheckIfSharePaired", "s2s_svr_get_status",
-          "s2s_svr_put_status"}) {
-        EXPECT_NE(nullptr, dlsym(lib, name)) << name;
-    }
-    dlclose(lib);
-}
-
-TEST(PairingStoreInterfaceTest, ACProgramUsesTheStore) {
-    if (system("cc --version >/dev/null 2>&1") != 0) {
-        GTEST_SKIP() << "no C compiler";
-    }
-    StoreRoot root;
-    const std::string source = root.path() + "/use.c";
-    const std::string program = root.path() + "/use";
-    s2s_test::WriteFile(source, R"(#include <stdio.h>
-#include <string.h>
-#include "s2s_server.h"
-int main(void) {
-    VLIBSzHash* values = VLIBCSzHashAlloc(4);
+    const Names all{"runA", "runB", "doneB", "doneAnowB", "doneBidle", "blank", "nosection"};
+    EXPECT_EQ(Check(all, "A"), (Names{"214", "runB", "doneB", "doneAnowB"}));
+    EXPECT_EQ(Check(all, "B"), (Names{"214", "runA"}));
+    EXPECT_EQ(Check({"runA", "blank", "doneBidle", "nosection", "new\nline"}, "A"), Names{"0"});
+    // An empty share name takes the previous share's status.
+    EXPECT_EQ(Check({"runB", ""}, "A"), (Names{"214", "runB", ""}));
+    // Missing arguments; a section without RunningID, or an ID too long for its 36-byte field,
+    // cannot be read.
+    EXPECT_EQ(Check({}, "A"), (Names{"201", "left over"}));
+    EXPECT_EQ(Check(all, ""), (Names{"201", "left over"}));
+    ASSERT_EQ(Update("SHARE_half", {{"CompleteID", "A"}}), 0);
+    ASSERT_EQ(Update("SHARE_long", {{"CompleteID", std::string(36, 'x')}, {"RunningID", "A"}}), 0);
+    EXPECT_TRUE(Check({"half"}, "A") == Names{"206"} && Check({"long"}, "A") == Names{"206"});
+    // The caller may hand in no list and get a new one, but must hand in where to put it.
     VLIBSzList* shares = VLIBCSzListAlloc(4);
-    VLIBSzList* refused = VLIBCSzListAlloc(4);
-    s2s_svr_status status;
-    int ok = S2SServerUpdatePairInfo("A", "serverA") == 0;
-    VLIBCSzHashSetValue(&values, "CompleteID", "");
-    VLIBCSzHashSetValue(&values, "RunningID", "B");
-    ok = ok && S2SServerUpdateShare("docs", values) == 0;
-    VLIBCSzListPush(&shares, "docs");
-    ok = ok && S2SCheckIfSharePaired(shares, "A", &refused) == 214;
-    ok = ok && s2s_svr_get_status(&status) == 0 && status.running == 0 &&
-         strcmp(status.client_id, "S2SMULTI-SRC-SUPPORT") == 0;
-    s2s_svr_put_status(&status);
-    VLIBCSzListFree(refused);
-    VLIBCSzListFree(shares);
-    VLIBCSzHashFree(values);
-    puts(ok ? "ok" : "failed");
-    return ok ? 0 : 1;
+    VLIBCSzListPush(&shares, "runB");
+    VLIBSzList* fresh = nullptr;
+    EXPECT_EQ(S2SCheckIfSharePaired(shares, "A", &fresh), 214);
+    EXPECT_EQ(Take(fresh), Names{"runB"});
+    EXPECT_EQ(S2SCheckIfSharePaired(shares, "A", nullptr), 201);
+    Take(shares);
 }
-)");
-#ifdef __SANITIZE_ADDRESS__
-    // The library carries the sanitizers' runtime, which must come first in the program.
-    const std::string sanitize = " -fsanitize=address,undefined -fno-sanitize-recover=all";
-#else
-    const std::string sanitize;
-#endif
-    const std::string compile =
-        "cc" + sanitize +
-        " -std=c11 -Wall -Wextra -Wpedantic -Werror -I " S2S_SOURCE_DIR "/include -o '" + program +
-        "' '" + source + "' -L " S2S_BINARY_DIR " -ls2s -Wl,-rpath," S2S_BINARY_DIR;
-    ASSERT_EQ(0, system(compile.c_str())) << compile;
-    EXPECT_EQ(0, system(("'" + program + "'").c_str()));
+
+// Running needs the switch on ("yes" exactly) and a live rsync daemon; the owner is the single
+// client recorded. Busy while some task's heartbeat is less than 120 seconds old, or in the
+// future (the two servers' clocks need not agree); idle, missing or garbage heartbeats are not.
+TEST_F(PairingStore, StatusFollowsTheSwitchTheDaemonAndTheHeartbeats) {
+    s2s_svr_status status = {-1, -1, nullptr, nullptr};
+    auto get = [&status] {
+        s2s_svr_put_status(&status);
+        EXPECT_EQ(s2s_svr_get_status(&status), 0);
+        return std::to_string(status.running) + std::to_string(status.busy) + " " +
+               (status.client_id ? status.client_id : "(null)") + "/" +
+               (status.server_name ? status.server_name : "(null)");
+    };
+    ASSERT_EQ(Update("PairedClientInfo", {{"s2sEnabled", "yes"}}), 0);
+    EXPECT_EQ(get(), "00 (null)/(null)");  // no pid file
+    ASSERT_EQ(Update("PairedClientInfo", {{"clientID", "A"}, {"serverName", "serverA"}}), 0);
+    const std::string pid_file = S2SPath(S2S_PATH_RSYNCD_PID);
+    s2s_test::WriteFile(pid_file, std::to_string(getpid()) + "\n");
+    EXPECT_EQ(get(), "10 A/serverA");
+    for (const char* off : {"Yes", "no"}) {
+        ASSERT_EQ(Update("PairedClientInfo", {{"s2sEnabled", off}}), 0);
+        EXPECT_EQ(get(), "00 A/serverA") << off;
+    }
+
+    const long now = time(nullptr);
+    for (const auto& [task, beat] : {std::pair<const char*, std::string>{"TASK_idle", "idle"},
+                                     {"TASK_garbage", "garbage"},
+                                     {"SHARE_TASK_x", std::to_string(now)},
+                                     {"TASK_old", std::to_string(now - 120)}}) {
+        ASSERT_EQ(Update(task, {{"status", beat}}), 0);
+    }
+    ASSERT_EQ(Update("TASK_none", {{"other", "1"}}), 0);
+    EXPECT_EQ(get()[1], '0');
+    ASSERT_EQ(Update("TASK_recent", {{"status", std::to_string(now - 60)}}), 0);
+    EXPECT_EQ(get()[1], '1');
+    ASSERT_EQ(Update("TASK_recent", {{"status", std::to_string(now + 3600)}}), 0);
+    EXPECT_EQ(get()[1], '1');
+    s2s_svr_put_status(&status);
+    EXPECT_EQ(status.client_id, nullptr);
+    EXPECT_TRUE(s2s_svr_get_status(nullptr) == -1 && s2s_svr_put_status(nullptr) == 0);
 }
 
 }  // namespace

@@ -18,7 +18,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/platform_test_util.h"
+#include "support/test_util.h"
 #include "s2s_platform.h"
 #include "support/fault_env.h"
 #include "support/test_util.h"

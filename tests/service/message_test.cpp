@@ -31,7 +31,6 @@ TEST(RequestScanner, AWholeRequestIsFoundAtItsEndAndEveryPartWaitsForMore) {
     S2S::PObject request;
     ASSERT_EQ(s2sd::DecodeMessage(kRequest, length, request), 0);
     EXPECT_EQ(request["command"].asString(), "list");
-    EXPECT_EQ(request["task_id"].asUInt64(), 7u);
     EXPECT_EQ(request["x"].asArray().size(), 2u);
 
     EXPECT_EQ(s2sd::ScanMessage(kRequest, 1, length), Scan::kTooDeep);
@@ -48,21 +47,15 @@ TEST(RequestScanner, MangledRequestsAreJudgedWithinTheBytesReceived) {
     for (int round = 0; round < 20000; ++round) {
         std::string bytes = kRequest;
         for (int edits = 1 + static_cast<int>(random() % 4); edits > 0; --edits) {
-            const size_t at = random() % bytes.size();
-            switch (random() % 3) {
-                case 0:
-                    bytes[at] = static_cast<char>(random());
-                    break;
-                case 1:
-                    bytes.erase(at, 1 + random() % 3);
-                    break;
-                default:
-                    bytes.insert(at, 1, static_cast<char>(random()));
-                    break;
-            }
-            if (bytes.empty()) {
-                bytes = "\x42";
-            }
+            // Overwrite, drop or insert bytes at a random place.
+            const size_t at = random() % bytes.size(), what = random() % 3;
+            const std::string junk(1, static_cast<char>(random()));
+            bytes.replace(at,
+                          what == 2   ? 0
+                          : what == 1 ? 1 + random() % 3
+                                      : 1,
+                          what == 1 ? "" : junk);
+            bytes = bytes.empty() ? "\x42" : bytes;
         }
         // Exactly the bytes received: anything read past them is caught by the sanitizers.
         const std::string received(bytes);

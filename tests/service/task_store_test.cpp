@@ -1,7 +1,6 @@
-// The task store opens a database written by the service before the guard options existed: the
-// tasks and history are kept, the new columns take their safe defaults, and what is stored in them
-// afterwards survives a reopen. A database from a newer service is refused, not altered. Password
-// files without a task are removed at open, but not when the store holds no task at all.
+// The task store opens a database of the first schema keeping its tasks and history (new columns
+// take safe defaults, values stored later survive a reopen), refuses a newer one unaltered, and
+// removes password files without a task at open, but not when the store holds no task at all.
 #include "service/task_store.h"
 
 #include <gtest/gtest.h>
@@ -41,8 +40,8 @@ void RunSql(const std::string& path, const char* sql) {
     sqlite3* db = nullptr;
     ASSERT_EQ(sqlite3_open(path.c_str(), &db), SQLITE_OK);
     char* message = nullptr;
-    const int rc = sqlite3_exec(db, sql, nullptr, nullptr, &message);
-    EXPECT_EQ(rc, SQLITE_OK) << (message != nullptr ? message : "");
+    EXPECT_EQ(sqlite3_exec(db, sql, nullptr, nullptr, &message), SQLITE_OK)
+        << (message != nullptr ? message : "");
     sqlite3_free(message);
     sqlite3_close(db);
 }
@@ -64,7 +63,6 @@ TEST(TaskStore, ADatabaseOfTheFirstSchemaIsMigratedAndKeepsItsTasksAndHistory) {
         std::vector<s2sd::StoredTask> tasks;
         ASSERT_EQ(store.Load(tasks, error), 0) << error;
         ASSERT_EQ(tasks.size(), 1u);
-        EXPECT_EQ(tasks[0].task.GetInfo().GetName(), "nightly");
         EXPECT_EQ(tasks[0].task.GetInfo().GetShareList().front(), "docs");
         EXPECT_FALSE(tasks[0].guard.allowEmptySource);
         EXPECT_FALSE(tasks[0].guard.maxDelete.set);
@@ -104,28 +102,21 @@ TEST(TaskStore, ADatabaseOfTheFirstSchemaIsMigratedAndKeepsItsTasksAndHistory) {
     EXPECT_EQ(runs[0].shares[0].would_delete, 7);
 }
 
-TEST(TaskStore, ADatabaseOfANewerSchemaIsRefusedUntouched) {
+// A zero-length database is a lost or truncated one: its tasks' password files are no orphans.
+TEST(TaskStore, ANewerDatabaseIsRefusedUntouchedAndAnEmptyOneKeepsThePasswordFiles) {
     s2s_test::TempDir dir;
     const std::string db = dir / "s2s.db";
     RunSql(db, "PRAGMA user_version = 99");
-    s2sd::TaskStore store;
     std::string error;
-    EXPECT_EQ(store.Open(db, dir / "passwords", error), -1);
+    EXPECT_EQ(s2sd::TaskStore().Open(db, dir / "passwords", error), -1);
     EXPECT_NE(error.find("newer"), std::string::npos) << error;
-    // No table of the store was created in it.
-    RunSql(db, "CREATE TABLE tasks (x)");
-}
+    RunSql(db, "CREATE TABLE tasks (x)");  // no table of the store was created in it
 
-// A zero-length database (lost or truncated) opens as an empty store; the password files of the
-// tasks it had are not deleted as orphans.
-TEST(TaskStore, AnEmptyDatabaseLeavesThePasswordFilesAlone) {
-    s2s_test::TempDir dir;
-    s2s_test::WriteFile(dir / "s2s.db", "");
-    ASSERT_EQ(mkdir((dir / "passwords").c_str(), 0700), 0);
+    s2s_test::WriteFile(db, "");
+    s2s_test::MakeDirs(dir / "passwords", 0700);
     s2s_test::WriteFile(dir / "passwords/1", "secret");
     s2sd::TaskStore store;
-    std::string error;
-    ASSERT_EQ(store.Open(dir / "s2s.db", dir / "passwords", error), 0) << error;
+    ASSERT_EQ(store.Open(db, dir / "passwords", error), 0) << error;
     EXPECT_EQ(access((dir / "passwords/1").c_str(), F_OK), 0);
 }
 
