@@ -28,15 +28,7 @@ fi
 phase_start=$SECONDS
 phase_end() {
   echo "== $1 took $((SECONDS - phase_start))s"
-  # With ccache a machine that keeps its cache between runs recompiles only what changed, in any
-# clone (paths below the source tree are hashed relative to it).
-launcher=()
-if command -v ccache >/dev/null; then
-  export CCACHE_BASEDIR=$PWD CCACHE_NOHASHDIR=1
-  launcher=(-DCMAKE_CXX_COMPILER_LAUNCHER=ccache -DCMAKE_C_COMPILER_LAUNCHER=ccache)
-fi
-
-phase_start=$SECONDS
+  phase_start=$SECONDS
 }
 # run_suite DIR EXCLUDE CMAKE-ARGS...: configure, build, and run the tests not matching EXCLUDE.
 run_suite() {
