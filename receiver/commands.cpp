@@ -329,6 +329,12 @@ int GetProtocolVer(const Command& c, ReceiverAnswer* a) {
     return protocol::kOK;
 }
 
+// Both pairing commands carry "dry_run" as yes or no and a server name the store can hold.
+bool PairingKeysValid(const Command& c, bool* dryRun) {
+    return YesNo(c.Get(protocol::kKeyDryRun), dryRun) &&
+           ValidServerName(c.Get(protocol::kKeyServerName));
+}
+
 int Pairing(const Command& c) {
     int rc = c.Keys({protocol::kKeyDryRun, protocol::kKeyServerName}, {});
     if (rc != 0) {
@@ -336,7 +342,7 @@ int Pairing(const Command& c) {
     }
     bool dryRun = false;
     const std::string& serverName = c.Get(protocol::kKeyServerName);
-    if (!YesNo(c.Get(protocol::kKeyDryRun), &dryRun) || !ValidServerName(serverName)) {
+    if (!PairingKeysValid(c, &dryRun)) {
         return protocol::kMalformed;
     }
     StoreContents store;
@@ -379,7 +385,7 @@ int PairingMultiSrc(const Command& c, ReceiverAnswer* a) {
     }
     bool dryRun = false;
     const std::string& serverName = c.Get(protocol::kKeyServerName);
-    if (!YesNo(c.Get(protocol::kKeyDryRun), &dryRun) || !ValidServerName(serverName)) {
+    if (!PairingKeysValid(c, &dryRun)) {
         return protocol::kMalformed;
     }
     std::vector<std::string> shares;
