@@ -111,6 +111,8 @@ TEST(ChannelTest, ReadWriteAndWaitContracts) {
              EXPECT_TRUE(u8 == 0xAB && u16 == 0x0102 && u32 == 0x03040506u &&
                          u64 == 0x0708090A0B0C0D0EULL);
              EXPECT_EQ(0x0807060504030201ULL, c.Convert(0x0102030405060708ULL));
+             EXPECT_EQ(0x04030201u, c.Convert(0x01020304u));
+             EXPECT_EQ(0x0201, c.Convert(static_cast<unsigned short>(0x0102)));
              int ret = c.ReadInt32(&u32);
              EXPECT_EQ(0x03040506u, u32);
              return ret;

@@ -7,6 +7,7 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <future>
 #include <string>
 
@@ -22,18 +23,18 @@ using s2s_test::LogCapture;
 using s2s_test::SocketPair;
 const int kProtocol = S2S::kStatusProtocolError;
 
-// One message sent through `channel` (a fresh Channel by default) opened on a socket pair; the
-// bytes that reached the peer.
-std::string Encode(const PObject& object, unsigned int capacity = 4096,
-                   Channel* channel = nullptr) {
+// One message sent by `with` (a fresh PStream by default) through `channel` (a fresh Channel by
+// default) opened on a socket pair; the bytes that reached the peer.
+std::string Encode(const PObject& object, unsigned int capacity = 4096, Channel* channel = nullptr,
+                   PStream* with = nullptr) {
     SocketPair pair;
     auto reader = std::async(std::launch::async, [&] { return s2s_test::ReadToEnd(pair.b); });
     {
         Channel own(capacity);
         Channel& out = channel != nullptr ? *channel : own;
         EXPECT_EQ(0, out.Open(pair.ReleaseA(), true));
-        PStream stream;
-        EXPECT_EQ(0, stream.Send(out, object));
+        PStream own_stream;
+        EXPECT_EQ(0, (with != nullptr ? *with : own_stream).Send(out, object));
         out.Close();
     }
     return reader.get();
@@ -205,6 +206,23 @@ TEST(PStreamTest, FailuresLogTheKeyPathOfWhatWasInTransfer) {
     stream.ClearHistory();
     stream.GetStatus(path, a, b);
     EXPECT_EQ(0u, a + b);
+    // Read by another thread while a message is sent, they are always whole.
+    PObject message;
+    for (int i = 0; i < 2000; ++i) {
+        message["k" + std::to_string(i)]["inner"] = static_cast<unsigned long long>(i);
+    }
+    std::atomic<bool> done{false};
+    auto watcher = std::async(std::launch::async, [&] {
+        bool whole = true;
+        for (std::string key; !done.load();) {
+            stream.GetStatus(key, a, b);
+            whole = whole && (key.empty() || key[0] == 'k') && a + b == 0;
+        }
+        return whole;
+    });
+    EXPECT_FALSE(Encode(message, 256, nullptr, &stream).empty());
+    done = true;
+    EXPECT_TRUE(watcher.get());
 }
 
 TEST(PStreamTest, ReceivingIntoContainersAddsToThemAndReplacesOtherKinds) {
