@@ -21,8 +21,10 @@ s2s_require_root() {  # script-name why
   fi
 }
 
-# Configures the build folder (quietly) and builds the given targets in it.
+# Configures the build folder (quietly) and builds the given targets in it; with S2S_NO_BUILD
+# set, the programs already there are used as they are (an installed tree, an earlier build).
 s2s_build() {  # target...
+  [ -n "${S2S_NO_BUILD:-}" ] && return 0
   cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
   cmake --build "$build" -j "$(nproc)" --target "$@"
 }
