@@ -3,10 +3,10 @@
 # (S2S_ROOT, its own serial number) and one share of small files; all of them run `s2s sync` into
 # the same receiver at the same moment, once to copy everything and once more with nothing
 # changed. Prints per round the wall time, the CPU time of the receiver (its rsync daemon and
-# every connection and hook process the daemon waited for), the pairing-store writes (each one a
-# replacement of the store by rename, counted with inotify) and their rate, and checks that every
-# sync succeeded, every share arrived complete, and the store holds every client, share and task
-# record whole.
+# every connection and hook process the daemon waited for), the pairing-store updates and their
+# rate, and the replacements of the store (writes, each with its two fsyncs) they took, both
+# counted with inotify; and checks that every sync succeeded, every share arrived complete, and
+# the store holds every client, share and task record whole.
 #
 # Usage: bash bench/many_senders.sh            (needs root: private network namespace)
 #   S2S_BENCH_SENDERS   sending servers (default 32)
@@ -61,32 +61,44 @@ store=$receiver/usr/vurn/etc/vurnS2S.info
 daemon=$(cat "$receiver/var/run/rsyncd.pid")
 ticks=$(getconf CLK_TCK)
 
-# Counts the replacements of the store (a rename onto its name) until it is ended; prints the
-# count into the file named by its argument when it ends.
+# Counts the replacements of the store (a rename onto its name), and the updates handed to the
+# receiver's batched writer (a request renamed into the queue beside the store), until it is
+# ended; then prints "<replacements> <updates>" into the file named by its argument.
 count_writes() {  # out-file
   exec python3 - "$(dirname "$store")" "$(basename "$store")" "$1" <<'EOF'
 import ctypes, os, signal, struct, sys
 libc = ctypes.CDLL(None, use_errno=True)
 fd = libc.inotify_init1(0)
-IN_MOVED_TO, IN_CLOSE_WRITE = 0x80, 0x8
-if fd < 0 or libc.inotify_add_watch(fd, sys.argv[1].encode(), IN_MOVED_TO | IN_CLOSE_WRITE) < 0:
-    sys.exit("inotify: " + os.strerror(ctypes.get_errno()))
-count = 0
+IN_MOVED_TO, IN_CREATE = 0x80, 0x100
+folder, name, out = sys.argv[1], sys.argv[2], sys.argv[3]
+queue = "." + name + ".queue"
+def watch(path):
+    wd = libc.inotify_add_watch(fd, path.encode(), IN_MOVED_TO | IN_CREATE)
+    if wd < 0:
+        sys.exit("inotify: " + os.strerror(ctypes.get_errno()))
+    return wd
+top = watch(folder)
+queued = watch(os.path.join(folder, queue)) if os.path.isdir(os.path.join(folder, queue)) else -1
+writes = updates = 0
 def done(*_):
-    with open(sys.argv[3], "w") as out:
-        out.write("%d\n" % count)
+    with open(out, "w") as f:
+        f.write("%d %d\n" % (writes, updates))
     sys.exit(0)
 signal.signal(signal.SIGTERM, done)
-open(sys.argv[3] + ".ready", "w").close()
+open(out + ".ready", "w").close()
 while True:
     data = os.read(fd, 65536)
     at = 0
     while at < len(data):
-        _, mask, _, size = struct.unpack_from("iIII", data, at)
-        name = data[at + 16:at + 16 + size].rstrip(b"\0").decode()
+        wd, mask, _, size = struct.unpack_from("iIII", data, at)
+        entry = data[at + 16:at + 16 + size].rstrip(b"\0").decode()
         at += 16 + size
-        if mask & IN_MOVED_TO and name == sys.argv[2]:
-            count += 1
+        if wd == top and mask & IN_CREATE and entry == queue and queued < 0:
+            queued = watch(os.path.join(folder, queue))
+        elif wd == top and mask & IN_MOVED_TO and entry == name:
+            writes += 1
+        elif wd == queued and mask & IN_MOVED_TO and not entry.startswith("."):
+            updates += 1
 EOF
 }
 # CPU seconds of the receiver's daemon and the processes it has waited for.
@@ -116,11 +128,13 @@ round() {  # label
   kill "$watcher"
   wait "$watcher" || true
   watcher=
-  writes=$(cat "$work/writes")
+  read -r writes updates <"$work/writes"
+  # Without the batched writer (an earlier build) every update is one replacement.
+  ((updates)) || updates=$writes
   awk -v l="$label" -v a="$start" -v b="$end" -v c0="$cpu0" -v c1="$cpu1" -v w="$writes" \
-    -v f="$failed" -v n="$senders" 'BEGIN {
-    printf "%-10s %2d of %d synced  wall %6.3fs  receiver CPU %6.3fs  store writes %4d (%.0f/s)\n",
-      l, n - f, n, b - a, c1 - c0, w, w / (b - a) }'
+    -v u="$updates" -v f="$failed" -v n="$senders" 'BEGIN {
+    printf "%-10s %2d of %d synced  wall %6.3fs  receiver CPU %6.3fs  store updates %4d (%.0f/s)" \
+      " in %d writes\n", l, n - f, n, b - a, c1 - c0, u, u / (b - a), w }'
   if ((failed)); then
     grep -h . "$work/$label".*.log | sort | uniq -c | sort -rn | head -5 >&2
   fi

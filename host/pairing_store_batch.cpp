@@ -218,7 +218,7 @@ int ApplyUpdates(const std::vector<SectionUpdate>& updates) {
         rc = Write(store, requests);
     }
     const int error = VLIBCErrGet();
-    for (size_t i = rc == 0 ? 0 : requests.size(); i-- > 0;) {
+    for (size_t i = rc == 0 ? requests.size() : 0; i-- > 0;) {
         unlink(requests[i].path.c_str());
     }
     if (rc != 0 && queued) {
