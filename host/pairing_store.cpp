@@ -559,10 +559,7 @@ int ReadStore(StoreContents* contents) {
 }
 
 int UpdateShareRecord(const std::string& share, const ShareFields& fields) {
-    Table values(kUpdateTableSize);
-    if (!values.ok()) {
-        return S2S_SVR_ERR_ALLOC;
-    }
+    SectionUpdate update{kSharePrefix + share, {}};
     const std::pair<const char*, const std::optional<std::string>*> keys[] = {
         {kRunningID, &fields.runningID},
         {kCompleteID, &fields.completeID},
@@ -570,19 +567,21 @@ int UpdateShareRecord(const std::string& share, const ShareFields& fields) {
         {kLastResult, &fields.lastResult},
         {kLastTime, &fields.lastTime}};
     for (const auto& key : keys) {
-        if (*key.second && !values.Set(key.first, (*key.second)->c_str())) {
-            return S2S_SVR_ERR_ALLOC;
+        if (*key.second) {
+            update.values.emplace_back(key.first, **key.second);
         }
     }
-    return S2SServerUpdateShare(share.c_str(), values.get()) == 0 ? 0 : -1;
+    return ApplyUpdates({update});
 }
 
 int RecordTaskStatus(const std::string& key, const std::string& status) {
-    Table values(kUpdateTableSize);
-    if (!values.ok() || !values.Set(kTaskStatus, status.c_str())) {
-        return S2S_SVR_ERR_ALLOC;
-    }
-    return S2SServerUpdateTask(key.c_str(), values.get()) == 0 ? 0 : -1;
+    return ApplyUpdates({{kTaskPrefix + key, {{kTaskStatus, status}}}});
+}
+
+int RecordClient(const std::string& clientID, const std::string& serverName) {
+    return ApplyUpdates(
+        {{kClientPrefix + clientID, {{kClientServerName, serverName}}},
+         {kPairSection, {{kClientID, kMultiClientMarker}, {kServerName, kMultiClientMarker}}}});
 }
 
 }  // namespace PairingStore

@@ -6,6 +6,7 @@
 
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace S2S {
@@ -89,14 +90,33 @@ struct StoreContents {
 // created).
 int ReadStore(StoreContents* contents);
 
+// The keys to set in one section of the store (the section is appended when it is missing).
+struct SectionUpdate {
+    std::string section;
+    std::vector<std::pair<std::string, std::string>> values;
+};
+
+// The receiver's writer (host/pairing_store_batch.cpp). Writes `updates` in one replacement of
+// the store, together with the updates other processes have waiting at that moment, under the
+// same semaphore as every other writer: many writers at once share one replacement (and its two
+// fsyncs) instead of taking turns for one each. The updates of one call are all-or-nothing and
+// durable when it returns 0; a write that would change nothing is skipped. Unlike
+// S2SUpdateServerInfo it may set several sections at once and logs through the library's logger.
+// 0, or -1 with the platform error set (VLIB_ERR_TOO_LARGE: nothing was written).
+int ApplyUpdates(const std::vector<SectionUpdate>& updates);
+
 // Sets the fields of the share's record that `fields` sets, keeping the others (the record is
-// added when missing). 0; 200 (S2S_SVR_ERR_ALLOC) when the update could not be built; -1 as
-// S2SServerUpdateShare (the platform error tells why).
+// added when missing), through ApplyUpdates. 0, or -1 as ApplyUpdates.
 int UpdateShareRecord(const std::string& share, const ShareFields& fields);
 
-// Records a task's heartbeat (`status`: epoch seconds, or "idle") under `key`. 0; 200 when the
-// update could not be built; -1 as S2SServerUpdateTask.
+// Records a task's heartbeat (`status`: epoch seconds, or "idle") under `key`, through
+// ApplyUpdates. 0, or -1 as ApplyUpdates.
 int RecordTaskStatus(const std::string& key, const std::string& status);
+
+// Records `clientID` in the multi-client scheme: its client section and the marker in the pairing
+// section (whose other keys stay), in one write through ApplyUpdates; what
+// S2SServerUpdatePairInfo does in two. 0, or -1 as ApplyUpdates.
+int RecordClient(const std::string& clientID, const std::string& serverName);
 
 }  // namespace PairingStore
 }  // namespace S2S

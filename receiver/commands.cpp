@@ -216,11 +216,8 @@ int UpdateShare(const std::string& share, const ShareFields& fields) {
             return protocol::kOK;
         }
     }
-    int rc = PairingStore::UpdateShareRecord(share, fields);
-    if (rc == S2S_SVR_ERR_ALLOC) {
-        return protocol::kInternal;
-    }
-    return rc == 0 ? protocol::kOK : StoreWriteFailure();
+    return PairingStore::UpdateShareRecord(share, fields) == 0 ? protocol::kOK
+                                                               : StoreWriteFailure();
 }
 
 // The share's completed ID as stored, "" when absent. Binding writes it back with the running
@@ -260,8 +257,8 @@ int RecordMultiClient(const std::string& clientID, const std::string& serverName
     if (old == 1 && s2s_svr_reset_pair() != 0) {
         return StoreWriteFailure();
     }
-    int rc = S2SServerUpdatePairInfo(clientID.c_str(), serverName.c_str());
-    return rc == 0 ? protocol::kOK : StoreWriteFailure();
+    return PairingStore::RecordClient(clientID, serverName) == 0 ? protocol::kOK
+                                                                 : StoreWriteFailure();
 }
 
 // Brings the daemon's share modules up to date with the share registry: a share registered
@@ -553,11 +550,7 @@ int UpdateTaskStatus(const Command& c) {
     if (room != protocol::kOK) {
         return room;
     }
-    rc = PairingStore::RecordTaskStatus(key, Now());
-    if (rc == S2S_SVR_ERR_ALLOC) {
-        return protocol::kInternal;
-    }
-    return rc == 0 ? protocol::kOK : StoreWriteFailure();
+    return PairingStore::RecordTaskStatus(key, Now()) == 0 ? protocol::kOK : StoreWriteFailure();
 }
 
 }  // namespace
@@ -659,7 +652,8 @@ ReceiverAnswer ReceiverRunCommand(const std::string& input, bool oldServer) {
                 rc = protocol::kUnknownCommand;
             }
         }
-        const char* shownName = protocol::HasControl(name) || name.size() > kMaxKey ? "?" : name.c_str();
+        const char* shownName =
+            protocol::HasControl(name) || name.size() > kMaxKey ? "?" : name.c_str();
         const char* shownClient = ValidClientID(client) ? client.c_str() : "?";
         if (rc == protocol::kOK) {
             Logger::LogMsg(Logger::Info, "[INFO] receiver_commands.cpp(%d): %s from client %s\n",

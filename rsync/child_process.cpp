@@ -1,6 +1,8 @@
 // RunChild: fork and exec without a shell, the merged output pipe read line by line, the
 // cancel poll, and the stop of the child's whole process group (SIGTERM, then SIGKILL). Every
-// path reaps the child before returning: no zombie and no running member of the group is left.
+// path reaps the child before returning (no zombie and no running member of the group is left),
+// except a child whose caller has all it needs: it is left to this thread's list of runs that
+// end by themselves, reaped without waiting at the next run and waited for when the thread ends.
 #include "rsync/child_process.h"
 
 #include <fcntl.h>
@@ -17,6 +19,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <thread>
+#include <utility>
+#include <vector>
 
 #include "platform/env.h"
 
@@ -38,6 +42,7 @@ class Fd {
     Fd(const Fd&) = delete;
     Fd& operator=(const Fd&) = delete;
     int get() const { return fd_; }
+    int release() { return std::exchange(fd_, -1); }
     void reset(int fd = -1) {
         if (fd_ >= 0) {
             close(fd_);
@@ -163,7 +168,94 @@ void StopGroup(pid_t pid, int pidfd, int fd, LineSplitter* splitter, bool* reape
     }
 }
 
+// A child left to end by itself, and what is left of its run.
+struct LeftRun {
+    pid_t pid;
+    int pidfd;   // -1 without pidfds
+    int output;  // the read end of its output pipe, drained so that the child never blocks on it
+    std::function<void()> after_exit;
+};
+
+// The runs this thread left; the thread waits for them before it ends, so the kernel never
+// stops one for its forking thread's end.
+class LeftRuns {
+  public:
+    LeftRuns() = default;
+    ~LeftRuns() { Finish(); }
+    LeftRuns(const LeftRuns&) = delete;
+    LeftRuns& operator=(const LeftRuns&) = delete;
+
+    void Add(LeftRun run) { runs_.push_back(std::move(run)); }
+
+    // Reaps the runs that have ended, without waiting.
+    void ReapEnded() {
+        for (size_t i = 0; i < runs_.size();) {
+            int status = 0;
+            Drain(runs_[i]);
+            if (TryReap(runs_[i].pid, &status)) {
+                End(i);
+            } else {
+                ++i;
+            }
+        }
+    }
+
+    // Waits for every run; one that outlasts the grace period is stopped.
+    void Finish() {
+        while (!runs_.empty()) {
+            LeftRun& run = runs_.back();
+            const auto deadline = std::chrono::steady_clock::now() + kTermGrace;
+            int status = 0;
+            bool reaped = false;
+            while (!(reaped = TryReap(run.pid, &status)) &&
+                   std::chrono::steady_clock::now() < deadline) {
+                Drain(run);
+                AwaitExit(run.pidfd, 20);
+            }
+            if (!reaped) {
+                LineSplitter splitter(kNoSink);
+                StopGroup(run.pid, run.pidfd, run.output, &splitter, &reaped, &status);
+            }
+            End(runs_.size() - 1);
+        }
+    }
+
+  private:
+    static void Drain(const LeftRun& run) {
+        LineSplitter splitter(kNoSink);
+        DrainAvailable(run.output, &splitter);
+    }
+    // The run has been reaped: whatever of its group is left goes, then its descriptors.
+    void End(size_t i) {
+        LeftRun run = std::move(runs_[i]);
+        runs_.erase(runs_.begin() + static_cast<std::ptrdiff_t>(i));
+        if (GroupAlive(run.pid)) {
+            s2s_platform::Env::Default()->Kill(-run.pid, SIGKILL);
+        }
+        if (run.pidfd >= 0) {
+            close(run.pidfd);
+        }
+        if (run.output >= 0) {
+            close(run.output);
+        }
+        if (run.after_exit) {
+            run.after_exit();
+        }
+    }
+
+    static const LineSink kNoSink;
+    std::vector<LeftRun> runs_;
+};
+
+const LineSink LeftRuns::kNoSink;
+
+thread_local LeftRuns t_left_runs;
+
 }  // namespace
+
+void FinishLeftRuns() {
+    t_left_runs.Finish();
+}
 
 std::string FindProgram(const std::string& program) {
     return s2s_platform::FindProgram(program);
@@ -172,6 +264,7 @@ std::string FindProgram(const std::string& program) {
 ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& cancel,
                       const LineSink& sink) {
     ChildOutcome outcome;
+    t_left_runs.ReapEnded();
     if (job.argv.empty()) {
         outcome.error = "no program given";
         return outcome;
@@ -227,13 +320,17 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
             StopGroup(pid, pid_fd.get(), read_end.get(), &splitter, &reaped, &status);
             break;
         }
-        struct pollfd pfds[2];
+        struct pollfd pfds[3];
         nfds_t count = 0;
         if (!eof) {
             pfds[count++] = {read_end.get(), POLLIN, 0};
         }
         if (!reaped && pid_fd.get() >= 0) {
             pfds[count++] = {pid_fd.get(), POLLIN, 0};
+        }
+        const nfds_t readyAt = count;
+        if (!reaped && job.ready && job.ready_fd >= 0) {
+            pfds[count++] = {job.ready_fd, POLLIN, 0};
         }
         int timeout = cancel ? kPollMillis : -1;
         if (!reaped && pid_fd.get() < 0) {
@@ -252,6 +349,14 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
             } else if (n == 0 || (errno != EAGAIN && errno != EINTR)) {
                 eof = true;
             }
+        }
+        if (r > 0 && readyAt < count && pfds[readyAt].revents != 0 && job.ready()) {
+            // What is left of the run (rsync's own end) no longer concerns the caller.
+            splitter.Flush();
+            t_left_runs.Add({pid, pid_fd.release(), eof ? -1 : read_end.release(), job.after_exit});
+            outcome.exit_code = 0;
+            outcome.left_running = true;
+            return outcome;
         }
         if (!reaped) {
             siginfo_t ended = {};

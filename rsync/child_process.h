@@ -4,6 +4,10 @@
 // process dies (even by SIGKILL) the child gets SIGTERM from the kernel; the kernel sends it when
 // the forking thread ends, so RunChild must return on the thread that called it (it does: it
 // waits for the child itself).
+//
+// A caller that learns from the child's files that it has everything it needs (a command run's
+// reply) may let the child end in the background: it is then left to its thread, which reaps it
+// at its next RunChild, at FinishLeftRuns, and at the latest when the thread ends.
 #ifndef S2S_RSYNC_CHILD_PROCESS_H
 #define S2S_RSYNC_CHILD_PROCESS_H
 
@@ -23,14 +27,22 @@ struct ChildCommand {
     // in a copy of this process's environment; secrets travel only this way.
     std::vector<std::pair<std::string, std::string> > set_env;
     std::vector<std::string> unset_env;
+    // When `ready` is set: a descriptor that turns readable whenever the child may have produced
+    // all the caller needs (an inotify watch), and the test whether it has. Once the test says
+    // yes, RunChild returns at once (exit_code 0, left_running) and the child ends in the
+    // background; `after_exit` is called once it has been reaped (only then).
+    int ready_fd = -1;
+    std::function<bool()> ready;
+    std::function<void()> after_exit;
 };
 
 struct ChildOutcome {
-    bool started = false;    // false: the program could not be started (see `error`)
-    bool cancelled = false;  // the predicate asked to stop and the group was killed
-    int exit_code = -1;      // the exit status; -1 when it died from a signal
-    int signal = 0;          // the signal that ended it, if any
-    std::string error;       // why it could not be started
+    bool started = false;       // false: the program could not be started (see `error`)
+    bool cancelled = false;     // the predicate asked to stop and the group was killed
+    int exit_code = -1;         // the exit status; -1 when it died from a signal
+    int signal = 0;             // the signal that ended it, if any
+    std::string error;          // why it could not be started
+    bool left_running = false;  // `ready` said yes: the child was left to end by itself
 };
 
 // Lines (split at '\n' and '\r') of the child's merged output; a final unterminated line too.
@@ -41,6 +53,10 @@ typedef std::function<void(const std::string& line)> LineSink;
 // bytes it read); that last answer is ignored.
 ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& cancel,
                       const LineSink& sink);
+
+// Waits until every child this thread left running has ended (reaped, its `after_exit` called).
+// A child that takes longer than rsync's own end would is stopped as a cancelled one is.
+void FinishLeftRuns();
 
 // The absolute path of `program` (returned as is when it holds a '/'), or "" when PATH has none.
 std::string FindProgram(const std::string& program);

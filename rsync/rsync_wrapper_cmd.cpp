@@ -1,7 +1,10 @@
 // Custom commands: the command lines travel as rsync's early input to the server's command module,
 // prefixed by a reply token of the client's choosing; the same run pulls the reply directory of
-// that token, which holds the handler's result code and output file.
+// that token, which holds the handler's result code and output file. The answer is taken the
+// moment the reply is complete; rsync's own end (a wait of 20 ms or more at the end of every
+// pull) then goes on in the background.
 #include <fcntl.h>
+#include <sys/inotify.h>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -10,7 +13,9 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
+#include <memory>
 #include <sstream>
+#include <utility>
 
 #include "core/protocol.h"
 #include "rsync/rsync_wrapper_impl.h"
@@ -44,6 +49,8 @@ class PrivateDir {
     PrivateDir(const PrivateDir&) = delete;
     PrivateDir& operator=(const PrivateDir&) = delete;
     const std::string& path() const { return path_; }
+    // The directory is no longer this object's to remove.
+    std::string Release() { return std::exchange(path_, std::string()); }
 
   private:
     std::string path_;
@@ -130,6 +137,45 @@ std::string WriteOutputFile(const std::string& path, const std::string& content)
     return why;
 }
 
+// True once the reply's result file is in place with a result code in it. rsync renames each
+// file into place only when it has it whole, and takes the output file before the result file
+// (the order of their names), so the whole reply is there by then.
+bool ReplyComplete(const std::string& replyDir) {
+    std::ifstream in(replyDir + "/" + reply::kResultFile);
+    std::stringstream text;
+    text << in.rdbuf();
+    int result = 0;
+    return in.is_open() && reply::ParseResult(text.str(), &result);
+}
+
+// An inotify descriptor watching a directory for files renamed into it (-1 when it cannot).
+class RenameWatch {
+  public:
+    explicit RenameWatch(const std::string& dir) : fd_(inotify_init1(IN_NONBLOCK | IN_CLOEXEC)) {
+        if (fd_ >= 0 && inotify_add_watch(fd_, dir.c_str(), IN_MOVED_TO) < 0) {
+            close(fd_);
+            fd_ = -1;
+        }
+    }
+    ~RenameWatch() {
+        if (fd_ >= 0) {
+            close(fd_);
+        }
+    }
+    RenameWatch(const RenameWatch&) = delete;
+    RenameWatch& operator=(const RenameWatch&) = delete;
+    int fd() const { return fd_; }
+    // Takes the events that made the descriptor readable.
+    void Drain() const {
+        char events[4096];
+        while (fd_ >= 0 && read(fd_, events, sizeof events) > 0) {
+        }
+    }
+
+  private:
+    int fd_;
+};
+
 // The local path the caller named in outfile="...", or "".
 std::string OutfileOf(const std::list<std::string>& lines) {
     static const std::string kPrefix = std::string(reply::kKeyOutfile) + "=\"";
@@ -187,7 +233,25 @@ int RsyncWrapper::Impl::ExecuteCommand(const boost::function<bool()>& cancel) {
     job.argv.push_back(Url(commandModule + "/" + token + "/"));
     job.argv.push_back(replyDir + "/");
     Environment(&job);
+    // The reply directory is made here so that it can be watched from the start.
+    bool complete = false;
+    std::unique_ptr<RenameWatch> watch;
+    if (mkdir(replyDir.c_str(), 0700) == 0) {
+        watch = std::make_unique<RenameWatch>(replyDir);
+    }
+    if (watch && watch->fd() >= 0) {
+        job.ready_fd = watch->fd();
+        job.ready = [&watch, &replyDir, &complete]() {
+            watch->Drain();
+            complete = ReplyComplete(replyDir);
+            return complete;
+        };
+        job.after_exit = [path = dir.path()]() { reply::RemoveTree(path); };
+    }
     int rc = Run(job, cancel, true);
+    if (complete) {
+        dir.Release();  // removed once rsync has ended
+    }
     if (rc != 0) {
         return rc;
     }

@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "core/protocol.h"
+#include "rsync/child_process.h"
 #include "rsync/path_list.h"
 #include "rsync/transfer_meter.h"
 #include "s2s_platform.h"
@@ -110,6 +111,16 @@ std::string Because(const std::string& lines) {
     }
     return joined.empty() ? joined : ": " + joined;
 }
+
+// Waits, when Run returns, for the command runs that were answered before rsync had ended: none
+// outlives the run.
+class LeftRunsFinisher {
+  public:
+    LeftRunsFinisher() = default;
+    ~LeftRunsFinisher() { rsync_internal::FinishLeftRuns(); }
+    LeftRunsFinisher(const LeftRunsFinisher&) = delete;
+    LeftRunsFinisher& operator=(const LeftRunsFinisher&) = delete;
+};
 
 // Sets the run of this thread for the life of Run.
 class CurrentRun {
@@ -627,6 +638,7 @@ RunFailure TaskRun::Run(const SyncTask& task) {
     Say("task \"" + task_.GetInfo().GetName() + "\": " + std::to_string(shares_.size()) + " share" +
         (shares_.size() == 1 ? "" : "s"));
 
+    LeftRunsFinisher finisher;
     CurrentRun current(this);
     rsyncer_.SetCancelChecker(&TaskRun::PollCurrent);
     // rsync reports its progress only when asked to; a run without a display does not ask.

@@ -1,10 +1,10 @@
 # shellcheck shell=bash
 # Shared set-up of the scripts that stage a sending and a receiving server on this one machine
-# (tools/demo.sh, bench/realtime_latency.sh, bench/sync_vs_rsync.sh): where the programs are, the
-# root check and the build, a server's root with its host file, the receiver's rsync daemon, a
-# password file only its owner reads, and generated trees of files. Source it from the
-# repository's top folder; it defines functions only, except the variables that
-# s2s_locate_build and s2s_stage set.
+# (tools/demo.sh, bench/realtime_latency.sh, bench/sync_vs_rsync.sh, bench/many_senders.sh): where
+# the programs are, the root check and the build, a server's root with its host file, the
+# receiver's rsync daemon, a password file only its owner reads, and generated trees of files.
+# Source it from the repository's top folder; it defines functions only, except the variables
+# that s2s_locate_build and s2s_stage set.
 
 # Sets repo (this folder), build (S2S_BUILD_DIR, default build) and bin (the programs).
 s2s_locate_build() {
@@ -21,8 +21,10 @@ s2s_require_root() {  # script-name why
   fi
 }
 
-# Configures the build folder (quietly) and builds the given targets in it.
+# Configures the build folder (quietly) and builds the given targets in it; with S2S_NO_BUILD
+# set, the programs already there are used as they are (an installed tree, an earlier build).
 s2s_build() {  # target...
+  [ -n "${S2S_NO_BUILD:-}" ] && return 0
   cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
   cmake --build "$build" -j "$(nproc)" --target "$@"
 }

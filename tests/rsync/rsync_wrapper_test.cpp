@@ -17,6 +17,7 @@
 #include <thread>
 
 #include "gtest/gtest.h"
+#include "rsync/child_process.h"
 #include "s2s_rsync_wrapper.h"
 #include "support/server_pair.h"
 #include "support/tree_manifest.h"
@@ -461,6 +462,17 @@ TEST_F(WrapperRun, CommandsReturnTheServersCodeAndOutput) {
     EXPECT_EQ(Command({"command=\"S2S_UpdateTaskStatus\"", "clientID=\"abc\"",
                        "taskName=\"" + std::string(5000, 't') + "\""}),
               RsyncWrapper::kResultUsage);
+    ExpectCleanSpool();
+}
+
+// A command answers once its reply is in place; the rest of rsync's run ends by the time
+// FinishLeftRuns returns, and its private folder with it.
+TEST_F(WrapperRun, CommandRunsLeaveNothingOnceFinished) {
+    TempDir tmp("s2s-cmd-tmp");
+    ScopedEnv env("TMPDIR", tmp.path().c_str());
+    EXPECT_EQ(Command({"command=\"S2S_NoSuchThing\"", "clientID=\"abc\""}), 43);
+    S2S::rsync_internal::FinishLeftRuns();
+    EXPECT_TRUE(fs::is_empty(tmp.path()));
     ExpectCleanSpool();
 }
 

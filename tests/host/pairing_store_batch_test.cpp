@@ -1,0 +1,51 @@
+// The receiver's batched store writer: updates other live writers have waiting go into the same
+// replacement, those of ended writers are dropped, and a write that changes nothing is skipped.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "host/pairing_store.h"
+#include "s2s_platform.h"
+#include "support/test_util.h"
+
+namespace {
+
+ino_t StoreInode() {
+    struct stat st = {};
+    stat(S2SPath(S2S_PATH_PAIRING_STORE), &st);
+    return st.st_ino;
+}
+
+TEST(PairingStoreBatch, WritesWaitingUpdatesOfLiveWritersAndSkipsNoOps) {
+    s2s_test::TempDir root("s2s-batch");
+    s2s_test::ScopedEnv env("S2S_ROOT", root.path().c_str());
+    const std::string queue = root.path() + "/usr/vurn/etc/.vurnS2S.info.queue";
+    ASSERT_EQ(system(("mkdir -p " + queue).c_str()), 0);
+    const pid_t ended = fork();
+    if (ended == 0) {
+        _exit(0);
+    }
+    waitpid(ended, nullptr, 0);
+    s2s_test::WriteFile(queue + "/" + std::to_string(getppid()) + "-1",
+                        "[TASK_SN2/t]\n\tstatus=\"5\"\n");
+    s2s_test::WriteFile(queue + "/" + std::to_string(ended) + "-1",
+                        "[TASK_SN3/t]\n\tstatus=\"6\"\n");
+
+    ASSERT_EQ(S2S::PairingStore::RecordTaskStatus("SN1/t", "4"), 0);
+    S2S::PairingStore::StoreContents store;
+    ASSERT_EQ(S2S::PairingStore::ReadStore(&store), 0);
+    ASSERT_NE(store.FindTask("SN2/t"), nullptr) << "a waiting writer's update was not written";
+    EXPECT_EQ(store.FindTask("SN3/t"), nullptr) << "an ended writer's update was written";
+    EXPECT_EQ(system(("test -z \"$(ls -A " + queue + ")\"").c_str()), 0) << "requests left";
+
+    const ino_t written = StoreInode();
+    ASSERT_EQ(S2S::PairingStore::RecordTaskStatus("SN1/t", "4"), 0);
+    EXPECT_EQ(StoreInode(), written) << "a write that changes nothing replaced the store";
+    ASSERT_EQ(S2S::PairingStore::RecordTaskStatus("SN1/t", "7"), 0);
+    EXPECT_NE(StoreInode(), written) << "a changed heartbeat was not written";
+}
+
+}  // namespace
