@@ -6,7 +6,7 @@ packages=(
   libgtest-dev libgmock-dev libbenchmark-dev libssl-dev openssl libboost-dev libmsgpack-cxx-dev
   rsync openssh-server openssh-client sshpass procps iproute2 util-linux nlohmann-json3-dev libcli11-dev tzdata
   libsqlite3-dev ccache
-  gcovr
+  gcovr python3
 )
 missing=()
 for p in "${packages[@]}"; do
