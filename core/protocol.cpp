@@ -147,7 +147,7 @@ bool ShareNameValid(const std::string& name) {
 
 bool ShareNameSyncable(const std::string& name) {
     return ShareNameValid(name) && name.front() != '@' &&
-           name.find_first_of("\"'`%") == std::string::npos &&
+           name.find_first_of("\"'`%:") == std::string::npos &&
            name.find("..") == std::string::npos && name.find("  ") == std::string::npos &&
            ShareModuleKey(name) != "global";
 }

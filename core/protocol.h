@@ -135,8 +135,8 @@ constexpr size_t kShareNameMax = 255;
 // A name the share registry can hold: valid UTF-8, 1..kShareNameMax bytes, no control
 // characters, none of / \ [ ], not "." or "..", no leading or trailing blank.
 bool ShareNameValid(const std::string& name);
-// A share that can be served and synced: a valid name without quotes, backquotes, '%' or "..",
-// not starting with '@' (the service's own modules and encrypted shares' "@name@"), without a run
+// A share that can be served and synced: a valid name without quotes, backquotes, '%', ".." or
+// ':' (the separator of "syncShares" and of the conflict list), not starting with '@' (the service's own modules and encrypted shares' "@name@"), without a run
 // of blanks, and not "global" in any folding. Such a name is also a literal value of the daemon's
 // configuration: no line break, no %VAR% expansion, no quote, no backslash, no outer blank.
 bool ShareNameSyncable(const std::string& name);

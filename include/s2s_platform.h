@@ -325,8 +325,9 @@ S2S_EXPORT int VURNShareNameIsValid(const char* name);
  * of blanks in a name becomes one blank (a share "a  b" would be served as "a b"). Both ends
  * use these two rules:
  * - VURNShareNameIsSyncable: 1 when `name` can be synced at all: a valid share name without
- *   quotes, backquotes, '%' or "..", not starting with '@' (reserved for the service's own modules
- *   and for encrypted shares' "@name@"), without a run of blanks, and not "global" in any case.
+ *   quotes, backquotes, '%', ':' (it joins share names on the wire) or "..", not starting
+ *   with '@' (reserved for the service's own modules and for encrypted shares' "@name@"),
+ *   without a run of blanks, and not "global" in any case.
  * - VURNShareModuleKey: the folded form (ASCII lower case, blanks removed) into buf; two shares
  *   with one key would be one module. Its length, or negative (VLIB_ERR_BUFFER_TOO_SMALL).
  * VURNShareSet refuses a name whose key equals another registered share's (VLIB_ERR_NAME_TAKEN);

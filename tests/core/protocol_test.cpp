@@ -47,6 +47,7 @@ TEST(ShareNameRule, DecidesEveryKindOfName) {
         {"say\"hi\"", true, false},
         {"back`tick", true, false},
         {"100%", true, false},
+        {"a:b", true, false},  // would split where share names are joined
     };
     for (const NameCase& c : cases) {
         EXPECT_EQ(protocol::ShareNameValid(c.name), c.valid) << c.name;
