@@ -65,7 +65,7 @@ int Logger::Initialize(Type type, int level, const std::string& path, int count)
     if (path.empty()) {
         return -1;
     }
-    FILE* fp = std::fopen(path.c_str(), "a");
+    FILE* fp = std::fopen(path.c_str(), "ae");
     if (fp == nullptr) {
         return -1;
     }
@@ -139,7 +139,7 @@ int Logger::Rotate() {
     if (std::rename(log_path.c_str(), RotatedName(0).c_str()) != 0) {
         return -1;
     }
-    FILE* fp = std::fopen(log_path.c_str(), "a");
+    FILE* fp = std::fopen(log_path.c_str(), "ae");
     if (fp == nullptr) {
         return -1;
     }
@@ -152,7 +152,7 @@ int Logger::Reopen(mode_t mode) {
         errno = EINVAL;
         return -1;
     }
-    FILE* fresh = std::fopen(log_path.c_str(), "a");
+    FILE* fresh = std::fopen(log_path.c_str(), "ae");
     if (fresh == nullptr) {
         return -1;
     }
