@@ -81,12 +81,17 @@ void RemoveStale(const std::string& dir, const std::string& prefix) {
 // In the child between fork and exec: async-signal-safe calls only. Never returns.
 [[noreturn]] void ExecChild(const SpawnSpec& spec, char* const* argv, char* const* envp,
                             int null_fd, int report_fd) {
+    // Every disposition back to its default before the mask opens: an ignored signal would stay
+    // ignored across exec, and a handler of ours must not run in the child.
+    struct sigaction dfl {};
+    dfl.sa_handler = SIG_DFL;
+    sigemptyset(&dfl.sa_mask);
+    for (int sig = 1; sig < NSIG; ++sig) {
+        sigaction(sig, &dfl, nullptr);  // SIGKILL, SIGSTOP and unused numbers refuse: harmless
+    }
     sigset_t none;
     sigemptyset(&none);
     sigprocmask(SIG_SETMASK, &none, nullptr);
-    signal(SIGPIPE, SIG_DFL);
-    signal(SIGTERM, SIG_DFL);
-    signal(SIGINT, SIG_DFL);
     int out = spec.output_fd >= 0 ? spec.output_fd : null_fd;
     int error = spec.error_fd >= 0 ? spec.error_fd : null_fd;
     bool ok = dup2(null_fd, 0) >= 0 && dup2(out, 1) >= 0 && dup2(error, 2) >= 0;
