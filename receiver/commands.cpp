@@ -326,7 +326,7 @@ int GetProtocolVer(const Command& c, ReceiverAnswer* a) {
     return protocol::kOK;
 }
 
-// Both pairing commands carry "dry_run" as yes or no and a server name the store can hold.
+// Both pairing commands carry "dryRun" as yes or no and a server name the store can hold.
 bool PairingKeysValid(const Command& c, bool* dryRun) {
     return YesNo(c.Get(protocol::kKeyDryRun), dryRun) &&
            ValidServerName(c.Get(protocol::kKeyServerName));
