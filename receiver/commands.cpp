@@ -326,22 +326,27 @@ int GetProtocolVer(const Command& c, ReceiverAnswer* a) {
     return protocol::kOK;
 }
 
-// Both pairing commands carry "dryRun" as yes or no and a server name the store can hold.
-bool PairingKeysValid(const Command& c, bool* dryRun) {
-    return YesNo(c.Get(protocol::kKeyDryRun), dryRun) &&
-           ValidServerName(c.Get(protocol::kKeyServerName));
-}
-
-int Pairing(const Command& c) {
-    int rc = c.Keys({protocol::kKeyDryRun, protocol::kKeyServerName}, {});
+// Both pairing commands carry exactly `keys`, among them "dryRun" as yes or no and a server name
+// the store can hold: 0 with *dryRun set, else the command's answer (a key missing or unknown,
+// or malformed).
+int CheckPairingKeys(const Command& c, const std::set<std::string>& keys, bool* dryRun) {
+    int rc = c.Keys(keys, {});
     if (rc != 0) {
         return rc;
     }
+    return YesNo(c.Get(protocol::kKeyDryRun), dryRun) &&
+                   ValidServerName(c.Get(protocol::kKeyServerName))
+               ? 0
+               : protocol::kMalformed;
+}
+
+int Pairing(const Command& c) {
     bool dryRun = false;
-    const std::string& serverName = c.Get(protocol::kKeyServerName);
-    if (!PairingKeysValid(c, &dryRun)) {
-        return protocol::kMalformed;
+    int rc = CheckPairingKeys(c, {protocol::kKeyDryRun, protocol::kKeyServerName}, &dryRun);
+    if (rc != 0) {
+        return rc;
     }
+    const std::string& serverName = c.Get(protocol::kKeyServerName);
     StoreContents store;
     if (!LoadStore(&store)) {
         return protocol::kStoreRead;
@@ -374,17 +379,15 @@ int PairingMultiSrc(const Command& c, ReceiverAnswer* a) {
     if (c.OldServer()) {
         return protocol::kUnknownCommand;
     }
-    int rc = c.Keys({protocol::kKeyServerName, protocol::kKeySyncShares, protocol::kKeyDryRun,
-                     protocol::kKeyOutfile},
-                    {});
+    bool dryRun = false;
+    int rc = CheckPairingKeys(c,
+                              {protocol::kKeyServerName, protocol::kKeySyncShares,
+                               protocol::kKeyDryRun, protocol::kKeyOutfile},
+                              &dryRun);
     if (rc != 0) {
         return rc;
     }
-    bool dryRun = false;
     const std::string& serverName = c.Get(protocol::kKeyServerName);
-    if (!PairingKeysValid(c, &dryRun)) {
-        return protocol::kMalformed;
-    }
     std::vector<std::string> shares;
     const std::string& joined = c.Get(protocol::kKeySyncShares);
     size_t start = 0;
