@@ -132,6 +132,15 @@ S2S_EXPORT SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::strin
                                               const std::list<std::string>& excludes,
                                               const SourceGuardOptions& options, bool (*cancel)());
 
+// CheckShareSource in two halves, for a caller that makes the check on another thread (with an
+// Rsyncer of its own) while its own Rsyncer sends commands: AssessShareSource inspects, makes the
+// dry run and judges, and touches no deletion limit; EnforceShareSource then puts the verdict on
+// the data run of `rsyncer` as CheckShareSource does, logs a refusal, and returns the report.
+S2S_EXPORT SourceGuardReport AssessShareSource(Rsyncer& rsyncer, const std::string& shareName,
+                                               const std::list<std::string>& excludes,
+                                               const SourceGuardOptions& options, bool (*cancel)());
+S2S_EXPORT SourceGuardReport EnforceShareSource(Rsyncer& rsyncer, const SourceGuardReport& report);
+
 // The check before RunSyncPaths of `paths` (see above). Sets `whole` when the share must be
 // checked with CheckShareSource and copied whole instead (the report is then kSafe and says
 // nothing). Otherwise it sets the Rsyncer's deletion limit like CheckShareSource: the task's limit

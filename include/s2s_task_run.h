@@ -15,6 +15,7 @@
 #include <cstdint>
 #include <list>
 #include <map>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -163,6 +164,7 @@ class S2S_EXPORT TaskRun {
     bool GuardSource(ShareOutcome& share);
     bool Judge(ShareOutcome& share, const SourceGuardReport& guard);
     bool PrepareWhole(ShareOutcome& share, const std::string& folder);
+    void StartCheckAhead();
     void Fail(RunFailure failure, const std::string& message);
     void Say(const std::string& line);
     bool Cancelled();
@@ -170,6 +172,7 @@ class S2S_EXPORT TaskRun {
     void PollCopy();
 
     struct CopyWatch;
+    class CheckAhead;
 
     TaskRunObserver* observer_;
     TaskRunObserver silent_;
@@ -193,7 +196,8 @@ class S2S_EXPORT TaskRun {
     KnownServer known_;
     bool used_known_ = false;  // this run took the server (and maybe the pairing) as known
     bool paired_ = false;
-    CopyWatch* watch_ = nullptr;  // the copy in progress, while RunSync runs
+    CopyWatch* watch_ = nullptr;         // the copy in progress, while RunSync runs
+    std::unique_ptr<CheckAhead> ahead_;  // the first share's source check, made meanwhile
 };
 
 // A remote result code (rsync's own exit codes, the server's answers, the client's local codes)

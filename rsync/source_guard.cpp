@@ -338,9 +338,11 @@ SourceGuardReport DryRunFailed(const std::string& shareName, int result) {
     return report;
 }
 
+}  // namespace
+
 // Puts the verdict on the coming data run: its deletion limit, or no deletion at all when the
 // run is refused (the refusal is logged).
-SourceGuardReport Enforce(Rsyncer& rsyncer, const SourceGuardReport& report) {
+SourceGuardReport EnforceShareSource(Rsyncer& rsyncer, const SourceGuardReport& report) {
     rsyncer.SetMaxDelete(report.result == SourceGuardResult::kSafe ? report.allowedDeletions : 0);
     if (report.result != SourceGuardResult::kSafe) {
         Logger::LogMsg(Logger::Warning, "[WARNING] source_guard.cpp(%d): %s\n", __LINE__,
@@ -349,11 +351,16 @@ SourceGuardReport Enforce(Rsyncer& rsyncer, const SourceGuardReport& report) {
     return report;
 }
 
-}  // namespace
-
 SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::string& shareName,
                                    const std::list<std::string>& excludes,
                                    const SourceGuardOptions& options, bool (*cancel)()) {
+    return EnforceShareSource(rsyncer,
+                              AssessShareSource(rsyncer, shareName, excludes, options, cancel));
+}
+
+SourceGuardReport AssessShareSource(Rsyncer& rsyncer, const std::string& shareName,
+                                    const std::list<std::string>& excludes,
+                                    const SourceGuardOptions& options, bool (*cancel)()) {
     SourceGuardReport report;
     SourceState source;
     if (Examine(rsyncer, shareName, source, report)) {
@@ -368,7 +375,7 @@ SourceGuardReport CheckShareSource(Rsyncer& rsyncer, const std::string& shareNam
             report = JudgeShareSource(shareName, source, options, receiver);
         }
     }
-    return Enforce(rsyncer, report);
+    return report;
 }
 
 SourceGuardReport CheckChangedPaths(Rsyncer& rsyncer, const std::string& shareName,
@@ -417,7 +424,7 @@ SourceGuardReport CheckChangedPaths(Rsyncer& rsyncer, const std::string& shareNa
         report.allowedDeletions = gone;
     }
     report.source = source;
-    return Enforce(rsyncer, report);
+    return EnforceShareSource(rsyncer, report);
 }
 
 }  // namespace S2S

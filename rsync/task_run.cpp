@@ -6,6 +6,10 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <atomic>
+#include <functional>
+#include <future>
+#include <memory>
 #include <utility>
 
 #include "core/protocol.h"
@@ -28,6 +32,13 @@ constexpr int kResultVanished = 24;
 
 // The run on this thread; the rsync driver's cancel checker is a plain function.
 thread_local TaskRun* t_current = nullptr;
+
+// On a thread that makes a source check ahead of its run: the flag that stops it.
+thread_local const std::atomic<bool>* t_ahead_stop = nullptr;
+
+bool AheadStopped() {
+    return t_ahead_stop != nullptr && t_ahead_stop->load();
+}
 
 double SecondsSince(TaskRun::Clock::time_point start) {
     return std::chrono::duration<double>(TaskRun::Clock::now() - start).count();
@@ -175,6 +186,63 @@ struct TaskRun::CopyWatch {
     ShareOutcome* share = nullptr;
     TransferMeter meter;
     int percent = -1;
+};
+
+// The source check of the run's first share (its walk and its dry run), made on a thread of its
+// own with an Rsyncer of its own while the run's connection test, version query and pairing go
+// out: the dry run changes nothing on the server, so the order of what the server sees is the
+// same, and the cold walks of both trees no longer wait for those commands. Its verdict counts
+// only for the share and the server address it was made for; the deletion limit it yields is put
+// on the run's own Rsyncer as always (EnforceShareSource), so a folder emptied after the check
+// still cannot empty the receiver's copy.
+class TaskRun::CheckAhead {
+  public:
+    CheckAhead(const SyncInfo& info, std::string address, std::string share,
+               std::list<std::string> excludes, const SourceGuardOptions& options)
+        : address_(std::move(address)), share_(std::move(share)) {
+        done_ = std::async(std::launch::async, [this, info, excludes, options]() {
+            t_ahead_stop = &stop_;
+            Rsyncer rsyncer;
+            rsyncer.Adopt(info, address_, -1);
+            rsyncer.SetCancelChecker(&AheadStopped);
+            ShareInfo facts;
+            if (rsyncer.GetShareInfo(share_, facts) == 0) {
+                size_ = MeasureTree(facts.GetModulePath());
+            }
+            report_ = AssessShareSource(rsyncer, share_, excludes, options, &AheadStopped);
+        });
+    }
+    ~CheckAhead() {
+        stop_ = true;  // the future's end waits for the thread
+    }
+    CheckAhead(const CheckAhead&) = delete;
+    CheckAhead& operator=(const CheckAhead&) = delete;
+
+    // Waits for the check and takes its outcome when it was made for `share` at `address`; a
+    // cancel seen meanwhile stops it (its report then refuses the share). False: check afresh.
+    bool Take(const std::string& share, const std::string& address,
+              const std::function<bool()>& cancelled, TreeSize& size, SourceGuardReport& report) {
+        if (share != share_ || address != address_) {
+            return false;
+        }
+        while (done_.wait_for(std::chrono::milliseconds(200)) != std::future_status::ready) {
+            if (cancelled()) {
+                stop_ = true;
+            }
+        }
+        done_.get();
+        size = size_;
+        report = report_;
+        return true;
+    }
+
+  private:
+    std::atomic<bool> stop_{false};
+    const std::string address_;
+    const std::string share_;
+    TreeSize size_;
+    SourceGuardReport report_;
+    std::future<void> done_;  // last: destroyed (and waited for) first
 };
 
 TaskRun::TaskRun(TaskRunObserver* observer)
@@ -415,10 +483,20 @@ bool TaskRun::Judge(ShareOutcome& share, const SourceGuardReport& guard) {
 
 // Measures the whole share and checks its source; false when the share is refused.
 bool TaskRun::PrepareWhole(ShareOutcome& share, const std::string& folder) {
-    const TreeSize size = MeasureTree(folder);
+    share.changed_paths = 0;
+    const std::unique_ptr<CheckAhead> ahead = std::move(ahead_);
+    TreeSize size;
+    SourceGuardReport report;
+    if (ahead != nullptr &&
+        ahead->Take(
+            share.name, settled_address_, [this]() { return Cancelled(); }, size, report)) {
+        share.files = size.files;
+        share.bytes = size.bytes;
+        return Judge(share, EnforceShareSource(rsyncer_, report));
+    }
+    size = MeasureTree(folder);
     share.files = size.files;
     share.bytes = size.bytes;
-    share.changed_paths = 0;
     return GuardSource(share);
 }
 
@@ -621,6 +699,24 @@ void TaskRun::SyncShare(ShareOutcome& share) {
     share.state = ShareState::kSynced;
 }
 
+// Only where the address is known before the server is tested (given as an address, or the
+// one an earlier run settled on), for a share copied whole, and not over SSH (its login check
+// belongs to the run's thread).
+void TaskRun::StartCheckAhead() {
+    ahead_.reset();
+    const SyncInfo& info = task_.GetInfo().GetSyncInfo();
+    const std::string address = used_known_ ? known_.address : info.GetServerIP();
+    if (shares_.empty() || address.empty() || info.UseSSH()) {
+        return;
+    }
+    const std::string& share = shares_.front().name;
+    const auto changed = changed_.find(share);
+    if (changed != changed_.end() && !changed->second.empty()) {
+        return;
+    }
+    ahead_ = std::make_unique<CheckAhead>(info, address, share, excludes_, guard_);
+}
+
 RunFailure TaskRun::Run(const SyncTask& task) {
     task_ = task;
     started_ = Clock::now();
@@ -640,6 +736,11 @@ RunFailure TaskRun::Run(const SyncTask& task) {
 
     LeftRunsFinisher finisher;
     CurrentRun current(this);
+    // A check made ahead and not taken (the run ended before its share) is stopped when Run ends.
+    struct AheadEnd {
+        std::unique_ptr<CheckAhead>& ahead;
+        ~AheadEnd() { ahead.reset(); }
+    } aheadEnd{ahead_};
     rsyncer_.SetCancelChecker(&TaskRun::PollCurrent);
     // rsync reports its progress only when asked to; a run without a display does not ask.
     if (observer_->WantsProgress()) {
@@ -651,6 +752,7 @@ RunFailure TaskRun::Run(const SyncTask& task) {
     }
     Clock::time_point step = Clock::now();
     used_known_ = !known_.address.empty();
+    StartCheckAhead();
     bool connected = true;
     if (used_known_) {
         rsyncer_.Adopt(info, known_.address, known_.version);

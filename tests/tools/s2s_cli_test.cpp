@@ -290,6 +290,8 @@ TEST_F(Sync, EachFailureHasItsExitClassMessageAndJson) {
         // An emptied folder, or a volume that should be a mount point and is not: what lies
         // there is not the share, and would wipe the receiver's copy.
         {"docs --json", emptied, 12, "--allow-empty-source", "\"guard\": \"empty-source\""},
+        // The first share is checked while the server is tested: its verdict is not the next's.
+        {"media docs --json", emptied, 12, "--allow-empty-source", "\"guard\": \"empty-source\""},
         {"docs --allow-empty-source", nullptr, 0, ""},
         {"media --json --allow-empty-source", unmounted, 12, "",
          "\"guard\": \"volume-not-mounted\""},
