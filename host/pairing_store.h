@@ -4,6 +4,8 @@
 #ifndef S2S_HOST_PAIRING_STORE_H
 #define S2S_HOST_PAIRING_STORE_H
 
+#include <sys/types.h>
+
 #include <optional>
 #include <string>
 #include <utility>
@@ -104,6 +106,9 @@ struct SectionUpdate {
 // S2SUpdateServerInfo it may set several sections at once and logs through the library's logger.
 // 0, or -1 with the platform error set (VLIB_ERR_TOO_LARGE: nothing was written).
 int ApplyUpdates(const std::vector<SectionUpdate>& updates);
+// The name of the queued request of process `pid`'s `sequence`th update: its pid, when it started
+// (so that a request outlives no reuse of the pid) and the sequence.
+std::string RequestName(pid_t pid, unsigned sequence);
 
 // Sets the fields of the share's record that `fields` sets, keeping the others (the record is
 // added when missing), through ApplyUpdates. 0, or -1 as ApplyUpdates.

@@ -6,15 +6,22 @@
 // semaphore was written durably by someone else, and the writer answers at once; one still there
 // makes its writer the next to write. Invariant: a request file exists until its update is
 // durable in the store, or until its writer gives up on it (failure, death).
+//
+// The queue is trusted only as a private directory of the store's writer (a real directory, ours,
+// mode 0700); otherwise each writer writes alone. Only regular files of ours named
+// "<pid>-<start>-<sequence>" whose process is still the one that wrote them are applied, the
+// holder's own update last; nothing else in the queue is read or removed.
 #include <dirent.h>
 #include <fcntl.h>
-#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <string>
 #include <utility>
 #include <vector>
@@ -37,7 +44,9 @@ class SemaphoreHold {
     SemaphoreHold() = default;
     ~SemaphoreHold() {
         if (sem_ != nullptr) {
-            VLIBCSemClose(sem_);  // releases it when held
+            const int error = VLIBCErrGet();  // closing must not hide why the write failed
+            VLIBCSemClose(sem_);              // releases it when held
+            VLIBCErrSet(error);
         }
     }
     SemaphoreHold(const SemaphoreHold&) = delete;
@@ -57,14 +66,44 @@ std::string QueueDir(const std::string& store) {
     return dir + "/." + store.substr(slash + 1) + ".queue";
 }
 
-// The writer's pid from a request's name "<pid>-<sequence>"; 0 when it is not one.
-pid_t WriterOf(const std::string& name) {
-    const size_t dash = name.find('-');
-    if (dash == 0 || dash == std::string::npos ||
-        name.find_first_not_of("0123456789-") != std::string::npos) {
+// When process `pid` started, in clock ticks since boot (field 22 of /proc/<pid>/stat): with the
+// pid it names one process even after the pid is used again. 0 when there is no such process.
+unsigned long long ProcessStart(pid_t pid) {
+    std::FILE* f = std::fopen(("/proc/" + std::to_string(pid) + "/stat").c_str(), "re");
+    if (f == nullptr) {
         return 0;
     }
-    return static_cast<pid_t>(std::strtol(name.substr(0, dash).c_str(), nullptr, 10));
+    char buf[1024];
+    const size_t n = std::fread(buf, 1, sizeof buf - 1, f);
+    std::fclose(f);
+    buf[n] = '\0';
+    const char* p = std::strrchr(buf, ')');  // the command name may hold blanks and parentheses
+    for (int field = 2; p != nullptr && field < 22; ++field) {
+        p = std::strchr(p + 1, ' ');
+    }
+    return p == nullptr ? 0 : std::strtoull(p + 1, nullptr, 10);
+}
+
+// True when `name` is a request "<pid>-<start>-<sequence>" of a process that still runs.
+bool WriterAlive(const std::string& name) {
+    const size_t first = name.find('-');
+    const size_t second = first == std::string::npos ? first : name.find('-', first + 1);
+    if (first == 0 || second == std::string::npos || second == first + 1 ||
+        second + 1 == name.size() || name.find('-', second + 1) != std::string::npos ||
+        name.find_first_not_of("0123456789-") != std::string::npos) {
+        return false;
+    }
+    const long pid = std::strtol(name.c_str(), nullptr, 10);
+    const unsigned long long start = pid > 0 ? ProcessStart(static_cast<pid_t>(pid)) : 0;
+    return start != 0 && start == std::strtoull(name.c_str() + first + 1, nullptr, 10);
+}
+
+// True when `path` is a private directory of this process's user: a request there can only
+// have been written by a writer of the store.
+bool PrivateDir(const std::string& path) {
+    struct stat st;
+    return lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode) && st.st_uid == geteuid() &&
+           (st.st_mode & 077) == 0;
 }
 
 // Writes the request whole under a hidden name and renames it into the queue, so that the one
@@ -94,10 +133,12 @@ bool PutRequest(const std::string& queue, const std::string& name, const std::st
 struct Request {
     std::string path;
     SectionDoc doc;
+    struct timespec queued {};
 };
 
-// The requests waiting in the queue, `own` first. Requests of writers that have ended are
-// removed unapplied: nobody waits for their answer.
+// The requests waiting in the queue, `own` first, the others in the order they were queued.
+// Requests of writers that have ended are removed unapplied: nobody waits for their answer. A
+// name that is not a request, or an entry that is not a regular file of ours, is left alone.
 std::vector<Request> WaitingRequests(const std::string& queue, const std::string& own) {
     std::vector<Request> requests(1);
     requests[0].path = own;
@@ -108,24 +149,32 @@ std::vector<Request> WaitingRequests(const std::string& queue, const std::string
     while (const struct dirent* e = readdir(d)) {
         const std::string name = e->d_name;
         const std::string path = queue + "/" + name;
-        if (name[0] == '.' || path == own) {
+        struct stat st;
+        if (name[0] == '.' || path == own || name.find_first_not_of("0123456789-") != name.npos ||
+            lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
             continue;
         }
-        const pid_t writer = WriterOf(name);
-        if (writer <= 0 || (kill(writer, 0) != 0 && errno == ESRCH)) {
+        if (!WriterAlive(name)) {
             unlink(path.c_str());
             continue;
         }
-        requests.push_back(Request{path, SectionDoc()});
+        requests.push_back(Request{path, SectionDoc(), st.st_mtim});
     }
     closedir(d);
+    std::sort(requests.begin() + 1, requests.end(), [](const Request& a, const Request& b) {
+        return a.queued.tv_sec != b.queued.tv_sec ? a.queued.tv_sec < b.queued.tv_sec
+                                                  : a.queued.tv_nsec < b.queued.tv_nsec;
+    });
     return requests;
 }
 
-// Sets every request's pairs in `doc`. 1 when that changed the document, 0 when not.
+// Sets every request's pairs in `doc`, the others' in their order and the holder's own
+// (requests[0]) last, so that its answer matches what the store holds. 1 when that changed the
+// document, 0 when not.
 int Apply(const std::vector<Request>& requests, SectionDoc& doc) {
     int changed = 0;
-    for (const Request& request : requests) {
+    for (size_t i = 1; i <= requests.size(); ++i) {
+        const Request& request = requests[i % requests.size()];
         for (const std::string& section : request.doc.SectionNames()) {
             const s2s_platform::Pairs pairs = request.doc.SectionPairs(section);
             for (const auto& pair : pairs) {
@@ -152,6 +201,11 @@ int Write(const std::string& store, const std::vector<Request>& requests) {
 }
 
 }  // namespace
+
+std::string RequestName(pid_t pid, unsigned sequence) {
+    return std::to_string(pid) + "-" + std::to_string(ProcessStart(pid)) + "-" +
+           std::to_string(sequence);
+}
 
 int ApplyUpdates(const std::vector<SectionUpdate>& updates) {
     const char* path = S2SPath(S2S_PATH_PAIRING_STORE);
@@ -183,10 +237,10 @@ int ApplyUpdates(const std::vector<SectionUpdate>& updates) {
         return -1;
     }
     const std::string queue = QueueDir(store);
-    const std::string name = std::to_string(getpid()) + "-" + std::to_string(g_sequence++);
+    const std::string name = RequestName(getpid(), g_sequence++);
     own.path = queue + "/" + name;
-    const bool queued =
-        (mkdir(queue.c_str(), 0700) == 0 || errno == EEXIST) && PutRequest(queue, name, text);
+    const bool queued = (mkdir(queue.c_str(), 0700) == 0 || errno == EEXIST) && PrivateDir(queue) &&
+                        PutRequest(queue, name, text);
 
     SemaphoreHold hold;
     if (!hold.Acquire()) {
@@ -207,7 +261,7 @@ int ApplyUpdates(const std::vector<SectionUpdate>& updates) {
     for (size_t i = 1; i < requests.size(); ++i) {
         // A request that cannot be read stays for its writer, who then writes it alone.
         if (s2s_platform::LoadSectionFile(requests[i].path, requests[i].doc) == 0) {
-            std::swap(requests[taken++], requests[i]);
+            std::swap(requests[taken++], requests[i]);  // keeps the queued order
         }
     }
     requests.resize(taken);

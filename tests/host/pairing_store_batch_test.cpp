@@ -23,23 +23,33 @@ TEST(PairingStoreBatch, WritesWaitingUpdatesOfLiveWritersAndSkipsNoOps) {
     s2s_test::TempDir root("s2s-batch");
     s2s_test::ScopedEnv env("S2S_ROOT", root.path().c_str());
     const std::string queue = root.path() + "/usr/vurn/etc/.vurnS2S.info.queue";
-    ASSERT_EQ(system(("mkdir -p " + queue).c_str()), 0);
+    ASSERT_EQ(system(("mkdir -p -m 700 " + queue).c_str()), 0);
     const pid_t ended = fork();
     if (ended == 0) {
         _exit(0);
     }
     waitpid(ended, nullptr, 0);
-    s2s_test::WriteFile(queue + "/" + std::to_string(getppid()) + "-1",
-                        "[TASK_SN2/t]\n\tstatus=\"5\"\n");
-    s2s_test::WriteFile(queue + "/" + std::to_string(ended) + "-1",
-                        "[TASK_SN3/t]\n\tstatus=\"6\"\n");
+    using S2S::PairingStore::RequestName;
+    // A live writer's request (its value of SN1/t loses to the holder's own), an ended writer's,
+    // one of a process that had the parent's pid before, and a file that is no request at all.
+    s2s_test::WriteFile(queue + "/" + RequestName(getppid(), 1),
+                        "[TASK_SN2/t]\n\tstatus=\"5\"\n[TASK_SN1/t]\n\tstatus=\"8\"\n");
+    s2s_test::WriteFile(queue + "/" + RequestName(ended, 1), "[TASK_SN3/t]\n\tstatus=\"6\"\n");
+    s2s_test::WriteFile(queue + "/" + std::to_string(getppid()) + "-1-2",
+                        "[TASK_SN4/t]\n\tstatus=\"6\"\n");
+    s2s_test::WriteFile(queue + "/notes.txt", "[pair]\n\tclientID=\"EVIL\"\n");
 
     ASSERT_EQ(S2S::PairingStore::RecordTaskStatus("SN1/t", "4"), 0);
     S2S::PairingStore::StoreContents store;
     ASSERT_EQ(S2S::PairingStore::ReadStore(&store), 0);
     ASSERT_NE(store.FindTask("SN2/t"), nullptr) << "a waiting writer's update was not written";
     EXPECT_EQ(store.FindTask("SN3/t"), nullptr) << "an ended writer's update was written";
-    EXPECT_EQ(system(("test -z \"$(ls -A " + queue + ")\"").c_str()), 0) << "requests left";
+    EXPECT_EQ(store.FindTask("SN4/t"), nullptr) << "a request of a reused pid was written";
+    ASSERT_NE(store.FindTask("SN1/t"), nullptr);
+    EXPECT_EQ(store.FindTask("SN1/t")->status, "4") << "the holder's update was not applied last";
+    EXPECT_EQ(store.pairedClientID, "") << "a file that is no request was applied";
+    EXPECT_EQ(system(("test \"$(ls -A " + queue + ")\" = notes.txt").c_str()), 0)
+        << "requests left, or a file that is no request removed";
 
     const ino_t written = StoreInode();
     ASSERT_EQ(S2S::PairingStore::RecordTaskStatus("SN1/t", "4"), 0);
