@@ -186,6 +186,7 @@ class LeftRuns {
     LeftRuns& operator=(const LeftRuns&) = delete;
 
     void Add(LeftRun run) { runs_.push_back(std::move(run)); }
+    bool Empty() const { return runs_.empty(); }
 
     // Reaps the runs that have ended, without waiting.
     void ReapEnded() {
@@ -250,11 +251,22 @@ class LeftRuns {
 const LineSink LeftRuns::kNoSink;
 
 thread_local LeftRuns t_left_runs;
+thread_local int t_left_runs_scopes = 0;
 
 }  // namespace
 
 void FinishLeftRuns() {
     t_left_runs.Finish();
+}
+
+LeftRunsScope::LeftRunsScope() {
+    ++t_left_runs_scopes;
+}
+
+LeftRunsScope::~LeftRunsScope() {
+    if (--t_left_runs_scopes == 0) {
+        t_left_runs.Finish();
+    }
 }
 
 std::string FindProgram(const std::string& program) {
@@ -329,10 +341,12 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
             pfds[count++] = {pid_fd.get(), POLLIN, 0};
         }
         const nfds_t readyAt = count;
-        if (!reaped && job.ready && job.ready_fd >= 0) {
+        if (!reaped && job.ready && job.ready_fd >= 0 && t_left_runs_scopes > 0) {
             pfds[count++] = {job.ready_fd, POLLIN, 0};
         }
-        int timeout = cancel ? kPollMillis : -1;
+        // Runs left earlier are reaped while this one goes on, not only after it.
+        t_left_runs.ReapEnded();
+        int timeout = cancel || !t_left_runs.Empty() ? kPollMillis : -1;
         if (!reaped && pid_fd.get() < 0) {
             timeout = eof ? kReapCheckMillis : std::min(kPollMillis, 4 * kReapCheckMillis);
         }

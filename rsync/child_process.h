@@ -6,8 +6,10 @@
 // waits for the child itself).
 //
 // A caller that learns from the child's files that it has everything it needs (a command run's
-// reply) may let the child end in the background: it is then left to its thread, which reaps it
-// at its next RunChild, at FinishLeftRuns, and at the latest when the thread ends.
+// reply) may let the child end in the background, but only on a thread inside a LeftRunsScope:
+// the child is then left to its thread, which reaps it as soon as it has ended while a later
+// RunChild runs, at FinishLeftRuns, and at the latest when the scope ends. Elsewhere (a library
+// user's own call) every run is waited for before RunChild returns.
 #ifndef S2S_RSYNC_CHILD_PROCESS_H
 #define S2S_RSYNC_CHILD_PROCESS_H
 
@@ -57,6 +59,16 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
 // Waits until every child this thread left running has ended (reaped, its `after_exit` called).
 // A child that takes longer than rsync's own end would is stopped as a cancelled one is.
 void FinishLeftRuns();
+
+// While one lives on a thread, RunChild there may leave children to end in the background; its
+// end waits for them (FinishLeftRuns). Scopes nest.
+class LeftRunsScope {
+  public:
+    LeftRunsScope();
+    ~LeftRunsScope();
+    LeftRunsScope(const LeftRunsScope&) = delete;
+    LeftRunsScope& operator=(const LeftRunsScope&) = delete;
+};
 
 // The absolute path of `program` (returned as is when it holds a '/'), or "" when PATH has none.
 std::string FindProgram(const std::string& program);

@@ -123,16 +123,6 @@ std::string Because(const std::string& lines) {
     return joined.empty() ? joined : ": " + joined;
 }
 
-// Waits, when Run returns, for the command runs that were answered before rsync had ended: none
-// outlives the run.
-class LeftRunsFinisher {
-  public:
-    LeftRunsFinisher() = default;
-    ~LeftRunsFinisher() { rsync_internal::FinishLeftRuns(); }
-    LeftRunsFinisher(const LeftRunsFinisher&) = delete;
-    LeftRunsFinisher& operator=(const LeftRunsFinisher&) = delete;
-};
-
 // Sets the run of this thread for the life of Run.
 class CurrentRun {
   public:
@@ -734,7 +724,8 @@ RunFailure TaskRun::Run(const SyncTask& task) {
     Say("task \"" + task_.GetInfo().GetName() + "\": " + std::to_string(shares_.size()) + " share" +
         (shares_.size() == 1 ? "" : "s"));
 
-    LeftRunsFinisher finisher;
+    // Command runs may answer before rsync has ended; Run waits for them before it returns.
+    rsync_internal::LeftRunsScope leftRuns;
     CurrentRun current(this);
     // A check made ahead and not taken (the run ended before its share) is stopped when Run ends.
     struct AheadEnd {

@@ -465,13 +465,17 @@ TEST_F(WrapperRun, CommandsReturnTheServersCodeAndOutput) {
     ExpectCleanSpool();
 }
 
-// A command answers once its reply is in place; the rest of rsync's run ends by the time
-// FinishLeftRuns returns, and its private folder with it.
+// A command answers once its reply is in place; inside a LeftRunsScope the rest of rsync's run
+// ends by the scope's end, elsewhere before execute() returns, and its private folder with it.
 TEST_F(WrapperRun, CommandRunsLeaveNothingOnceFinished) {
     TempDir tmp("s2s-cmd-tmp");
     ScopedEnv env("TMPDIR", tmp.path().c_str());
     EXPECT_EQ(Command({"command=\"S2S_NoSuchThing\"", "clientID=\"abc\""}), 43);
-    S2S::rsync_internal::FinishLeftRuns();
+    EXPECT_TRUE(fs::is_empty(tmp.path())) << "a library user's execute() left rsync running";
+    {
+        S2S::rsync_internal::LeftRunsScope scope;
+        EXPECT_EQ(Command({"command=\"S2S_NoSuchThing\"", "clientID=\"abc\""}), 43);
+    }
     EXPECT_TRUE(fs::is_empty(tmp.path()));
     ExpectCleanSpool();
 }
