@@ -78,6 +78,12 @@ int AddShare(const Options& opts) {
                                     "' is not a valid share name (1 to 255 bytes of UTF-8, no "
                                     "control characters, none of / \\ [ ], not . or ..)");
     }
+    // A valid name the other end could never serve would only fail at the first sync.
+    if (VURNShareNameIsSyncable(name.c_str()) != 1) {
+        return Fail(kExitUsage, "'" + name +
+                                    "' cannot be synced: no quotes, backquotes, %, :, .. or runs "
+                                    "of blanks, no leading @, not \"global\"");
+    }
     const std::string path = opts.Get("path");
     if (path.empty()) {
         return Fail(kExitUsage, "share add needs --path DIR");
