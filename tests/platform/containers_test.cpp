@@ -86,7 +86,7 @@ TEST(S2SPath, MovesFixedPathsBelowTheRootAndKeepsEarlierResults) {
 }
 
 TEST(CInterface, EveryDeclaredFunctionIsExportedUnmangled) {
-    void* lib = dlopen(S2S_BINARY_DIR "/libs2s.so", RTLD_NOW | RTLD_LOCAL);
+    void* lib = dlopen(S2S_LIBRARY_DIR "/libs2s.so", RTLD_NOW | RTLD_LOCAL);
     ASSERT_NE(lib, nullptr) << dlerror();
     // A function declaration starts a line: its type, then its name and "(".
     const std::regex declaration("^(?:S2S_EXPORT )?(?:const )?\\w+\\**\\s+\\**(\\w+)\\(");
