@@ -136,9 +136,10 @@ constexpr size_t kShareNameMax = 255;
 // characters, none of / \ [ ], not "." or "..", no leading or trailing blank.
 bool ShareNameValid(const std::string& name);
 // A share that can be served and synced: a valid name without quotes, backquotes, '%', ".." or
-// ':' (the separator of "syncShares" and of the conflict list), not starting with '@' (the service's own modules and encrypted shares' "@name@"), without a run
-// of blanks, and not "global" in any folding. Such a name is also a literal value of the daemon's
-// configuration: no line break, no %VAR% expansion, no quote, no backslash, no outer blank.
+// ':' (the separator of "syncShares" and of the conflict list), not starting with '@' (the
+// service's own modules and encrypted shares' "@name@"), without a run of blanks, and not "global"
+// in any folding. Such a name is also a literal value of the daemon's configuration: no line break,
+// no %VAR% expansion, no quote, no backslash, no outer blank.
 bool ShareNameSyncable(const std::string& name);
 // A task name a receiver takes: 1..kShareNameMax bytes, no control characters, quotes,
 // brackets, slashes, backslashes or "..", no leading '@', no leading or trailing blank.

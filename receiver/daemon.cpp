@@ -33,8 +33,8 @@
 
 #include "core/protocol.h"
 #include "host/pairing_store.h"
-#include "platform/records.h"
 #include "platform/env.h"
+#include "platform/records.h"
 #include "receiver/internal.h"
 #include "s2s_logger.h"
 #include "s2s_platform.h"

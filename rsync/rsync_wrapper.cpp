@@ -294,7 +294,8 @@ std::string RsyncWrapper::Impl::Url(const std::string& target) const {
 }
 
 std::string RsyncWrapper::Impl::TransferTarget(std::string* why) const {
-    if (S2S::protocol::HasControl(dest) || S2S::protocol::HasControl(module) || HasDotDot(dest) || HasDotDot(module)) {
+    if (S2S::protocol::HasControl(dest) || S2S::protocol::HasControl(module) || HasDotDot(dest) ||
+        HasDotDot(module)) {
         *why = "destination holds control characters or '..'";
         return std::string();
     }

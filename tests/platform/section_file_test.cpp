@@ -18,7 +18,6 @@
 #include <thread>
 #include <vector>
 
-#include "support/test_util.h"
 #include "s2s_platform.h"
 #include "support/fault_env.h"
 #include "support/test_util.h"
