@@ -19,11 +19,7 @@ cd "$(dirname "$0")/.."
 source tools/lib.sh
 s2s_locate_build
 
-if [ -z "${S2S_BENCH_INSIDE:-}" ]; then
-  s2s_require_root bench "the daemon gets a private network namespace"
-  s2s_build s2s_cli s2s-receiver >/dev/null
-  exec unshare --net -- env S2S_BENCH_INSIDE=1 bash "$0" "$@"
-fi
+s2s_bench_isolate "$@"
 
 senders=${S2S_BENCH_SENDERS:-32}
 files=${S2S_BENCH_FILES:-200}

@@ -20,11 +20,7 @@ cd "$(dirname "$0")/.."
 source tools/lib.sh
 s2s_locate_build
 
-if [ -z "${S2S_BENCH_INSIDE:-}" ]; then
-  s2s_require_root bench "the daemon gets a private network namespace"
-  s2s_build s2s_cli s2s-receiver >/dev/null
-  exec unshare --net -- env S2S_BENCH_INSIDE=1 bash "$0" "$@"
-fi
+s2s_bench_isolate "$@"
 
 files=${S2S_BENCH_FILES:-5000}
 megabytes=${S2S_BENCH_MB:-1024}

@@ -21,6 +21,16 @@ s2s_require_root() {  # script-name why
   fi
 }
 
+# Benchmarks against a receiver on this machine: builds the sender and the receiver, then runs
+# the calling script again as root in a private network namespace (its daemon listens on port 873
+# there); inside it, returns at once.
+s2s_bench_isolate() {  # args of the script...
+  [ -n "${S2S_BENCH_INSIDE:-}" ] && return 0
+  s2s_require_root bench "the daemon gets a private network namespace"
+  s2s_build s2s_cli s2s-receiver >/dev/null
+  exec unshare --net -- env S2S_BENCH_INSIDE=1 bash "$0" "$@"
+}
+
 # Configures the build folder (quietly) and builds the given targets in it; with S2S_NO_BUILD
 # set, the programs already there are used as they are (an installed tree, an earlier build).
 s2s_build() {  # target...
