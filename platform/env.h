@@ -111,11 +111,11 @@ class Env {
     virtual int LockFd(int fd);
 
     // --- processes
-    // Starts `spec`. The pid (for a detached program its own pid, not an intermediate's), or -1
+    // Starts `launch`. The pid (for a detached program its own pid, not an intermediate's), or -1
     // with errno set when it could not be forked. When the program could not be executed the
     // child ends with status 127 and `*exec_error` (when given) holds the errno of exec; 0 when
     // it was executed.
-    virtual pid_t Spawn(const SpawnSpec& spec, int* exec_error);
+    virtual pid_t Spawn(const SpawnSpec& launch, int* exec_error);
     // kill(2); a negative pid names a process group.
     virtual int Kill(pid_t pid, int signo);
     // waitpid(2) resumed after interruptions.

@@ -79,7 +79,7 @@ void RemoveStale(const std::string& dir, const std::string& prefix) {
 }
 
 // In the child between fork and exec: async-signal-safe calls only. Never returns.
-[[noreturn]] void ExecChild(const SpawnSpec& spec, char* const* argv, char* const* envp,
+[[noreturn]] void ExecChild(const SpawnSpec& launch, char* const* argv, char* const* envp,
                             int null_fd, int report_fd) {
     // Every disposition back to its default before the mask opens: an ignored signal would stay
     // ignored across exec, and a handler of ours must not run in the child.
@@ -92,25 +92,25 @@ void RemoveStale(const std::string& dir, const std::string& prefix) {
     sigset_t none;
     sigemptyset(&none);
     sigprocmask(SIG_SETMASK, &none, nullptr);
-    int out = spec.output_fd >= 0 ? spec.output_fd : null_fd;
-    int error = spec.error_fd >= 0 ? spec.error_fd : null_fd;
+    int out = launch.output_fd >= 0 ? launch.output_fd : null_fd;
+    int error = launch.error_fd >= 0 ? launch.error_fd : null_fd;
     bool ok = dup2(null_fd, 0) >= 0 && dup2(out, 1) >= 0 && dup2(error, 2) >= 0;
-    if (ok && spec.close_other_fds) {
+    if (ok && launch.close_other_fds) {
         for (int fd = 3; fd < 1024; ++fd) {
             if (fd != report_fd) {
                 close(fd);
             }
         }
     }
-    if (ok && spec.drop_mknod && prctl(PR_CAPBSET_DROP, CAP_MKNOD, 0, 0, 0) != 0) {
+    if (ok && launch.drop_mknod && prctl(PR_CAPBSET_DROP, CAP_MKNOD, 0, 0, 0) != 0) {
         ok = false;
     }
-    if (ok && !spec.chdir.empty() && chdir(spec.chdir.c_str()) != 0) {
+    if (ok && !launch.chdir.empty() && chdir(launch.chdir.c_str()) != 0) {
         // Not fatal: the program chooses its own working directory.
     }
     int err = errno;
     if (ok) {
-        execve(spec.program.c_str(), argv, envp);
+        execve(launch.program.c_str(), argv, envp);
         err = errno;
     }
     ssize_t ignored = write(report_fd, &err, sizeof err);
@@ -396,12 +396,12 @@ int Env::LockFd(int fd) {
     return rc;
 }
 
-pid_t Env::Spawn(const SpawnSpec& spec, int* exec_error) {
+pid_t Env::Spawn(const SpawnSpec& launch, int* exec_error) {
     if (exec_error != nullptr) {
         *exec_error = 0;
     }
     // Everything the child needs is prepared before fork: after it, only async-signal-safe calls.
-    std::vector<std::string> argv_strings(spec.argv);
+    std::vector<std::string> argv_strings(launch.argv);
     std::vector<char*> argv;
     for (auto& s : argv_strings) {
         argv.push_back(&s[0]);
@@ -412,17 +412,17 @@ pid_t Env::Spawn(const SpawnSpec& spec, int* exec_error) {
         std::string entry(*e);
         std::string name = entry.substr(0, entry.find('='));
         bool drop = false;
-        for (const auto& unset : spec.unset_env) {
+        for (const auto& unset : launch.unset_env) {
             drop = drop || name == unset;
         }
-        for (const auto& set : spec.set_env) {
+        for (const auto& set : launch.set_env) {
             drop = drop || name == set.first;
         }
         if (!drop) {
             env_strings.push_back(entry);
         }
     }
-    for (const auto& set : spec.set_env) {
+    for (const auto& set : launch.set_env) {
         env_strings.push_back(set.first + "=" + set.second);
     }
     std::vector<char*> envp;
@@ -439,7 +439,7 @@ pid_t Env::Spawn(const SpawnSpec& spec, int* exec_error) {
     // unwritten); `pid_report` the detached program's pid from the intermediate child.
     Pipe report;
     Pipe pid_report;
-    if (!report.ok() || (spec.detached && !pid_report.ok())) {
+    if (!report.ok() || (launch.detached && !pid_report.ok())) {
         int saved = errno;
         close(null_fd);
         errno = saved;
@@ -454,7 +454,7 @@ pid_t Env::Spawn(const SpawnSpec& spec, int* exec_error) {
         return -1;
     }
     if (pid == 0) {
-        if (spec.detached) {
+        if (launch.detached) {
             // The program leads a session and process group of its own, and is the child of an
             // intermediate that exits at once, so init reaps it.
             pid_t program = fork();
@@ -466,21 +466,21 @@ pid_t Env::Spawn(const SpawnSpec& spec, int* exec_error) {
             if (setsid() < 0) {
                 _exit(1);
             }
-        } else if (spec.own_group) {
+        } else if (launch.own_group) {
             setpgid(0, 0);
         }
         // The child is told (SIGTERM) when its parent dies, even by SIGKILL. The kernel ties this
         // to the thread that forked; a parent that died before it took effect shows in getppid().
-        if (spec.die_with_parent &&
+        if (launch.die_with_parent &&
             (prctl(PR_SET_PDEATHSIG, SIGTERM) != 0 || getppid() != parent)) {
             _exit(127);
         }
-        ExecChild(spec, argv.data(), envp.data(), null_fd, report.write_end());
+        ExecChild(launch, argv.data(), envp.data(), null_fd, report.write_end());
     }
     close(null_fd);
     report.CloseWrite();
     pid_t started = pid;
-    if (spec.detached) {
+    if (launch.detached) {
         pid_report.CloseWrite();
         int status = 0;
         Wait(pid, &status, 0);
@@ -489,7 +489,7 @@ pid_t Env::Spawn(const SpawnSpec& spec, int* exec_error) {
             errno = EAGAIN;
             return -1;
         }
-    } else if (spec.own_group) {
+    } else if (launch.own_group) {
         // Both ends set the group so that a signal right after fork already reaches the child.
         setpgid(pid, pid);
     }

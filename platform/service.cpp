@@ -121,21 +121,21 @@ bool UseSystemd() {
 int Systemctl(const char* verb, const char* name, bool quiet) {
     s2s_platform::Env* env = s2s_platform::Env::Default();
     std::string unit = std::string(name) + ".service";
-    s2s_platform::SpawnSpec spec;
-    spec.program = s2s_platform::FindProgram("systemctl");
-    if (spec.program.empty()) {
+    s2s_platform::SpawnSpec launch;
+    launch.program = s2s_platform::FindProgram("systemctl");
+    if (launch.program.empty()) {
         errno = ENOENT;
         return -1;
     }
-    spec.argv = {"systemctl", verb};
+    launch.argv = {"systemctl", verb};
     if (quiet) {
-        spec.argv.push_back("--quiet");
+        launch.argv.push_back("--quiet");
     }
-    spec.argv.push_back(unit);
-    spec.output_fd = quiet ? -1 : STDOUT_FILENO;
-    spec.error_fd = STDERR_FILENO;
+    launch.argv.push_back(unit);
+    launch.output_fd = quiet ? -1 : STDOUT_FILENO;
+    launch.error_fd = STDERR_FILENO;
     int exec_error = 0;
-    pid_t pid = env->Spawn(spec, &exec_error);
+    pid_t pid = env->Spawn(launch, &exec_error);
     int status = 0;
     if (pid < 0 || env->Wait(pid, &status, 0) < 0) {
         return -1;
@@ -209,14 +209,14 @@ int WritePidFile(const std::string& path, pid_t pid) {
 // inherited descriptor closed, so it keeps none of the caller's sockets and locks alive. Returns
 // its pid, or -1 with errno (also when exec failed).
 pid_t SpawnDetached(const std::string& exe, const char* name) {
-    s2s_platform::SpawnSpec spec;
-    spec.program = exe;
-    spec.argv = {name};
-    spec.detached = true;
-    spec.close_other_fds = true;
-    spec.chdir = "/";
+    s2s_platform::SpawnSpec launch;
+    launch.program = exe;
+    launch.argv = {name};
+    launch.detached = true;
+    launch.close_other_fds = true;
+    launch.chdir = "/";
     int exec_error = 0;
-    pid_t pid = s2s_platform::Env::Default()->Spawn(spec, &exec_error);
+    pid_t pid = s2s_platform::Env::Default()->Spawn(launch, &exec_error);
     if (pid > 0 && exec_error != 0) {
         errno = exec_error;
         return -1;

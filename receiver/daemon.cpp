@@ -747,20 +747,20 @@ int StartLocked(std::string* error) {
     // it (--no-detach), so that the pid it writes is the one to stop. It leads its session and
     // process group: every connection process and hook it forks stays in that group, which is
     // how a stop finds and ends them all.
-    s2s_platform::SpawnSpec spec;
-    spec.program = rsync;
-    spec.argv = {rsync, "--daemon", "--no-detach", "--config=" + conf};
-    spec.detached = true;
-    spec.close_other_fds = true;
+    s2s_platform::SpawnSpec launch;
+    launch.program = rsync;
+    launch.argv = {rsync, "--daemon", "--no-detach", "--config=" + conf};
+    launch.detached = true;
+    launch.close_other_fds = true;
     // Unless a share asks for them, neither the daemon nor anything it starts can create device
     // files, whatever a client sends (rsync's option refusal does not hold for -D).
-    spec.drop_mknod = !devices;
+    launch.drop_mknod = !devices;
     // Module names are matched with ASCII case folding only, as the share registry assumes
     // (VURNShareModuleKey).
-    spec.set_env = {{"LC_ALL", "C"}};
+    launch.set_env = {{"LC_ALL", "C"}};
     // A daemon that cannot be executed, or dies before it writes its pid file (a port in use),
     // is noticed below by its end.
-    pid_t started = s2s_platform::Env::Default()->Spawn(spec, nullptr);
+    pid_t started = s2s_platform::Env::Default()->Spawn(launch, nullptr);
     if (started <= 0) {
         SetEnabled(false);
         return Fail(error, "cannot start the daemon");

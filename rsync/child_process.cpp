@@ -300,17 +300,17 @@ ChildOutcome RunChild(const ChildCommand& job, const boost::function<bool()>& ca
     // transfer behind; the kernel ties this to the thread that forked, not the process: callers
     // wait for the child on the thread that started it, so the thread never ends first.
     s2s_platform::Env* env = s2s_platform::Env::Default();
-    s2s_platform::SpawnSpec spec;
-    spec.program = program;
-    spec.argv = job.argv;
-    spec.set_env = job.set_env;
-    spec.unset_env = job.unset_env;
-    spec.output_fd = write_end.get();
-    spec.error_fd = write_end.get();
-    spec.own_group = true;
-    spec.die_with_parent = true;
+    s2s_platform::SpawnSpec launch;
+    launch.program = program;
+    launch.argv = job.argv;
+    launch.set_env = job.set_env;
+    launch.unset_env = job.unset_env;
+    launch.output_fd = write_end.get();
+    launch.error_fd = write_end.get();
+    launch.own_group = true;
+    launch.die_with_parent = true;
     // A program that cannot be executed ends with status 127, as from a shell.
-    pid_t pid = env->Spawn(spec, nullptr);
+    pid_t pid = env->Spawn(launch, nullptr);
     if (pid < 0) {
         outcome.error = std::string("fork: ") + strerror(errno);
         return outcome;
