@@ -38,7 +38,8 @@ class Releaser {
     Releaser(const Releaser&) = delete;
     Releaser& operator=(const Releaser&) = delete;
     ~Releaser() { Flush(); }
-    void Free(void* block, Arena* arena) {
+    // `block` (with `blocks` - 1 more of the same arena that it alone refers to) is released.
+    void Free(void* block, Arena* arena, size_t blocks = 1) {
         if (arena == nullptr) {
             ::operator delete(block);
             return;
@@ -47,7 +48,7 @@ class Releaser {
             Flush();
             arena_ = arena;
         }
-        ++count_;
+        count_ += blocks;
     }
 
   private:
@@ -164,7 +165,7 @@ void PObjectAccess::AssignText(PObject& o, Arena* arena, const char* data, size_
 
 FlatMap* PObjectAccess::NewFlat(Arena* arena, uint32_t count, uint32_t key_bytes) {
     void* raw = AllocateBlock(arena, sizeof(FlatMap) + count * sizeof(FlatEntry) + key_bytes);
-    FlatMap* flat = new (raw) FlatMap{arena, count, key_bytes};
+    FlatMap* flat = new (raw) FlatMap{arena, count, key_bytes, 0};
     FlatEntry* entries = flat->entries();
     for (uint32_t i = 0; i < count; ++i) {
         new (&entries[i]) FlatEntry{PObject(), 0, 0};
@@ -206,9 +207,6 @@ PObject::PObject(const char* value) {
 }
 PObject::PObject(const PObject& other) {
     copy(other);
-}
-PObject::~PObject() {
-    clear();
 }
 
 PObject& PObject::operator=(unsigned long long value) {
@@ -417,19 +415,29 @@ void PObject::clear() {
     if (payload_ != nullptr && type_ != kInteger) {
         // A tree decoded from a peer may be nested a million levels deep: release it with an
         // explicit work list instead of recursion, so the depth never reaches the call stack.
-        // Only containers that hold containers need the list; strings go at once.
+        // Only children that need a walk of their own go on the list: everything a received map
+        // of leaves holds is released with the map in one step (its blocks were counted when it
+        // was built), and strings go at once.
         Releaser releaser;
         std::vector<PObject> pending;
-        // A child string is released here, not by its own destructor: that adds its arena
-        // block to the releaser's count instead of paying an atomic step of its own.
-        auto release_leaf = [&releaser](PObject& value) {
-            if (value.type_ == kString) {
-                TextBlock* text = static_cast<TextBlock*>(value.payload_);
+        // Releases `child` here when that needs no walk (adding its arena blocks to the
+        // releaser's count instead of paying an atomic step of its own), else moves it to the
+        // work list.
+        auto release_child = [&releaser, &pending](PObject& child) {
+            if (child.type_ == kString) {
+                TextBlock* text = static_cast<TextBlock*>(child.payload_);
                 releaser.Free(text, text->arena);
+            } else if (child.isContainer() && child.payload_ != nullptr) {
+                if (!PObjectAccess::IsFlat(child) || PObjectAccess::Flat(child).leaf_blocks == 0) {
+                    pending.emplace_back(std::move(child));
+                    return;
+                }
+                FlatMap& flat = PObjectAccess::Flat(child);
+                releaser.Free(&flat, flat.arena, flat.leaf_blocks);
             }
             // Everything else left is an integer, a null or an empty container.
-            value.type_ = kNull;
-            value.payload_ = nullptr;
+            child.type_ = kNull;
+            child.payload_ = nullptr;
         };
         PObject current;
         current.swap(*this);
@@ -442,10 +450,9 @@ void PObject::clear() {
                 }
                 case kArray:
                     if (current.payload_ != nullptr) {
-                        current.TakeChildren(pending);
                         Array* items = static_cast<Array*>(current.payload_);
                         for (PObject& item : *items) {
-                            release_leaf(item);
+                            release_child(item);
                         }
                         delete items;
                     }
@@ -454,18 +461,21 @@ void PObject::clear() {
                     if (current.payload_ == nullptr) {
                         break;
                     }
-                    current.TakeChildren(pending);
                     if (PObjectAccess::IsFlat(current)) {
                         FlatMap& flat = PObjectAccess::Flat(current);
+                        if (flat.leaf_blocks != 0) {
+                            releaser.Free(&flat, flat.arena, flat.leaf_blocks);
+                            break;
+                        }
                         FlatEntry* entries = flat.entries();
                         for (uint32_t i = 0; i < flat.count; ++i) {
-                            release_leaf(entries[i].value);
+                            release_child(entries[i].value);
                         }
                         releaser.Free(&flat, flat.arena);
                     } else {
                         Map* map = static_cast<Map*>(current.payload_);
                         for (auto& entry : *map) {
-                            release_leaf(entry.second);
+                            release_child(entry.second);
                         }
                         delete map;
                     }
@@ -484,32 +494,6 @@ void PObject::clear() {
     }
     type_ = kNull;
     payload_ = nullptr;
-}
-
-// Moves the non-empty container children of this object onto `pending`, leaving only leaves.
-void PObject::TakeChildren(std::vector<PObject>& pending) {
-    auto take = [&pending](PObject& child) {
-        if (child.isContainer() && child.payload_ != nullptr) {
-            pending.emplace_back(std::move(child));
-        }
-    };
-    if (payload_ == nullptr) {
-        return;
-    }
-    if (type_ == kArray) {
-        for (PObject& element : *static_cast<Array*>(payload_)) {
-            take(element);
-        }
-    } else if (PObjectAccess::IsFlat(*this)) {
-        FlatMap& flat = PObjectAccess::Flat(*this);
-        for (uint32_t i = 0; i < flat.count; ++i) {
-            take(flat.entries()[i].value);
-        }
-    } else if (type_ == kMap) {
-        for (auto& entry : *static_cast<Map*>(payload_)) {
-            take(entry.second);
-        }
-    }
 }
 
 template <>

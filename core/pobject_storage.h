@@ -77,6 +77,10 @@ struct FlatMap {
     Arena* arena;
     uint32_t count;  // at least 1: an empty map has no payload
     uint32_t key_bytes;
+    // Non-zero for a map whose entries are all leaves (nulls, integers, strings of its arena):
+    // the number of arena blocks the map and its strings take, released together without a
+    // walk. A flat map is never changed in place, so the count stays true.
+    uint32_t leaf_blocks;
     FlatEntry* entries() { return reinterpret_cast<FlatEntry*>(this + 1); }
     const FlatEntry* entries() const { return reinterpret_cast<const FlatEntry*>(this + 1); }
     const char* keys() const { return reinterpret_cast<const char*>(entries() + count); }
@@ -87,8 +91,14 @@ struct FlatMap {
 // Byte order of keys: what std::string's comparison gives (unsigned bytes, a prefix first).
 inline int CompareKeys(const char* a, size_t a_size, const char* b, size_t b_size) {
     size_t common = a_size < b_size ? a_size : b_size;
-    int order = common == 0 ? 0 : std::memcmp(a, b, common);
-    if (order != 0) {
+    if (common <= 16) {
+        // Most keys are short: a byte loop costs less than the call.
+        for (size_t i = 0; i < common; ++i) {
+            if (a[i] != b[i]) {
+                return static_cast<unsigned char>(a[i]) < static_cast<unsigned char>(b[i]) ? -1 : 1;
+            }
+        }
+    } else if (int order = std::memcmp(a, b, common); order != 0) {
         return order;
     }
     return a_size < b_size ? -1 : (a_size > b_size ? 1 : 0);

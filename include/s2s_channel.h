@@ -170,7 +170,17 @@ class S2S_EXPORT Channel {
         }
         return r_buf_.get() + r_head_;
     }
-    // REQUIRES: BufferedRun(len) was not null.
+    // The unconsumed bytes that lie in one piece from the read position: their start and, in
+    // `len`, their count (null and 0 when nothing is buffered or the channel is closed).
+    const char* BufferedSpan(unsigned int& len) const {
+        if (handle_ == nullptr || r_size_ == 0) {
+            len = 0;
+            return nullptr;
+        }
+        len = r_size_ < capacity_ - r_head_ ? r_size_ : capacity_ - r_head_;
+        return r_buf_.get() + r_head_;
+    }
+    // REQUIRES: BufferedRun(len) or BufferedSpan gave at least `len` bytes.
     void Consume(unsigned int len) {
         r_size_ -= len;
         r_head_ = r_size_ == 0 ? 0 : r_head_ + len;
@@ -195,7 +205,19 @@ class S2S_EXPORT Channel {
         unsigned int room = end < capacity_ ? capacity_ - tail : w_head_ - tail;
         return len > room ? nullptr : w_buf_.get() + tail;
     }
-    // REQUIRES: WriteRoom(len) was not null and the bytes are written there.
+    // The free room that lies in one piece at the write position: its start and, in `len`, its
+    // size (null and 0 when the channel is closed).
+    char* WriteSpan(unsigned int& len) {
+        if (handle_ == nullptr) {
+            len = 0;
+            return nullptr;
+        }
+        unsigned int end = w_head_ + w_size_;
+        unsigned int tail = end < capacity_ ? end : end - capacity_;
+        len = end < capacity_ ? capacity_ - tail : w_head_ - tail;
+        return w_buf_.get() + tail;
+    }
+    // REQUIRES: WriteRoom(len) or WriteSpan gave at least `len` bytes, and they are written.
     void Commit(unsigned int len) { w_size_ += len; }
 
   protected:

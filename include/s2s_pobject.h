@@ -46,7 +46,12 @@ class S2S_EXPORT PObject {
         other.type_ = kNull;
         other.payload_ = nullptr;
     }
-    ~PObject();
+    // Only a payload needs releasing: a null, an integer or an empty container costs a test.
+    ~PObject() {
+        if (type_ != kNull && type_ != kInteger && payload_ != nullptr) {
+            clear();
+        }
+    }
 
     PObject& operator=(unsigned long long value);
     PObject& operator=(unsigned int value);
@@ -113,7 +118,6 @@ class S2S_EXPORT PObject {
 
     const PObject* MapEntryAt(unsigned int index) const;
     void Print(std::string& out) const;
-    void TakeChildren(std::vector<PObject>& pending);
 
     // kNull exactly when the object is null; every operation that empties it resets both fields.
     int type_ = kNull;

@@ -115,12 +115,17 @@ class S2S_EXPORT PStream {
                const std::map<std::string, PObject>* map);
     // Channel access for the codec: straight to the rings for a plain Channel when debug lines are
     // off (nothing could observe a difference), through the virtual operations otherwise.
-    static int ReadByte(Channel& channel, unsigned char& byte);
-    static int ReadInt16(Channel& channel, unsigned short& value);
-    static int ReadBytes(Channel& channel, char* dst, unsigned int len);
-    static int WriteByte(Channel& channel, unsigned char byte);
-    static int WriteBytes(Channel& channel, const char* src, size_t len);
-    static int WriteString(Channel& channel, const char* data, size_t len);
+    int ReadByte(Channel& channel, unsigned char& byte);
+    int ReadInt16(Channel& channel, unsigned short& value);
+    int ReadBytes(Channel& channel, char* dst, unsigned int len);
+    int WriteByte(Channel& channel, unsigned char byte);
+    int WriteBytes(Channel& channel, const char* src, size_t len);
+    int WriteString(Channel& channel, const char* data, size_t len);
+    void SetDirect(const Channel& channel);
+    void OpenSpan(const Channel& channel);
+    void CloseSpan();
+    void LockSpan();
+    struct Parked;
     int SendKey(Channel& channel, const char* key, size_t length);
     // A string body into `text` (scratch: its content is undefined after a failure). A map key
     // (`is_key`) is logged as it is; a value may be masked (LoggedValue).
@@ -132,6 +137,10 @@ class S2S_EXPORT PStream {
     // waits for editing_ to fall before taking the mutex. A full barrier between each one's
     // announcement and its look makes at least one of the two see the other; the reader pays for
     // both sides with a process-wide barrier where the kernel offers one.
+    // Inside Encode and Decode the announcement covers a whole span of edits instead of one: the
+    // span ends (the path is then whole and readable) before any channel call that may wait, and
+    // turns into locked edits as soon as a reader is seen, so a reader never waits for more than
+    // the decoding of what is already buffered.
     bool BeginEdit();
     void EndEdit(bool locked);
     void Watch();
@@ -162,6 +171,12 @@ class S2S_EXPORT PStream {
     size_t max_recv_bytes_ = kDefaultMaxRecvBytes;
     unsigned int max_recv_depth_ = kDefaultMaxRecvDepth;
     size_t received_ = 0;  // wire bytes of the receive in progress
+    // Set for each message: the codec may go straight to the channel's rings (see SetDirect).
+    bool direct_ = false;
+    // A message in transfer edits the key path in one span (see OpenSpan); `span_locked_` once a
+    // reader has appeared, after which each edit takes the mutex.
+    bool span_ = false;
+    bool span_locked_ = false;
 };
 
 template <>

@@ -118,8 +118,8 @@ constexpr size_t kNoEntry = ~size_t{0};
 // An entry of a flat map still being decoded; its key is in the scratch's key bytes.
 struct PendingEntry {
     PObject value;
-    size_t key_offset;
-    uint32_t key_size;
+    size_t key_offset = 0;
+    uint32_t key_size = 0;
 };
 
 // The entries and keys of the flat maps open in a decode, innermost last. One per thread, kept
@@ -213,6 +213,9 @@ int PStream::RecvObject(Channel& channel, PObject& object) {
 }
 
 int PStream::RecvTag(Channel& channel, unsigned char& tag) {
+    if (!span_) {
+        SetDirect(channel);
+    }
     int ret = ReadByte(channel, tag);
     return ret < 0 ? ChannelFailure(ret) : kStatusSuccessful;
 }
@@ -222,6 +225,9 @@ int PStream::RecvDispatch(Channel& channel, unsigned char tag, PObject& object) 
 }
 
 int PStream::Send(Channel& channel, unsigned long long value) {
+    if (!span_) {
+        SetDirect(channel);
+    }
     ResetStatus();
     // Tag, length byte and value bytes go to the channel together.
     unsigned char length = IntegerLength(value);
@@ -239,7 +245,10 @@ int PStream::Send(Channel& channel, unsigned long long value) {
 
 int PStream::Recv(Channel& channel, unsigned long long& value) {
     ResetStatus();
-    if (Direct(channel)) {
+    if (!span_) {
+        SetDirect(channel);
+    }
+    if (direct_) {
         // Length byte and value bytes are usually buffered together: one look at the ring.
         const char* at = channel.BufferedRun(1);
         if (at != nullptr) {
@@ -286,6 +295,9 @@ int PStream::Recv(Channel& channel, unsigned long long& value) {
 }
 
 int PStream::Send(Channel& channel, const std::string& value) {
+    if (!span_) {
+        SetDirect(channel);
+    }
     ResetStatus();
     int ret = WriteString(channel, value.data(), value.size());
     if (ret < 0) {
@@ -309,7 +321,10 @@ int PStream::Recv(Channel& channel, std::string& value) {
 int PStream::RecvText(Channel& channel, std::string& text, bool is_key) {
     ResetStatus();
     // Only the bytes up to the first NUL are kept, as the format always did.
-    const char* at = Direct(channel) ? channel.BufferedRun(2) : nullptr;
+    if (!span_) {
+        SetDirect(channel);
+    }
+    const char* at = direct_ ? channel.BufferedRun(2) : nullptr;
     unsigned int length = at == nullptr ? 0
                                         : (static_cast<unsigned char>(at[0]) << 8) |
                                               static_cast<unsigned char>(at[1]);
@@ -341,6 +356,9 @@ int PStream::RecvText(Channel& channel, std::string& text, bool is_key) {
 }
 
 int PStream::SendNull(Channel& channel) {
+    if (!span_) {
+        SetDirect(channel);
+    }
     ResetStatus();
     static const char kNull[2] = {kTagNull, 0};
     int ret = WriteBytes(channel, kNull, sizeof(kNull));
@@ -419,6 +437,12 @@ void PStream::SetRecvLimits(size_t max_bytes, unsigned int max_depth) {
 }
 
 bool PStream::BeginEdit() {
+    if (span_) {
+        if (span_locked_) {
+            pthread_mutex_lock(&mutex_);
+        }
+        return span_locked_;
+    }
     editing_.store(true, std::memory_order_relaxed);
     // With process-wide barriers a reader forces the fence on this thread; without, pay it here.
     if (HeavyBarrierAvailable()) {
@@ -437,10 +461,64 @@ bool PStream::BeginEdit() {
 void PStream::EndEdit(bool locked) {
     if (locked) {
         pthread_mutex_unlock(&mutex_);
-    } else {
+    } else if (!span_) {
         editing_.store(false, std::memory_order_release);
+    } else if (watchers_.load(std::memory_order_relaxed) != 0) {
+        LockSpan();  // the edit is whole: let the reader in
     }
 }
+
+void PStream::SetDirect(const Channel& channel) {
+    direct_ = Direct(channel);
+}
+
+void PStream::OpenSpan(const Channel& channel) {
+    SetDirect(channel);
+    span_ = true;
+    span_locked_ = false;
+    editing_.store(true, std::memory_order_relaxed);
+    if (HeavyBarrierAvailable()) {
+        std::atomic_signal_fence(std::memory_order_seq_cst);
+    } else {
+        std::atomic_thread_fence(std::memory_order_seq_cst);
+    }
+    if (watchers_.load(std::memory_order_relaxed) != 0) {
+        LockSpan();
+    }
+}
+
+void PStream::LockSpan() {
+    span_locked_ = true;
+    editing_.store(false, std::memory_order_release);
+}
+
+void PStream::CloseSpan() {
+    if (span_ && !span_locked_) {
+        editing_.store(false, std::memory_order_release);
+    }
+    span_ = false;
+    span_locked_ = false;
+}
+
+// Around a channel call that may wait: the span ends first, so that a reader finds the path
+// whole meanwhile, and opens again after.
+struct PStream::Parked {
+    PStream& stream;
+    const Channel& channel;
+    const bool was_open;
+    Parked(PStream& s, const Channel& c) : stream(s), channel(c), was_open(s.span_) {
+        if (was_open) {
+            stream.CloseSpan();
+        }
+    }
+    ~Parked() {
+        if (was_open) {
+            stream.OpenSpan(channel);
+        }
+    }
+    Parked(const Parked&) = delete;
+    Parked& operator=(const Parked&) = delete;
+};
 
 void PStream::Watch() {
     watchers_.fetch_add(1, std::memory_order_seq_cst);
@@ -459,41 +537,45 @@ void PStream::Unwatch() {
 }
 
 int PStream::ReadByte(Channel& channel, unsigned char& byte) {
-    if (Direct(channel) && channel.ReadBuffered(reinterpret_cast<char*>(&byte), 1)) {
+    if (direct_ && channel.ReadBuffered(reinterpret_cast<char*>(&byte), 1)) {
         return 0;
     }
+    Parked parked(*this, channel);
     return channel.ReadByte(&byte);
 }
 
 int PStream::ReadInt16(Channel& channel, unsigned short& value) {
     unsigned char b[2];
-    if (Direct(channel) && channel.ReadBuffered(reinterpret_cast<char*>(b), 2)) {
+    if (direct_ && channel.ReadBuffered(reinterpret_cast<char*>(b), 2)) {
         value = static_cast<unsigned short>((b[0] << 8) | b[1]);
         return 0;
     }
+    Parked parked(*this, channel);
     return channel.ReadInt16(&value);
 }
 
 int PStream::ReadBytes(Channel& channel, char* dst, unsigned int len) {
-    if (Direct(channel) && channel.ReadBuffered(dst, len)) {
+    if (direct_ && channel.ReadBuffered(dst, len)) {
         return 0;
     }
+    Parked parked(*this, channel);
     return channel.Read(dst, len);
 }
 
 int PStream::WriteByte(Channel& channel, unsigned char byte) {
-    if (Direct(channel) && channel.WriteBuffered(reinterpret_cast<const char*>(&byte), 1)) {
+    if (direct_ && channel.WriteBuffered(reinterpret_cast<const char*>(&byte), 1)) {
         return 0;
     }
+    Parked parked(*this, channel);
     return channel.WriteByte(byte);
 }
 
 // Writes `len` bytes in pieces the channel accepts (one Write carries at most its capacity).
 int PStream::WriteBytes(Channel& channel, const char* src, size_t len) {
-    if (len <= UINT_MAX && Direct(channel) &&
-        channel.WriteBuffered(src, static_cast<unsigned int>(len))) {
+    if (len <= UINT_MAX && direct_ && channel.WriteBuffered(src, static_cast<unsigned int>(len))) {
         return 0;
     }
+    Parked parked(*this, channel);
     const size_t step = std::max(1u, channel.GetCapacity());
     for (size_t done = 0; done < len; done += step) {
         int ret = channel.Write(src + done, static_cast<unsigned int>(std::min(step, len - done)));
@@ -507,9 +589,8 @@ int PStream::WriteBytes(Channel& channel, const char* src, size_t len) {
 // A string value: tag 0x10, the low 16 bits of the length, then every byte (the format's own
 // limit, which senders respect). Short strings reach the channel in one piece with their header.
 int PStream::WriteString(Channel& channel, const char* data, size_t len) {
-    char* room = len <= 0xFFFF && Direct(channel)
-                     ? channel.WriteRoom(static_cast<unsigned int>(3 + len))
-                     : nullptr;
+    char* room =
+        len <= 0xFFFF && direct_ ? channel.WriteRoom(static_cast<unsigned int>(3 + len)) : nullptr;
     if (room != nullptr) {
         room[0] = static_cast<char>(kTagString);
         room[1] = static_cast<char>((len >> 8) & 0xFF);
@@ -599,6 +680,11 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         const FlatMap* flat;  // a map still in its flat form (never turned into a std::map here)
     };
     std::vector<Walk> stack;
+    OpenSpan(channel);
+    struct SpanEnd {
+        PStream& stream;
+        ~SpanEnd() { stream.CloseSpan(); }
+    } span_end{*this};
     auto open_array = [&](const std::vector<PObject>& a) {
         int ret = WriteByte(channel, kTagArray);
         if (ret < 0) {
@@ -628,6 +714,106 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         ++depth_;
         stack.push_back(Walk{nullptr, 0, nullptr, {}, false, &flat});
         return 0;
+    };
+
+    // Map entries whose value is a primitive, written straight into the free room of the ring
+    // while it lasts: the counterpart of the decoder's run (the last key goes on the history
+    // once; no debug line is due). False when not one entry fitted.
+    auto entry_run = [&](Walk& top) {
+        unsigned int room = 0;
+        char* const start = channel.WriteSpan(room);
+        char* const limit = start + room;
+        char* at = start;
+        const char* last_key = nullptr;
+        size_t last_size = 0;
+        for (;;) {
+            const PObject* entry_value;
+            const char* key;
+            size_t length = 0;
+            if (top.flat != nullptr) {
+                if (top.index == top.flat->count) {
+                    break;
+                }
+                const FlatEntry& entry = top.flat->entries()[top.index];
+                key = WireKey(top.flat->key(static_cast<uint32_t>(top.index)), entry.key_size,
+                              length);
+                entry_value = &entry.value;
+            } else {
+                if (top.next == top.map->end()) {
+                    break;
+                }
+                key = WireKey(top.next->first.data(), top.next->first.size(), length);
+                entry_value = &top.next->second;
+            }
+            const PObject& current = *entry_value;
+            const char* text = nullptr;
+            size_t value_size = 0;
+            size_t value_wire;
+            if (current.isNull()) {
+                value_wire = 2;
+            } else if (current.isInteger()) {
+                value_size = IntegerLength(current.asUInt64());
+                value_wire = 2 + value_size;
+            } else if (current.isString()) {
+                const TextBlock& block = PObjectAccess::Text(current);
+                text = block.data();
+                value_size = block.size;
+                value_wire = 3 + value_size;
+            } else {
+                break;  // a container: the general loop opens it
+            }
+            if (length > 0xFFFF || value_size > 0xFFFF ||
+                static_cast<size_t>(limit - at) < 3 + length + value_wire) {
+                break;
+            }
+            at[0] = static_cast<char>(kTagString);
+            at[1] = static_cast<char>(length >> 8);
+            at[2] = static_cast<char>(length);
+            std::memcpy(at + 3, key, length);
+            at += 3 + length;
+            if (text != nullptr) {
+                at[0] = static_cast<char>(kTagString);
+                at[1] = static_cast<char>(value_size >> 8);
+                at[2] = static_cast<char>(value_size);
+                std::memcpy(at + 3, text, value_size);
+            } else if (current.isNull()) {
+                at[0] = static_cast<char>(kTagNull);
+                at[1] = 0;
+            } else {
+                const unsigned long long number = current.asUInt64();
+                at[0] = static_cast<char>(kTagInteger);
+                at[1] = static_cast<char>(value_size);
+                for (size_t i = 0; i < value_size; ++i) {
+                    at[2 + i] = static_cast<char>(number >> (8 * (value_size - 1 - i)));
+                }
+            }
+            at += value_wire;
+            last_key = key;
+            last_size = length;
+            if (top.flat != nullptr) {
+                ++top.index;
+            } else {
+                ++top.next;
+            }
+        }
+        if (at == start) {
+            return false;
+        }
+        channel.Commit(static_cast<unsigned int>(at - start));
+        ResetStatus();
+        // At the map's end the key would only be taken off again before the end tag.
+        const bool map_done =
+            top.flat != nullptr ? top.index == top.flat->count : top.next == top.map->end();
+        if (map_done) {
+            return true;
+        }
+        if (top.key_pushed) {
+            ReplaceKey(last_key, last_size);
+        } else {
+            PushKey(last_key, last_size);
+            top.key_pushed = true;
+        }
+        return true;
     };
 
     int ret = 0;
@@ -699,6 +885,9 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             value = &(*top.array)[top.index++];
             continue;
         }
+        if (direct_ && !span_locked_ && entry_run(top)) {
+            continue;
+        }
         size_t length = 0;
         const char* key;
         if (top.flat != nullptr) {
@@ -749,17 +938,21 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     DecodeScratch& scratch = ThreadScratch();
     std::vector<PendingEntry>& entries = scratch.entries;
     std::string& keys = scratch.keys;
-    // Leaves the scratch empty and lets go of the message's arena on every way out.
+    // Leaves the scratch empty, the key path readable and lets go of the message's arena on
+    // every way out.
+    OpenSpan(channel);
     struct Cleanup {
+        PStream& stream;
         DecodeScratch& scratch;
         Arena* arena = nullptr;
         ~Cleanup() {
+            stream.CloseSpan();
             scratch.Reset();
             if (arena != nullptr) {
                 arena->Finish();
             }
         }
-    } cleanup{scratch};
+    } cleanup{*this, scratch};
     auto arena = [&cleanup] {
         if (cleanup.arena == nullptr) {
             cleanup.arena = Arena::Create();
@@ -792,12 +985,23 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             flat = PObjectAccess::NewFlat(arena(), static_cast<uint32_t>(count),
                                           static_cast<uint32_t>(key_bytes));
             FlatEntry* out = flat->entries();
+            // A map of leaves (nulls, integers, strings of this arena) is released later in one
+            // step: the map and its strings are counted here.
+            bool leaves = true;
+            uint32_t blocks = 1;
             for (size_t i = 0; i < count; ++i) {
                 PendingEntry& entry = entries[frame.first + i];
+                if (entry.value.isString()) {
+                    ++blocks;
+                    leaves = leaves && PObjectAccess::Text(entry.value).arena == flat->arena;
+                } else if (entry.value.isContainer()) {
+                    leaves = false;
+                }
                 PObjectAccess::Move(out[i].value, entry.value);
                 out[i].key_offset = static_cast<uint32_t>(entry.key_offset - frame.key_start);
                 out[i].key_size = entry.key_size;
             }
+            flat->leaf_blocks = leaves ? blocks : 0;
             std::memcpy(flat->keys(), keys.data() + frame.key_start, key_bytes);
             entries.resize(frame.first);
             keys.resize(frame.key_start);
@@ -824,12 +1028,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         open(array, map);
     }
 
-    // The channel's class cannot change during the call; the log level is looked at each time.
-    const bool plain = typeid(channel) == typeid(Channel);
-    auto direct = [&] { return plain && Logger::log_level < Logger::Debug; };
     auto next_tag = [&](unsigned char& next) {
         ++received_;
-        const char* at = direct() ? channel.BufferedRun(1) : nullptr;
+        const char* at = direct_ ? channel.BufferedRun(1) : nullptr;
         if (at == nullptr) {
             return RecvTag(channel, next);
         }
@@ -840,7 +1041,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     // A string body buffered whole in the ring: its bytes (up to the first NUL) and the wire
     // bytes to consume, or null.
     auto buffered_text = [&](size_t& size, unsigned int& wire) -> const char* {
-        const char* at = direct() ? channel.BufferedRun(2) : nullptr;
+        const char* at = direct_ ? channel.BufferedRun(2) : nullptr;
         if (at == nullptr) {
             return nullptr;
         }
@@ -852,6 +1053,88 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         size = strnlen(at + 2, length);
         wire = 2 + length;
         return at + 2;
+    };
+
+    // Entries of a flat map whose key and primitive value are buffered whole (in one piece of
+    // the ring) and arrive in ascending key order, read in one pass without the per-value steps:
+    // the run's last key goes on the history once, as if each key had been put there and
+    // replaced by the next. The run is taken only when no debug line is due (direct_) and no
+    // reader holds the key path (a locked span), and stops before anything else, which the
+    // general loop below then reads.
+    auto flat_run = [&](Frame& top) {
+        unsigned int buffered = 0;
+        const char* const start = channel.BufferedSpan(buffered);
+        const char* const end = start + buffered;
+        const char* at = start;
+        const char* last_key = nullptr;
+        size_t last_size = 0;
+        while (end - at >= 5 && static_cast<unsigned char>(at[0]) == kTagString) {
+            const size_t key_wire =
+                (static_cast<unsigned char>(at[1]) << 8) | static_cast<unsigned char>(at[2]);
+            const char* value = at + 3 + key_wire;
+            if (end - value < 3) {
+                break;
+            }
+            const unsigned char value_tag = static_cast<unsigned char>(value[0]);
+            const unsigned int lead = static_cast<unsigned char>(value[1]);
+            size_t value_wire = 0;
+            if (value_tag == kTagInteger && lead <= 8) {
+                value_wire = 2 + lead;
+            } else if (value_tag == kTagString) {
+                value_wire = 3 + ((lead << 8) | static_cast<unsigned char>(value[2]));
+            } else if (value_tag == kTagNull && lead == 0) {
+                value_wire = 2;
+            } else {
+                break;  // a container, or something the general loop reports
+            }
+            const size_t wire = 3 + key_wire + value_wire;
+            if (static_cast<size_t>(end - value) < value_wire ||
+                (max_recv_bytes_ != 0 && received_ + wire > max_recv_bytes_)) {
+                break;
+            }
+            const char* key = at + 3;
+            const size_t key_size = strnlen(key, key_wire);
+            if ((entries.size() != top.first &&
+                 CompareKeys(keys.data() + entries.back().key_offset, entries.back().key_size, key,
+                             key_size) >= 0) ||
+                keys.size() + key_size > UINT32_MAX || entries.size() - top.first >= UINT32_MAX) {
+                break;
+            }
+            PendingEntry& entry = entries.emplace_back();
+            entry.key_offset = keys.size();
+            entry.key_size = static_cast<uint32_t>(key_size);
+            keys.append(key, key_size);
+            PObject& target = entry.value;
+            if (value_tag == kTagInteger) {
+                unsigned long long number = 0;
+                for (unsigned int i = 0; i < lead; ++i) {
+                    number = (number << 8) + static_cast<unsigned char>(value[2 + i]);
+                }
+                target = number;
+            } else if (value_tag == kTagString) {
+                PObjectAccess::AssignText(target, arena(), value + 3,
+                                          strnlen(value + 3, value_wire - 3));
+            }
+            received_ += wire;
+            at += wire;
+            last_key = key;
+            last_size = key_size;
+        }
+        if (at == start) {
+            return;
+        }
+        ResetStatus();
+        // When the map's end tag follows in the ring, the key would only be taken off again:
+        // nothing can read the path before that (the end tag needs no wait).
+        if (at == end || static_cast<unsigned char>(*at) != kTagEnd) {
+            if (top.key_done) {
+                ReplaceKey(last_key, last_size);
+            } else {
+                PushKey(last_key, last_size);
+            }
+            top.key_done = true;
+        }
+        channel.Consume(static_cast<unsigned int>(at - start));
     };
 
     // Nesting beyond the limit is refused before the container is entered.
@@ -969,6 +1252,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             completed = true;
         } else {
             Frame& top = stack.back();
+            if (direct_ && !span_locked_ && top.flat()) {
+                flat_run(top);
+            }
             ret = next_tag(tag);
             if (ret < 0) {
                 break;
@@ -1027,8 +1313,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                     }
                 }
                 if (top.flat()) {
-                    entries.push_back(
-                        PendingEntry{PObject(), keys.size(), static_cast<uint32_t>(key_size)});
+                    PendingEntry& entry = entries.emplace_back();
+                    entry.key_offset = keys.size();
+                    entry.key_size = static_cast<uint32_t>(key_size);
                     keys.append(key, key_size);
                     slot = &entries.back().value;
                     slot_owner = entries.size() - 1;
