@@ -22,6 +22,70 @@ const char kIndexError[] = "out_of_range: PObject::operator[]";
 // A message's first chunk holds a small request whole; later chunks double up to the cap.
 constexpr size_t kFirstChunk = 4096;
 constexpr size_t kMaxChunk = 64 * 1024;  // below the allocator's mmap threshold
+constexpr int kChunkClasses = 5;         // 4 KiB, 8 KiB ... 64 KiB
+// Chunks of released arenas that a thread keeps for its next messages, so that a steady stream
+// of messages does not fault fresh pages in each time (the allocator gives freed top-of-heap
+// memory back to the system).
+constexpr size_t kSpareBytes = 512 * 1024;
+
+int ChunkClass(size_t size) {
+    for (int c = 0; c < kChunkClasses; ++c) {
+        if (size == kFirstChunk << c) {
+            return c;
+        }
+    }
+    return -1;
+}
+
+// Trivially destructible, so that it can still be read during the thread's exit.
+struct SpareChunks {
+    Arena::Chunk* head[kChunkClasses];
+    size_t bytes;
+    bool closed;  // the thread is ending: nothing is kept any more
+};
+thread_local SpareChunks spare_chunks;
+
+// Gives the thread's spare chunks back when the thread ends.
+struct SpareChunksOwner {
+    ~SpareChunksOwner() {
+        spare_chunks.closed = true;
+        for (Arena::Chunk*& head : spare_chunks.head) {
+            while (head != nullptr) {
+                Arena::Chunk* next = head->next;
+                ::operator delete(head);
+                head = next;
+            }
+        }
+        spare_chunks.bytes = 0;
+    }
+    void Enlist() {}
+};
+
+Arena::Chunk* NewChunk(size_t size) {
+    int c = ChunkClass(size);
+    if (c >= 0 && spare_chunks.head[c] != nullptr) {
+        Arena::Chunk* chunk = spare_chunks.head[c];
+        spare_chunks.head[c] = chunk->next;
+        spare_chunks.bytes -= size;
+        return chunk;
+    }
+    Arena::Chunk* chunk = static_cast<Arena::Chunk*>(::operator new(size));
+    chunk->size = size;
+    return chunk;
+}
+
+void FreeChunk(Arena::Chunk* chunk) {
+    int c = ChunkClass(chunk->size);
+    if (c >= 0 && !spare_chunks.closed && spare_chunks.bytes + chunk->size <= kSpareBytes) {
+        static thread_local SpareChunksOwner owner;
+        owner.Enlist();
+        chunk->next = spare_chunks.head[c];
+        spare_chunks.head[c] = chunk;
+        spare_chunks.bytes += chunk->size;
+        return;
+    }
+    ::operator delete(chunk);
+}
 
 size_t RoundUp8(size_t size) {
     return (size + 7) & ~size_t{7};
@@ -89,8 +153,8 @@ const FlatEntry* FindFlat(const FlatMap& flat, const std::string& key) {
 
 Arena* Arena::Create() {
     // The arena lives at the start of its own first chunk.
-    void* raw = ::operator new(kFirstChunk);
-    Chunk* chunk = static_cast<Chunk*>(raw);
+    Chunk* chunk = NewChunk(kFirstChunk);
+    void* raw = chunk;
     chunk->next = nullptr;
     Arena* arena = new (static_cast<char*>(raw) + sizeof(Chunk)) Arena();
     arena->chunks_ = chunk;
@@ -100,11 +164,8 @@ Arena* Arena::Create() {
     return arena;
 }
 
-void* Arena::Allocate(size_t size) {
-    size = RoundUp8(size);
-    if (size > static_cast<size_t>(limit_ - cursor_)) {
-        Grow(size);
-    }
+void* Arena::AllocateSlow(size_t size) {
+    Grow(size);
     void* at = cursor_;
     cursor_ += size;
     ++allocated_;
@@ -114,8 +175,8 @@ void* Arena::Allocate(size_t size) {
 void Arena::Grow(size_t size) {
     size_t chunk_size = std::max(next_size_, sizeof(Chunk) + size);
     next_size_ = std::min(next_size_ * 2, kMaxChunk);
-    void* raw = ::operator new(chunk_size);
-    Chunk* chunk = static_cast<Chunk*>(raw);
+    Chunk* chunk = NewChunk(chunk_size);
+    void* raw = chunk;
     chunk->next = chunks_;
     chunks_ = chunk;
     cursor_ = static_cast<char*>(raw) + sizeof(Chunk);
@@ -138,30 +199,12 @@ void Arena::Destroy() {
     this->~Arena();  // the first chunk, which holds the arena, is the last of the list
     while (chunk != nullptr) {
         Chunk* next = chunk->next;
-        ::operator delete(chunk);
+        FreeChunk(chunk);
         chunk = next;
     }
 }
 
 // --- Storage forms -----------------------------------------------------------------------------
-
-TextBlock* PObjectAccess::NewText(Arena* arena, const char* data, size_t size) {
-    // One byte more: the text is NUL-terminated for log lines.
-    void* raw = AllocateBlock(arena, sizeof(TextBlock) + size + 1);
-    TextBlock* text = new (raw) TextBlock{arena, size};
-    if (size > 0) {
-        std::memcpy(text->data(), data, size);
-    }
-    text->data()[size] = '\0';
-    return text;
-}
-
-void PObjectAccess::AssignText(PObject& o, Arena* arena, const char* data, size_t size) {
-    TextBlock* text = NewText(arena, data, size);  // `data` may live inside `o`
-    o.clear();
-    o.type_ = PObject::kString;
-    o.payload_ = text;
-}
 
 FlatMap* PObjectAccess::NewFlat(Arena* arena, uint32_t count, uint32_t key_bytes) {
     void* raw = AllocateBlock(arena, sizeof(FlatMap) + count * sizeof(FlatEntry) + key_bytes);

@@ -21,6 +21,7 @@
 #include <cstdint>
 #include <cstring>
 #include <map>
+#include <new>
 #include <string>
 
 #include "s2s_pobject.h"
@@ -35,17 +36,29 @@ class Arena {
     Arena& operator=(const Arena&) = delete;
 
     // `size` bytes aligned to 8, counted as one live block. Creator's thread only.
-    void* Allocate(size_t size);
+    void* Allocate(size_t size) {
+        size = (size + 7) & ~size_t{7};
+        if (size > static_cast<size_t>(limit_ - cursor_)) {
+            return AllocateSlow(size);
+        }
+        void* at = cursor_;
+        cursor_ += size;
+        ++allocated_;
+        return at;
+    }
     // The creator lets go: from now on the arena lives exactly as long as its blocks.
     void Finish();
     // `blocks` of its blocks were released; the last release frees every chunk.
     void Release(size_t blocks);
 
-  private:
     struct Chunk {
         Chunk* next;
+        size_t size;
     };
+
+  private:
     Arena() = default;
+    void* AllocateSlow(size_t size);
     void Grow(size_t size);
     void Destroy();
 
@@ -126,10 +139,24 @@ struct PObjectAccess {
         from.payload_ = nullptr;
     }
 
-    // A text block of `size` bytes from `arena` (null: the heap).
-    static TextBlock* NewText(Arena* arena, const char* data, size_t size);
+    // A text block of `size` bytes from `arena` (null: the heap), NUL-terminated for log lines.
+    static TextBlock* NewText(Arena* arena, const char* data, size_t size) {
+        const size_t bytes = sizeof(TextBlock) + size + 1;
+        void* raw = arena != nullptr ? arena->Allocate(bytes) : ::operator new(bytes);
+        TextBlock* text = new (raw) TextBlock{arena, size};
+        if (size > 0) {
+            std::memcpy(text->data(), data, size);
+        }
+        text->data()[size] = '\0';
+        return text;
+    }
     // Makes `o` the string `data`: the block is built before the old content goes.
-    static void AssignText(PObject& o, Arena* arena, const char* data, size_t size);
+    static void AssignText(PObject& o, Arena* arena, const char* data, size_t size) {
+        TextBlock* text = NewText(arena, data, size);  // `data` may live inside `o`
+        o.clear();
+        o.type_ = PObject::kString;
+        o.payload_ = text;
+    }
     // A flat map of `count` (>= 1) null entries and `key_bytes` key bytes, to be filled in
     // ascending key order.
     static FlatMap* NewFlat(Arena* arena, uint32_t count, uint32_t key_bytes);

@@ -115,6 +115,19 @@ bool Direct(const Channel& channel) {
 
 constexpr size_t kNoEntry = ~size_t{0};
 
+// The length of a received string as it is kept: up to its first NUL. Short ones are looked at
+// here rather than through a call.
+inline size_t TextLength(const char* text, size_t wire_length) {
+    if (wire_length > 32) {
+        return strnlen(text, wire_length);
+    }
+    size_t n = 0;
+    while (n < wire_length && text[n] != '\0') {
+        ++n;
+    }
+    return n;
+}
+
 // An entry of a flat map still being decoded; its key is in the scratch's key bytes.
 struct PendingEntry {
     PObject value;
@@ -816,6 +829,48 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         return true;
     };
 
+    // Array elements that are maps of primitive entries, each written from its tag to its end
+    // tag in place of the general loop's steps while the ring has room: the counterpart of the
+    // decoder's run. True when it wrote at least one map's tag.
+    auto map_elements_run = [&](size_t array_walk) {
+        for (bool progress = false;; progress = true) {
+            Walk& items = stack[array_walk];
+            if (items.index == items.array->size()) {
+                return progress;
+            }
+            const PObject& element = (*items.array)[items.index];
+            char* room = channel.WriteRoom(1);
+            if (!element.isMap() || room == nullptr) {
+                return progress;
+            }
+            *room = static_cast<char>(kTagMap);
+            channel.Commit(1);
+            ++items.index;
+            ++depth_;
+            // The map's walk goes on the stack only if the map stays open.
+            Walk map{nullptr, 0, nullptr, {}, false, nullptr};
+            if (PObjectAccess::IsFlat(element)) {
+                map.flat = &PObjectAccess::Flat(element);
+            } else {
+                map.map = &element.asMap();
+                map.next = map.map->begin();
+            }
+            entry_run(map);
+            room = channel.WriteRoom(1);
+            if (room == nullptr ||
+                (map.flat != nullptr ? map.index != map.flat->count : map.next != map.map->end())) {
+                stack.push_back(map);
+                return true;
+            }
+            if (map.key_pushed) {
+                PopKey();
+            }
+            *room = static_cast<char>(kTagEnd);
+            channel.Commit(1);
+            --depth_;
+        }
+    };
+
     int ret = 0;
     if (array != nullptr) {
         ret = open_array(*array);
@@ -882,6 +937,9 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             continue;
         }
         if (top.array != nullptr) {
+            if (direct_ && !span_locked_ && map_elements_run(stack.size() - 1)) {
+                continue;  // a map may have been left open: the loop looks again
+            }
             value = &(*top.array)[top.index++];
             continue;
         }
@@ -1093,7 +1151,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 break;
             }
             const char* key = at + 3;
-            const size_t key_size = strnlen(key, key_wire);
+            const size_t key_size = TextLength(key, key_wire);
             if ((entries.size() != top.first &&
                  CompareKeys(keys.data() + entries.back().key_offset, entries.back().key_size, key,
                              key_size) >= 0) ||
@@ -1113,7 +1171,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 target = number;
             } else if (value_tag == kTagString) {
                 PObjectAccess::AssignText(target, arena(), value + 3,
-                                          strnlen(value + 3, value_wire - 3));
+                                          TextLength(value + 3, value_wire - 3));
             }
             received_ += wire;
             at += wire;
@@ -1135,6 +1193,45 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             top.key_done = true;
         }
         channel.Consume(static_cast<unsigned int>(at - start));
+    };
+
+    // Array elements that are maps of primitive entries, each taken from its tag to its end
+    // tag in place of the general loop's steps while they are buffered whole. A map that is not
+    // (a container inside, bytes still to come) stays open for the general loop, as does
+    // anything that is not a map.
+    // True when it took at least one map's tag.
+    auto map_elements_run = [&](size_t array_frame) {
+        for (bool progress = false;; progress = true) {
+            const char* at = channel.BufferedRun(1);
+            if (at == nullptr || static_cast<unsigned char>(*at) != kTagMap ||
+                (max_recv_depth_ != 0 && stack.size() >= max_recv_depth_) ||
+                (max_recv_bytes_ != 0 && received_ + 1 > max_recv_bytes_)) {
+                return progress;
+            }
+            channel.Consume(1);
+            ++received_;
+            Frame& items = stack[array_frame];
+            items.array->emplace_back();
+            items.pending = true;
+            // The map's frame goes on the stack only if the map stays open.
+            Frame map{nullptr,  nullptr,        false,      false, &items.array->back(),
+                      kNoEntry, entries.size(), keys.size()};
+            ++depth_;
+            flat_run(map);
+            at = channel.BufferedRun(1);
+            if (at == nullptr || static_cast<unsigned char>(*at) != kTagEnd) {
+                stack.push_back(map);
+                return true;
+            }
+            channel.Consume(1);
+            ++received_;
+            if (map.key_done) {
+                PopKey();
+            }
+            --depth_;
+            close_flat(map);
+            items.pending = false;
+        }
     };
 
     // Nesting beyond the limit is refused before the container is entered.
@@ -1251,10 +1348,14 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             }
             completed = true;
         } else {
-            Frame& top = stack.back();
-            if (direct_ && !span_locked_ && top.flat()) {
-                flat_run(top);
+            if (direct_ && !span_locked_) {
+                if (stack.back().flat()) {
+                    flat_run(stack.back());
+                } else if (stack.back().array != nullptr && map_elements_run(stack.size() - 1)) {
+                    continue;  // a map may have been left open: the loop looks again
+                }
             }
+            Frame& top = stack.back();
             ret = next_tag(tag);
             if (ret < 0) {
                 break;
