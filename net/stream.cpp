@@ -114,6 +114,82 @@ bool Direct(const Channel& channel) {
 }
 
 constexpr size_t kNoEntry = ~size_t{0};
+// Stacks deeper than this are not kept between messages.
+constexpr size_t kKeptFrames = 256;
+
+// The wire size (tag included) of `value` when it is a primitive that the direct path writes: 0
+// for a container or a string longer than its 16-bit length field.
+[[gnu::always_inline]] inline size_t PrimitiveSize(const PObject& value) {
+    if (value.isNull()) {
+        return 2;
+    }
+    if (value.isInteger()) {
+        return 2 + IntegerLength(value.asUInt64());
+    }
+    if (value.isString()) {
+        const size_t size = PObjectAccess::Text(value).size;
+        return size <= 0xFFFF ? 3 + size : 0;
+    }
+    return 0;
+}
+
+// Writes the primitive `value` at `at` (PrimitiveSize gave its room).
+[[gnu::always_inline]] inline void PutPrimitive(const PObject& value, char* at) {
+    if (value.isString()) {
+        const TextBlock& text = PObjectAccess::Text(value);
+        at[0] = static_cast<char>(PStream::kTagString);
+        at[1] = static_cast<char>(text.size >> 8);
+        at[2] = static_cast<char>(text.size);
+        std::memcpy(at + 3, text.data(), text.size);
+    } else if (value.isNull()) {
+        at[0] = static_cast<char>(PStream::kTagNull);
+        at[1] = 0;
+    } else {
+        const unsigned long long number = value.asUInt64();
+        const unsigned char length = IntegerLength(number);
+        at[0] = static_cast<char>(PStream::kTagInteger);
+        at[1] = static_cast<char>(length);
+        for (unsigned char i = 0; i < length; ++i) {
+            at[2 + i] = static_cast<char>(number >> (8 * (length - 1 - i)));
+        }
+    }
+}
+
+// The wire size (tag included) of the primitive value at `value` when it lies whole before `end`;
+// 0 for a container, a malformed value or one whose bytes are still to come.
+[[gnu::always_inline]] inline size_t PrimitiveWire(const char* value, const char* end) {
+    if (end - value < 2) {
+        return 0;
+    }
+    const unsigned char tag = static_cast<unsigned char>(value[0]);
+    const unsigned int lead = static_cast<unsigned char>(value[1]);
+    size_t wire = 0;
+    if (tag == PStream::kTagInteger && lead <= 8) {
+        wire = 2 + lead;
+    } else if (tag == PStream::kTagNull && lead == 0) {
+        wire = 2;
+    } else if (tag == PStream::kTagString && end - value >= 3) {
+        wire = 3 + ((lead << 8) | static_cast<unsigned char>(value[2]));
+    }
+    return static_cast<size_t>(end - value) >= wire ? wire : 0;
+}
+
+inline size_t TextLength(const char* text, size_t wire_length);
+
+// Stores the primitive value at `value` (PrimitiveWire gave `wire`) into the null `target`.
+[[gnu::always_inline]] inline void StorePrimitive(const char* value, size_t wire, PObject& target,
+                                                  Arena* arena) {
+    const unsigned char tag = static_cast<unsigned char>(value[0]);
+    if (tag == PStream::kTagInteger) {
+        unsigned long long number = 0;
+        for (size_t i = 2; i < wire; ++i) {
+            number = (number << 8) + static_cast<unsigned char>(value[i]);
+        }
+        target = number;
+    } else if (tag == PStream::kTagString) {
+        PObjectAccess::AssignText(target, arena, value + 3, TextLength(value + 3, wire - 3));
+    }
+}
 
 // The length of a received string as it is kept: up to its first NUL. Short ones are looked at
 // here rather than through a call.
@@ -692,11 +768,19 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         bool key_pushed;
         const FlatMap* flat;  // a map still in its flat form (never turned into a std::map here)
     };
-    std::vector<Walk> stack;
+    // The walk's stack is kept by the thread between messages (an encode never runs inside
+    // another on one thread); a deep message's room is given back afterwards.
+    static thread_local std::vector<Walk> stack;
+    stack.clear();
     OpenSpan(channel);
     struct SpanEnd {
         PStream& stream;
-        ~SpanEnd() { stream.CloseSpan(); }
+        ~SpanEnd() {
+            stream.CloseSpan();
+            if (stack.capacity() > kKeptFrames) {
+                std::vector<Walk>().swap(stack);
+            }
+        }
     } span_end{*this};
     auto open_array = [&](const std::vector<PObject>& a) {
         int ret = WriteByte(channel, kTagArray);
@@ -759,47 +843,17 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
                 entry_value = &top.next->second;
             }
             const PObject& current = *entry_value;
-            const char* text = nullptr;
-            size_t value_size = 0;
-            size_t value_wire;
-            if (current.isNull()) {
-                value_wire = 2;
-            } else if (current.isInteger()) {
-                value_size = IntegerLength(current.asUInt64());
-                value_wire = 2 + value_size;
-            } else if (current.isString()) {
-                const TextBlock& block = PObjectAccess::Text(current);
-                text = block.data();
-                value_size = block.size;
-                value_wire = 3 + value_size;
-            } else {
-                break;  // a container: the general loop opens it
-            }
-            if (length > 0xFFFF || value_size > 0xFFFF ||
+            const size_t value_wire = PrimitiveSize(current);
+            if (value_wire == 0 || length > 0xFFFF ||
                 static_cast<size_t>(limit - at) < 3 + length + value_wire) {
-                break;
+                break;  // a container (the general loop opens it), or no room
             }
             at[0] = static_cast<char>(kTagString);
             at[1] = static_cast<char>(length >> 8);
             at[2] = static_cast<char>(length);
             std::memcpy(at + 3, key, length);
             at += 3 + length;
-            if (text != nullptr) {
-                at[0] = static_cast<char>(kTagString);
-                at[1] = static_cast<char>(value_size >> 8);
-                at[2] = static_cast<char>(value_size);
-                std::memcpy(at + 3, text, value_size);
-            } else if (current.isNull()) {
-                at[0] = static_cast<char>(kTagNull);
-                at[1] = 0;
-            } else {
-                const unsigned long long number = current.asUInt64();
-                at[0] = static_cast<char>(kTagInteger);
-                at[1] = static_cast<char>(value_size);
-                for (size_t i = 0; i < value_size; ++i) {
-                    at[2 + i] = static_cast<char>(number >> (8 * (value_size - 1 - i)));
-                }
-            }
+            PutPrimitive(current, at);
             at += value_wire;
             last_key = key;
             last_size = length;
@@ -829,16 +883,27 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         return true;
     };
 
-    // Array elements that are maps of primitive entries, each written from its tag to its end
-    // tag in place of the general loop's steps while the ring has room: the counterpart of the
-    // decoder's run. True when it wrote at least one map's tag.
-    auto map_elements_run = [&](size_t array_walk) {
+    // Array elements that are primitives, or maps of primitive entries written from their tag
+    // to their end tag, in place of the general loop's steps while the ring has room: the
+    // counterpart of the decoder's run. True when it wrote at least one element or map tag.
+    auto elements_run = [&](size_t array_walk) {
         for (bool progress = false;; progress = true) {
             Walk& items = stack[array_walk];
             if (items.index == items.array->size()) {
                 return progress;
             }
             const PObject& element = (*items.array)[items.index];
+            if (const size_t wire = PrimitiveSize(element); wire != 0) {
+                char* room = channel.WriteRoom(static_cast<unsigned int>(wire));
+                if (room == nullptr) {
+                    return progress;
+                }
+                PutPrimitive(element, room);
+                channel.Commit(static_cast<unsigned int>(wire));
+                ResetStatus();
+                ++items.index;
+                continue;
+            }
             char* room = channel.WriteRoom(1);
             if (!element.isMap() || room == nullptr) {
                 return progress;
@@ -937,7 +1002,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             continue;
         }
         if (top.array != nullptr) {
-            if (direct_ && !span_locked_ && map_elements_run(stack.size() - 1)) {
+            if (direct_ && !span_locked_ && elements_run(stack.size() - 1)) {
                 continue;  // a map may have been left open: the loop looks again
             }
             value = &(*top.array)[top.index++];
@@ -996,6 +1061,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     DecodeScratch& scratch = ThreadScratch();
     std::vector<PendingEntry>& entries = scratch.entries;
     std::string& keys = scratch.keys;
+    // Kept by the thread between messages, like the scratch.
+    static thread_local std::vector<Frame> stack;
+    stack.clear();
     // Leaves the scratch empty, the key path readable and lets go of the message's arena on
     // every way out.
     OpenSpan(channel);
@@ -1006,6 +1074,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         ~Cleanup() {
             stream.CloseSpan();
             scratch.Reset();
+            if (stack.capacity() > kKeptFrames) {
+                std::vector<Frame>().swap(stack);
+            }
             if (arena != nullptr) {
                 arena->Finish();
             }
@@ -1018,7 +1089,6 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         return cleanup.arena;
     };
 
-    std::vector<Frame> stack;
     auto open = [&](std::vector<PObject>* a, std::map<std::string, PObject>* m) {
         S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s%s\n", __LINE__, Indent(),
                       a != nullptr ? "[" : "{");
@@ -1119,6 +1189,70 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     // replaced by the next. The run is taken only when no debug line is due (direct_) and no
     // reader holds the key path (a locked span), and stops before anything else, which the
     // general loop below then reads.
+    // A map of primitive entries in ascending key order that lies whole in the ring from `at`
+    // (just past its tag) to its end tag before `end`, built straight into its block (no
+    // scratch, no history: nothing can read the path meanwhile): the wire bytes it took, end
+    // tag included, or 0 when the bytes are not such a map (then nothing is built).
+    auto leaf_map = [&](const char* at, const char* end, PObject& target) -> size_t {
+        if (max_recv_depth_ != 0 && stack.size() >= max_recv_depth_) {
+            return 0;
+        }
+        auto key_wire = [](const char* key_tag) {
+            return static_cast<size_t>((static_cast<unsigned char>(key_tag[1]) << 8) |
+                                       static_cast<unsigned char>(key_tag[2]));
+        };
+        const char* p = at;
+        uint32_t count = 0;
+        size_t key_bytes = 0;
+        const char* previous = nullptr;
+        size_t previous_size = 0;
+        while (p < end && static_cast<unsigned char>(*p) != kTagEnd) {
+            if (static_cast<unsigned char>(*p) != kTagString || end - p < 3 ||
+                static_cast<size_t>(end - p) - 3 < key_wire(p)) {
+                return 0;
+            }
+            const char* key = p + 3;
+            const size_t key_size = TextLength(key, key_wire(p));
+            const size_t value_wire = PrimitiveWire(key + key_wire(p), end);
+            if (value_wire == 0 ||
+                (previous != nullptr && CompareKeys(previous, previous_size, key, key_size) >= 0)) {
+                return 0;
+            }
+            ++count;
+            key_bytes += key_size;
+            previous = key;
+            previous_size = key_size;
+            p = key + key_wire(p) + value_wire;
+        }
+        if (p >= end) {
+            return 0;
+        }
+        FlatMap* flat = nullptr;
+        if (count > 0) {
+            flat = PObjectAccess::NewFlat(arena(), count, static_cast<uint32_t>(key_bytes));
+            FlatEntry* out = flat->entries();
+            uint32_t offset = 0;
+            uint32_t blocks = 1;  // the map, and each of its strings
+            p = at;
+            for (uint32_t i = 0; i < count; ++i) {
+                const char* key = p + 3;
+                const uint32_t key_size = static_cast<uint32_t>(TextLength(key, key_wire(p)));
+                std::memcpy(flat->keys() + offset, key, key_size);
+                out[i].key_offset = offset;
+                out[i].key_size = key_size;
+                offset += key_size;
+                const char* value = key + key_wire(p);
+                const size_t value_wire = PrimitiveWire(value, end);
+                StorePrimitive(value, value_wire, out[i].value, arena());
+                blocks += out[i].value.isString() ? 1 : 0;
+                p = value + value_wire;
+            }
+            flat->leaf_blocks = blocks;
+        }
+        PObjectAccess::AssignFlat(target, flat);
+        return static_cast<size_t>(p + 1 - at);
+    };
+
     auto flat_run = [&](Frame& top) {
         unsigned int buffered = 0;
         const char* const start = channel.BufferedSpan(buffered);
@@ -1133,22 +1267,16 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             if (end - value < 3) {
                 break;
             }
-            const unsigned char value_tag = static_cast<unsigned char>(value[0]);
-            const unsigned int lead = static_cast<unsigned char>(value[1]);
-            size_t value_wire = 0;
-            if (value_tag == kTagInteger && lead <= 8) {
-                value_wire = 2 + lead;
-            } else if (value_tag == kTagString) {
-                value_wire = 3 + ((lead << 8) | static_cast<unsigned char>(value[2]));
-            } else if (value_tag == kTagNull && lead == 0) {
-                value_wire = 2;
-            } else {
-                break;  // a container, or something the general loop reports
+            // A map of primitives as the value is taken whole too.
+            PObject nested;
+            size_t value_wire = PrimitiveWire(value, end);
+            if (value_wire == 0 && static_cast<unsigned char>(value[0]) == kTagMap) {
+                value_wire = leaf_map(value + 1, end, nested);
+                value_wire += value_wire != 0 ? 1 : 0;
             }
             const size_t wire = 3 + key_wire + value_wire;
-            if (static_cast<size_t>(end - value) < value_wire ||
-                (max_recv_bytes_ != 0 && received_ + wire > max_recv_bytes_)) {
-                break;
+            if (value_wire == 0 || (max_recv_bytes_ != 0 && received_ + wire > max_recv_bytes_)) {
+                break;  // not whole, a container, or something the general loop reports
             }
             const char* key = at + 3;
             const size_t key_size = TextLength(key, key_wire);
@@ -1162,16 +1290,10 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             entry.key_offset = keys.size();
             entry.key_size = static_cast<uint32_t>(key_size);
             keys.append(key, key_size);
-            PObject& target = entry.value;
-            if (value_tag == kTagInteger) {
-                unsigned long long number = 0;
-                for (unsigned int i = 0; i < lead; ++i) {
-                    number = (number << 8) + static_cast<unsigned char>(value[2 + i]);
-                }
-                target = number;
-            } else if (value_tag == kTagString) {
-                PObjectAccess::AssignText(target, arena(), value + 3,
-                                          TextLength(value + 3, value_wire - 3));
+            if (nested.isMap()) {
+                PObjectAccess::Move(entry.value, nested);
+            } else {
+                StorePrimitive(value, value_wire, entry.value, arena());
             }
             received_ += wire;
             at += wire;
@@ -1195,18 +1317,36 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         channel.Consume(static_cast<unsigned int>(at - start));
     };
 
-    // Array elements that are maps of primitive entries, each taken from its tag to its end
-    // tag in place of the general loop's steps while they are buffered whole. A map that is not
-    // (a container inside, bytes still to come) stays open for the general loop, as does
-    // anything that is not a map.
-    // True when it took at least one map's tag.
-    auto map_elements_run = [&](size_t array_frame) {
+    // Array elements that are primitives, or maps of primitive entries taken from their tag to
+    // their end tag, in place of the general loop's steps while they are buffered whole. A map
+    // that is not (a container inside, bytes still to come) stays open for the general loop, as
+    // does anything else. True when it took at least one element or map tag.
+    auto elements_run = [&](size_t array_frame) {
         for (bool progress = false;; progress = true) {
-            const char* at = channel.BufferedRun(1);
+            unsigned int run = 0;
+            const char* at = channel.BufferedSpan(run);
+            const size_t primitive = at == nullptr ? 0 : PrimitiveWire(at, at + run);
+            if (primitive != 0 &&
+                (max_recv_bytes_ == 0 || received_ + primitive <= max_recv_bytes_)) {
+                ResetStatus();
+                StorePrimitive(at, primitive, stack[array_frame].array->emplace_back(), arena());
+                channel.Consume(static_cast<unsigned int>(primitive));
+                received_ += primitive;
+                continue;
+            }
             if (at == nullptr || static_cast<unsigned char>(*at) != kTagMap ||
                 (max_recv_depth_ != 0 && stack.size() >= max_recv_depth_) ||
                 (max_recv_bytes_ != 0 && received_ + 1 > max_recv_bytes_)) {
                 return progress;
+            }
+            PObject whole;
+            const size_t wire = leaf_map(at + 1, at + run, whole);
+            if (wire != 0 && (max_recv_bytes_ == 0 || received_ + 1 + wire <= max_recv_bytes_)) {
+                ResetStatus();
+                stack[array_frame].array->push_back(std::move(whole));
+                channel.Consume(static_cast<unsigned int>(1 + wire));
+                received_ += 1 + wire;
+                continue;
             }
             channel.Consume(1);
             ++received_;
@@ -1351,7 +1491,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             if (direct_ && !span_locked_) {
                 if (stack.back().flat()) {
                     flat_run(stack.back());
-                } else if (stack.back().array != nullptr && map_elements_run(stack.size() - 1)) {
+                } else if (stack.back().array != nullptr && elements_run(stack.size() - 1)) {
                     continue;  // a map may have been left open: the loop looks again
                 }
             }
