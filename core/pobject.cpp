@@ -91,10 +91,6 @@ size_t RoundUp8(size_t size) {
     return (size + 7) & ~size_t{7};
 }
 
-void* AllocateBlock(Arena* arena, size_t size) {
-    return arena != nullptr ? arena->Allocate(size) : ::operator new(size);
-}
-
 // Releases of arena blocks are added up and handed to the arena together.
 class Releaser {
   public:
@@ -205,22 +201,6 @@ void Arena::Destroy() {
 }
 
 // --- Storage forms -----------------------------------------------------------------------------
-
-FlatMap* PObjectAccess::NewFlat(Arena* arena, uint32_t count, uint32_t key_bytes) {
-    void* raw = AllocateBlock(arena, sizeof(FlatMap) + count * sizeof(FlatEntry) + key_bytes);
-    FlatMap* flat = new (raw) FlatMap{arena, count, key_bytes, 0};
-    FlatEntry* entries = flat->entries();
-    for (uint32_t i = 0; i < count; ++i) {
-        new (&entries[i]) FlatEntry{PObject(), 0, 0};
-    }
-    return flat;
-}
-
-void PObjectAccess::AssignFlat(PObject& o, FlatMap* flat) {
-    o.clear();
-    o.type_ = PObject::kMap;
-    o.payload_ = flat == nullptr ? nullptr : reinterpret_cast<char*>(flat) + 1;
-}
 
 PObject::Map& PObjectAccess::Materialise(PObject& o) {
     FlatMap& flat = Flat(o);

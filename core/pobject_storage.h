@@ -159,9 +159,22 @@ struct PObjectAccess {
     }
     // A flat map of `count` (>= 1) null entries and `key_bytes` key bytes, to be filled in
     // ascending key order.
-    static FlatMap* NewFlat(Arena* arena, uint32_t count, uint32_t key_bytes);
+    static FlatMap* NewFlat(Arena* arena, uint32_t count, uint32_t key_bytes) {
+        const size_t bytes = sizeof(FlatMap) + count * sizeof(FlatEntry) + key_bytes;
+        void* raw = arena != nullptr ? arena->Allocate(bytes) : ::operator new(bytes);
+        FlatMap* flat = new (raw) FlatMap{arena, count, key_bytes, 0};
+        FlatEntry* entries = flat->entries();
+        for (uint32_t i = 0; i < count; ++i) {
+            new (&entries[i]) FlatEntry{PObject(), 0, 0};
+        }
+        return flat;
+    }
     // Makes `o` the map `flat` (null: the empty map), dropping what it held.
-    static void AssignFlat(PObject& o, FlatMap* flat);
+    static void AssignFlat(PObject& o, FlatMap* flat) {
+        o.clear();
+        o.type_ = PObject::kMap;
+        o.payload_ = flat == nullptr ? nullptr : reinterpret_cast<char*>(flat) + 1;
+    }
     // The flat map of `o` turned into its std::map.
     static PObject::Map& Materialise(PObject& o);
 };
