@@ -2,15 +2,24 @@
 // serving thread (IPCListener, accept, IPCSender::assign, recv, send), over a domain socket and
 // over TCP loopback. The anchor is a raw ping-pong of the same encoded bytes over the same kind
 // of socket: write the request, read it whole, write the reply, read it whole.
+//
+// Where the two threads run decides the figures on a small shared machine: left to the scheduler,
+// the same binary alternates between two modes several times apart (a wake-up on the same core
+// or across cores, with idle exits in between). --pin=one (the default) keeps both threads on
+// one core, --pin=two puts the client on one core and the serving thread on another, --pin=none
+// leaves them to the scheduler. The same placement applies to every case, anchors included.
 #include <arpa/inet.h>
 #include <benchmark/benchmark.h>
 #include <netinet/in.h>
+#include <pthread.h>
+#include <sched.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <string>
 #include <thread>
 
@@ -24,6 +33,23 @@ namespace {
 using S2S::IPCListener;
 using S2S::IPCSender;
 using S2S::PObject;
+
+enum class Placement { kNone, kOneCore, kTwoCores };
+Placement g_placement = Placement::kOneCore;
+
+// The core a thread of the measurement runs on (`serving` tells the two threads apart); nothing
+// is changed with --pin=none.
+void Place(bool serving) {
+    if (g_placement == Placement::kNone) {
+        return;
+    }
+    cpu_set_t set;
+    CPU_ZERO(&set);
+    CPU_SET(g_placement == Placement::kTwoCores && serving ? 1 : 0, &set);
+    if (pthread_setaffinity_np(pthread_self(), sizeof(set), &set) != 0) {
+        s2s_bench::Die("pthread_setaffinity_np");
+    }
+}
 
 PObject Reply() {
     PObject reply;
@@ -95,7 +121,9 @@ void BM_IPC(benchmark::State& state, bool domain) {
     const PObject request = s2s_bench::TaskMap();
     const PObject answer = Reply();
     Endpoint endpoint(domain);
+    Place(false);
     std::thread server([&] {
+        Place(true);
         int fd = endpoint.listener.accept();
         IPCSender end;
         if (fd < 0 || end.assign(fd) != 0) {
@@ -130,7 +158,9 @@ void BM_RawPingPong(benchmark::State& state, bool domain) {
     const std::string request = Encoded(s2s_bench::TaskMap());
     const std::string answer = Encoded(Reply());
     Endpoint endpoint(domain);
+    Place(false);
     std::thread server([&] {
+        Place(true);
         int fd = endpoint.listener.accept();
         if (fd < 0) {
             s2s_bench::Die("accept");
@@ -183,4 +213,30 @@ BENCHMARK_CAPTURE(BM_RawPingPong, tcp_loopback, false)->UseRealTime()->MeasurePr
 
 }  // namespace
 
-BENCHMARK_MAIN();
+// --pin=none|one|two is taken out before the benchmark library reads the other flags.
+int main(int argc, char** argv) {
+    int kept = 1;
+    for (int i = 1; i < argc; ++i) {
+        const char* arg = argv[i];
+        if (std::strncmp(arg, "--pin=", 6) != 0) {
+            argv[kept++] = argv[i];
+        } else if (std::strcmp(arg + 6, "none") == 0) {
+            g_placement = Placement::kNone;
+        } else if (std::strcmp(arg + 6, "one") == 0) {
+            g_placement = Placement::kOneCore;
+        } else if (std::strcmp(arg + 6, "two") == 0) {
+            g_placement = Placement::kTwoCores;
+        } else {
+            std::fprintf(stderr, "%s: --pin takes none, one or two\n", argv[0]);
+            return 2;
+        }
+    }
+    argc = kept;
+    benchmark::Initialize(&argc, argv);
+    if (benchmark::ReportUnrecognizedArguments(argc, argv)) {
+        return 1;
+    }
+    benchmark::RunSpecifiedBenchmarks();
+    benchmark::Shutdown();
+    return 0;
+}
