@@ -5,11 +5,18 @@
 //
 // Results are 0 (or a port / descriptor where stated) and -1 for any failure; the cause is in the
 // log. Nothing here locks: each object is used by one thread at a time.
+//
+// A sender keeps one PStream for all the messages of a connection instead of building one per
+// message: a stream is clean again after every Send and Recv (key path, depth and counters
+// cleared, the byte count restarted), so no message sees another's state, and the buffers of its
+// key path are allocated once instead of per message. close() replaces the stream, so what a
+// connection's messages made it hold goes with the connection.
 #ifndef S2S_IPC_H
 #define S2S_IPC_H
 
 #include <sys/time.h>
 
+#include <optional>
 #include <string>
 
 #include "s2s_channel.h"
@@ -89,6 +96,8 @@ class S2S_EXPORT IPCSender {
     Channel channel_;
 
   private:
+    // Always engaged; re-created by close().
+    std::optional<PStream> stream_;
     size_t max_recv_bytes_ = PStream::kDefaultMaxRecvBytes;
     unsigned int max_recv_depth_ = PStream::kDefaultMaxRecvDepth;
 };

@@ -276,7 +276,9 @@ int IPCListener::CloseDomainSocket(int fd) {
 
 // --- IPCSender -----------------------------------------------------------------------------
 
-IPCSender::IPCSender() : channel_(kCapacity) {}
+IPCSender::IPCSender() : channel_(kCapacity) {
+    stream_.emplace();
+}
 
 IPCSender::~IPCSender() {
     close();
@@ -295,8 +297,7 @@ int IPCSender::assign(int fd) {
 }
 
 int IPCSender::send(const PObject& obj) {
-    PStream stream;
-    return stream.Send(channel_, obj) < 0 ? -1 : 0;
+    return stream_->Send(channel_, obj) < 0 ? -1 : 0;
 }
 
 int IPCSender::send(const PObject& obj, bool wait_reply, PObject& reply) {
@@ -307,13 +308,13 @@ int IPCSender::send(const PObject& obj, bool wait_reply, PObject& reply) {
 }
 
 int IPCSender::recv(PObject& obj) {
-    PStream stream;
-    stream.SetRecvLimits(max_recv_bytes_, max_recv_depth_);
-    return stream.Recv(channel_, obj) < 0 ? -1 : 0;
+    stream_->SetRecvLimits(max_recv_bytes_, max_recv_depth_);
+    return stream_->Recv(channel_, obj) < 0 ? -1 : 0;
 }
 
 void IPCSender::close() {
     channel_.Close();
+    stream_.emplace();
 }
 
 }  // namespace S2S

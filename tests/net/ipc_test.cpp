@@ -94,6 +94,21 @@ TEST(IPCTest, RequestReplyOneWayReceiveLimitsAndAPeerGone) {
     EXPECT_TRUE(log.Contains("): PStream: message nested deeper than 2 levels refused\n"));
 }
 
+// A sender keeps one stream for all its messages: the byte limit counts each message alone.
+TEST(IPCTest, EveryMessageOfOneSenderStartsClean) {
+    s2s_test::SocketPair pair;
+    IPCSender a, b;
+    ASSERT_EQ(0, a.assign(pair.ReleaseA()));
+    ASSERT_EQ(0, b.assign(pair.ReleaseB()));
+    b.SetRecvLimits(64, 2);  // one request is 52 bytes
+    for (int i = 0; i < 10; ++i) {
+        PObject got;
+        ASSERT_EQ(0, a.send(Request()));
+        ASSERT_EQ(0, b.recv(got));
+        EXPECT_EQ(Request().toString(), got.toString());
+    }
+}
+
 TEST(IPCTest, RequestAndReplyWithServerInAnotherProcessOverADomainSocket) {
     TempDir dir("s2s-ipc");
     const std::string path = dir / "daemon.sock";
