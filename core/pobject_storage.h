@@ -139,6 +139,12 @@ struct PObjectAccess {
         from.payload_ = nullptr;
     }
 
+    // Makes the null object `o` the integer `value`.
+    static void SetInteger(PObject& o, unsigned long long value) {
+        o.type_ = PObject::kInteger;
+        o.number_ = value;
+    }
+
     // A text block of `size` bytes from `arena` (null: the heap), NUL-terminated for log lines.
     static TextBlock* NewText(Arena* arena, const char* data, size_t size) {
         const size_t bytes = sizeof(TextBlock) + size + 1;

@@ -176,7 +176,7 @@ constexpr size_t kKeptFrames = 256;
 
 inline size_t TextLength(const char* text, size_t wire_length);
 
-// Stores the primitive value at `value` (PrimitiveWire gave `wire`) into the null `target`.
+// Stores the primitive value at `value` (PrimitiveWire gave `wire`) into `target`, which is null.
 [[gnu::always_inline]] inline void StorePrimitive(const char* value, size_t wire, PObject& target,
                                                   Arena* arena) {
     const unsigned char tag = static_cast<unsigned char>(value[0]);
@@ -185,7 +185,7 @@ inline size_t TextLength(const char* text, size_t wire_length);
         for (size_t i = 2; i < wire; ++i) {
             number = (number << 8) + static_cast<unsigned char>(value[i]);
         }
-        target = number;
+        PObjectAccess::SetInteger(target, number);
     } else if (tag == PStream::kTagString) {
         PObjectAccess::AssignText(target, arena, value + 3, TextLength(value + 3, wire - 3));
     }
