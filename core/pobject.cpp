@@ -91,6 +91,39 @@ size_t RoundUp8(size_t size) {
     return (size + 7) & ~size_t{7};
 }
 
+// The containers a release still has to visit: the first few in place, so that releasing an
+// ordinary message allocates nothing.
+class WorkList {
+  public:
+    // Moves `value` in; it is null afterwards.
+    void Push(PObject& value) {
+        if (count_ < kInPlace) {
+            in_place_[count_++].swap(value);
+        } else {
+            spilled_.emplace_back(std::move(value));
+        }
+    }
+    // Moves the latest value into the null `to`; false when there is none.
+    bool Pop(PObject& to) {
+        if (!spilled_.empty()) {
+            to.swap(spilled_.back());
+            spilled_.pop_back();
+            return true;
+        }
+        if (count_ == 0) {
+            return false;
+        }
+        to.swap(in_place_[--count_]);
+        return true;
+    }
+
+  private:
+    static constexpr size_t kInPlace = 8;
+    PObject in_place_[kInPlace];
+    size_t count_ = 0;
+    std::vector<PObject> spilled_;
+};
+
 // Releases of arena blocks are added up and handed to the arena together.
 class Releaser {
   public:
@@ -442,7 +475,7 @@ void PObject::clear() {
         // of leaves holds is released with the map in one step (its blocks were counted when it
         // was built), and strings go at once.
         Releaser releaser;
-        std::vector<PObject> pending;
+        WorkList pending;
         // Releases `child` here when that needs no walk (adding its arena blocks to the
         // releaser's count instead of paying an atomic step of its own), else moves it to the
         // work list.
@@ -452,7 +485,7 @@ void PObject::clear() {
                 releaser.Free(text, text->arena);
             } else if (child.isContainer() && child.payload_ != nullptr) {
                 if (!PObjectAccess::IsFlat(child) || PObjectAccess::Flat(child).leaf_blocks == 0) {
-                    pending.emplace_back(std::move(child));
+                    pending.Push(child);
                     return;
                 }
                 FlatMap& flat = PObjectAccess::Flat(child);
@@ -508,11 +541,9 @@ void PObject::clear() {
             }
             current.type_ = kNull;
             current.payload_ = nullptr;
-            if (pending.empty()) {
+            if (!pending.Pop(current)) {
                 break;
             }
-            current.swap(pending.back());
-            pending.pop_back();
         }
     }
     type_ = kNull;

@@ -139,6 +139,8 @@ struct PObjectAccess {
         from.payload_ = nullptr;
     }
 
+    // REQUIRES: o.isInteger().
+    static unsigned long long Number(const PObject& o) { return o.number_; }
     // Makes the null object `o` the integer `value`.
     static void SetInteger(PObject& o, unsigned long long value) {
         o.type_ = PObject::kInteger;

@@ -14,6 +14,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <tuple>
 #include <typeinfo>
 
@@ -124,7 +125,7 @@ constexpr size_t kKeptFrames = 256;
         return 2;
     }
     if (value.isInteger()) {
-        return 2 + IntegerLength(value.asUInt64());
+        return 2 + IntegerLength(PObjectAccess::Number(value));
     }
     if (value.isString()) {
         const size_t size = PObjectAccess::Text(value).size;
@@ -145,7 +146,7 @@ constexpr size_t kKeptFrames = 256;
         at[0] = static_cast<char>(PStream::kTagNull);
         at[1] = 0;
     } else {
-        const unsigned long long number = value.asUInt64();
+        const unsigned long long number = PObjectAccess::Number(value);
         const unsigned char length = IntegerLength(number);
         at[0] = static_cast<char>(PStream::kTagInteger);
         at[1] = static_cast<char>(length);
@@ -197,15 +198,22 @@ inline size_t TextLength(const char* text, size_t wire_length) {
     if (wire_length > 64) {
         return strnlen(text, wire_length);
     }
-    // Eight bytes at a time: a word holds a zero byte exactly when this expression is non-zero.
+    // Eight bytes at a time: a word holds a zero byte exactly when HasZero is non-zero. The last
+    // word is read where it ends with the text (overlapping the one before), so a text without
+    // NUL, the usual case, is settled without a byte loop.
     constexpr uint64_t kOnes = 0x0101010101010101ULL;
     constexpr uint64_t kHighs = 0x8080808080808080ULL;
-    size_t n = 0;
-    for (; n + 8 <= wire_length; n += 8) {
+    auto has_zero = [](const char* at) {
         uint64_t word;
-        std::memcpy(&word, text + n, sizeof(word));
-        if (((word - kOnes) & ~word & kHighs) != 0) {
-            break;
+        std::memcpy(&word, at, sizeof(word));
+        return ((word - kOnes) & ~word & kHighs) != 0;
+    };
+    size_t n = 0;
+    if (wire_length >= 8) {
+        for (; n + 8 <= wire_length && !has_zero(text + n); n += 8) {
+        }
+        if (n + 8 > wire_length && !has_zero(text + wire_length - 8)) {
+            return wire_length;
         }
     }
     while (n < wire_length && text[n] != '\0') {
@@ -221,12 +229,50 @@ struct PendingEntry {
     uint32_t key_size = 0;
 };
 
+// The key bytes of the flat maps open in a decode: a byte buffer whose append is inline (a key
+// is appended for every map entry received).
+class KeyBytes {
+  public:
+    size_t size() const { return size_; }
+    size_t capacity() const { return capacity_; }
+    const char* data() const { return bytes_.get(); }
+    void clear() { size_ = 0; }
+    // REQUIRES: size <= size().
+    void resize(size_t size) { size_ = size; }
+    void append(const char* key, size_t length) {
+        if (capacity_ - size_ < length) {
+            Grow(length);
+        }
+        std::memcpy(bytes_.get() + size_, key, length);
+        size_ += length;
+    }
+    void Release() {
+        bytes_.reset();
+        size_ = 0;
+        capacity_ = 0;
+    }
+
+  private:
+    void Grow(size_t length) {
+        size_t capacity = std::max<size_t>(256, std::max(capacity_ * 2, size_ + length));
+        std::unique_ptr<char[]> bytes(new char[capacity]);
+        if (size_ > 0) {
+            std::memcpy(bytes.get(), bytes_.get(), size_);
+        }
+        bytes_ = std::move(bytes);
+        capacity_ = capacity;
+    }
+    std::unique_ptr<char[]> bytes_;
+    size_t size_ = 0;
+    size_t capacity_ = 0;
+};
+
 // The entries and keys of the flat maps open in a decode, innermost last. One per thread, kept
 // between messages so that a receive does not allocate them again (a decode never runs inside
 // another on one thread); a large message's room is given back afterwards.
 struct DecodeScratch {
     std::vector<PendingEntry> entries;
-    std::string keys;
+    KeyBytes keys;
     void Reset() {
         entries.clear();
         keys.clear();
@@ -234,7 +280,7 @@ struct DecodeScratch {
             std::vector<PendingEntry>().swap(entries);
         }
         if (keys.capacity() > kKeptEntries * 16) {
-            std::string().swap(keys);
+            keys.Release();
         }
     }
     static constexpr size_t kKeptEntries = 1024;
@@ -878,10 +924,20 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         }
         channel.Commit(static_cast<unsigned int>(at - start));
         ResetStatus();
-        // At the map's end the key would only be taken off again before the end tag.
-        const bool map_done =
-            top.flat != nullptr ? top.index == top.flat->count : top.next == top.map->end();
-        if (map_done) {
+        // At the map's end the key would only be taken off again before the end tag; when the
+        // next key fits the ring, the general loop writes it at once (no wait) and puts it on
+        // the path in this key's place. Nothing can read the path in between.
+        if (top.flat != nullptr ? top.index == top.flat->count : top.next == top.map->end()) {
+            return true;
+        }
+        size_t next_length = 0;
+        if (top.flat != nullptr) {
+            WireKey(top.flat->key(static_cast<uint32_t>(top.index)),
+                    top.flat->entries()[top.index].key_size, next_length);
+        } else {
+            WireKey(top.next->first.data(), top.next->first.size(), next_length);
+        }
+        if (next_length <= 0xFFFF && static_cast<size_t>(limit - at) >= 3 + next_length) {
             return true;
         }
         if (top.key_pushed) {
@@ -1070,7 +1126,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                     std::vector<PObject>* array, std::map<std::string, PObject>* map) {
     DecodeScratch& scratch = ThreadScratch();
     std::vector<PendingEntry>& entries = scratch.entries;
-    std::string& keys = scratch.keys;
+    KeyBytes& keys = scratch.keys;
     // Kept by the thread between messages, like the scratch.
     static thread_local std::vector<Frame> stack;
     stack.clear();
@@ -1315,9 +1371,15 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             return;
         }
         ResetStatus();
-        // When the map's end tag follows in the ring, the key would only be taken off again:
-        // nothing can read the path before that (the end tag needs no wait).
-        if (at == end || static_cast<unsigned char>(*at) != kTagEnd) {
+        // When the map's end tag follows in the ring, the key would only be taken off again, and
+        // when a whole key follows, the general loop reads it at once (no wait) and puts it on
+        // the path in this key's place. Nothing can read the path in between.
+        const bool end_follows = at < end && static_cast<unsigned char>(*at) == kTagEnd;
+        const bool key_follows = end - at >= 3 && static_cast<unsigned char>(*at) == kTagString &&
+                                 static_cast<size_t>(end - at) - 3 >=
+                                     static_cast<size_t>((static_cast<unsigned char>(at[1]) << 8) |
+                                                         static_cast<unsigned char>(at[2]));
+        if (!end_follows && !key_follows) {
             if (top.key_done) {
                 ReplaceKey(last_key, last_size);
             } else {
@@ -1340,7 +1402,20 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             if (primitive != 0 &&
                 (max_recv_bytes_ == 0 || received_ + primitive <= max_recv_bytes_)) {
                 ResetStatus();
-                StorePrimitive(at, primitive, stack[array_frame].array->emplace_back(), arena());
+                std::vector<PObject>& items = *stack[array_frame].array;
+                if (items.size() == items.capacity()) {
+                    // Room for every primitive element buffered from here at once.
+                    size_t count = 0;
+                    for (const char* next = at; next < at + run; ++count) {
+                        const size_t hop = PrimitiveWire(next, at + run);
+                        if (hop == 0) {
+                            break;
+                        }
+                        next += hop;
+                    }
+                    items.reserve(items.size() + count);
+                }
+                StorePrimitive(at, primitive, items.emplace_back(), arena());
                 channel.Consume(static_cast<unsigned int>(primitive));
                 received_ += primitive;
                 continue;
