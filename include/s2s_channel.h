@@ -172,12 +172,14 @@ class S2S_EXPORT Channel {
     }
     // The unconsumed bytes that lie in one piece from the read position: their start and, in
     // `len`, their count (null and 0 when nothing is buffered or the channel is closed).
+    // A head left at the ring's end (the unconsumed bytes start at index 0) also gives null: the
+    // long way reads them.
     const char* BufferedSpan(unsigned int& len) const {
-        if (handle_ == nullptr || r_size_ == 0) {
+        len = r_size_ < capacity_ - r_head_ ? r_size_ : capacity_ - r_head_;
+        if (handle_ == nullptr || len == 0) {
             len = 0;
             return nullptr;
         }
-        len = r_size_ < capacity_ - r_head_ ? r_size_ : capacity_ - r_head_;
         return r_buf_.get() + r_head_;
     }
     // REQUIRES: BufferedRun(len) or BufferedSpan gave at least `len` bytes.

@@ -267,9 +267,8 @@ class KeyBytes {
     size_t capacity_ = 0;
 };
 
-// The entries and keys of the flat maps open in a decode, innermost last. One per thread, kept
-// between messages so that a receive does not allocate them again (a decode never runs inside
-// another on one thread); a large message's room is given back afterwards.
+// The entries and keys of the flat maps open in a decode, innermost last (kept by the thread
+// between messages, see ThreadKept); a large message's room is given back afterwards.
 struct DecodeScratch {
     std::vector<PendingEntry> entries;
     KeyBytes keys;
@@ -286,10 +285,34 @@ struct DecodeScratch {
     static constexpr size_t kKeptEntries = 1024;
 };
 
-DecodeScratch& ThreadScratch() {
-    static thread_local DecodeScratch scratch;
-    return scratch;
-}
+// The working storage of a decode or encode that the thread keeps between messages, so that a
+// transfer does not allocate it again; or, when a transfer runs inside another on the same thread
+// (a channel subclass that sends or receives in its own steps), a fresh one of its own.
+template <typename T>
+class ThreadKept {
+  public:
+    ThreadKept() : nested_(Busy()) { Busy() = true; }
+    ~ThreadKept() {
+        if (!nested_) {
+            Busy() = false;
+        }
+    }
+    ThreadKept(const ThreadKept&) = delete;
+    ThreadKept& operator=(const ThreadKept&) = delete;
+    T& get() { return nested_ ? own_ : Shared(); }
+
+  private:
+    static T& Shared() {
+        static thread_local T kept;
+        return kept;
+    }
+    static bool& Busy() {
+        static thread_local bool busy = false;
+        return busy;
+    }
+    const bool nested_;
+    T own_;
+};
 
 }  // namespace
 
@@ -824,20 +847,22 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         bool key_pushed;
         const FlatMap* flat;  // a map still in its flat form (never turned into a std::map here)
     };
-    // The walk's stack is kept by the thread between messages (an encode never runs inside
-    // another on one thread); a deep message's room is given back afterwards.
-    static thread_local std::vector<Walk> stack;
+    // The walk's stack is kept by the thread between messages; a deep message's room is given
+    // back afterwards.
+    ThreadKept<std::vector<Walk>> kept_stack;
+    std::vector<Walk>& stack = kept_stack.get();
     stack.clear();
     OpenSpan(channel);
     struct SpanEnd {
         PStream& stream;
+        std::vector<Walk>& stack;
         ~SpanEnd() {
             stream.CloseSpan();
             if (stack.capacity() > kKeptFrames) {
                 std::vector<Walk>().swap(stack);
             }
         }
-    } span_end{*this};
+    } span_end{*this, stack};
     auto open_array = [&](const std::vector<PObject>& a) {
         int ret = WriteByte(channel, kTagArray);
         if (ret < 0) {
@@ -1124,11 +1149,12 @@ int PStream::SendKey(Channel& channel, const char* key, size_t length) {
 
 int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned char tag,
                     std::vector<PObject>* array, std::map<std::string, PObject>* map) {
-    DecodeScratch& scratch = ThreadScratch();
+    ThreadKept<DecodeScratch> kept_scratch;
+    DecodeScratch& scratch = kept_scratch.get();
     std::vector<PendingEntry>& entries = scratch.entries;
     KeyBytes& keys = scratch.keys;
-    // Kept by the thread between messages, like the scratch.
-    static thread_local std::vector<Frame> stack;
+    ThreadKept<std::vector<Frame>> kept_stack;
+    std::vector<Frame>& stack = kept_stack.get();
     stack.clear();
     // Leaves the scratch empty, the key path readable and lets go of the message's arena on
     // every way out.
@@ -1136,6 +1162,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     struct Cleanup {
         PStream& stream;
         DecodeScratch& scratch;
+        std::vector<Frame>& stack;
         Arena* arena = nullptr;
         ~Cleanup() {
             stream.CloseSpan();
@@ -1147,7 +1174,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 arena->Finish();
             }
         }
-    } cleanup{*this, scratch};
+    } cleanup{*this, scratch, stack};
     auto arena = [&cleanup] {
         if (cleanup.arena == nullptr) {
             cleanup.arena = Arena::Create();
@@ -1330,10 +1357,10 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         while (end - at >= 5 && static_cast<unsigned char>(at[0]) == kTagString) {
             const size_t key_wire =
                 (static_cast<unsigned char>(at[1]) << 8) | static_cast<unsigned char>(at[2]);
-            const char* value = at + 3 + key_wire;
-            if (end - value < 3) {
-                break;
+            if (static_cast<size_t>(end - at) < 3 + key_wire + 3) {
+                break;  // the key and the start of its value are not buffered yet
             }
+            const char* value = at + 3 + key_wire;
             // A map of primitives as the value is taken whole too.
             PObject nested;
             size_t value_wire = PrimitiveWire(value, end);
@@ -1439,24 +1466,25 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             Frame& items = stack[array_frame];
             items.array->emplace_back();
             items.pending = true;
-            // The map's frame goes on the stack only if the map stays open.
-            Frame map{nullptr,  nullptr,        false,      false, &items.array->back(),
-                      kNoEntry, entries.size(), keys.size()};
+            // On the stack while its entries are read, so that the depth of what they hold is
+            // counted from it.
+            stack.push_back(Frame{nullptr, nullptr, false, false, &items.array->back(), kNoEntry,
+                                  entries.size(), keys.size()});
             ++depth_;
-            flat_run(map);
+            flat_run(stack.back());
             at = channel.BufferedRun(1);
             if (at == nullptr || static_cast<unsigned char>(*at) != kTagEnd) {
-                stack.push_back(map);
                 return true;
             }
             channel.Consume(1);
             ++received_;
-            if (map.key_done) {
+            if (stack.back().key_done) {
                 PopKey();
             }
             --depth_;
-            close_flat(map);
-            items.pending = false;
+            close_flat(stack.back());
+            stack.pop_back();
+            stack[array_frame].pending = false;
         }
     };
 

@@ -121,6 +121,20 @@ TEST(PStreamTest, NestedValuesRoundTripAcrossSmallRings) {
     PObject back;
     ASSERT_EQ(0, Decode(bytes, back, 16));
     EXPECT_EQ(task.toString(), back.toString());
+
+    // Bytes that wrapped to the front of a ring whose head was left at its very end.
+    SocketPair pair;
+    Channel ring(8);
+    ASSERT_EQ(0, ring.Open(pair.ReleaseA(), true));
+    char skipped[4];
+    s2s_test::WriteAll(pair.b, "JJJJ" + Bytes({0x41, 0x01}));
+    ASSERT_EQ(0, ring.ReadMore(1));
+    ASSERT_EQ(0, ring.Read(skipped, 4));
+    s2s_test::WriteAll(pair.b, Bytes({0x01, 0x05, 0x01, 0x01, 0x07, 0x40}));
+    ASSERT_EQ(0, ring.ReadMore(1));
+    ASSERT_EQ(0, ring.ReadMore(1));
+    ASSERT_EQ(0, PStream().Recv(ring, back));
+    EXPECT_EQ("[5, 7]", back.toString());
 }
 
 // Streams that break the format: each ends with its status, its log line and what was received
@@ -265,12 +279,18 @@ TEST(PStreamTest, TruncatedStalledAndClosedPeersEndWithAStatus) {
 
 TEST(PStreamTest, ReceiveLimitsRefuseDeepAndLongMessages) {
     LogCapture log(S2S::Logger::Error);
+    const size_t bytes_limit = PStream::kDefaultMaxRecvBytes;
     const unsigned int deepest = PStream::kDefaultMaxRecvDepth;
     PObject back;
     EXPECT_EQ(0, Decode(std::string(deepest, '\x41') + std::string(deepest, '\x40'), back));
     EXPECT_EQ(kProtocol,
               Decode(std::string(deepest + 1, '\x41') + std::string(deepest + 1, '\x40'), back));
     EXPECT_TRUE(log.Contains("): PStream: message nested deeper than 512 levels refused\n"));
+    // Maps inside an array count their levels like any other container.
+    const std::string nested = Bytes({0x41, 0x42, 0x10, 0x00, 0x01, 'a', 0x42, 0x10, 0x00, 0x01,
+                                      'b', 0x01, 0x01, 0x01, 0x40, 0x40, 0x40});
+    EXPECT_EQ(kProtocol, Decode(nested, back, 4096, bytes_limit, 2));
+    EXPECT_EQ(0, Decode(nested, back, 4096, bytes_limit, 3));
     // 11 strings of 100 bytes: 1,139 bytes on the wire.
     PObject strings;
     strings.asArray().assign(11, PObject(std::string(100, 'x')));
@@ -377,6 +397,22 @@ class TappedChannel : public Channel {
     std::string written, read;
 };
 
+// A channel whose steps run transfers of their own on the same thread (progress notes).
+class NotingChannel : public Channel {
+  public:
+    using Channel::Channel;
+    int Write(const char* src, unsigned int len) override {
+        notes += Encode(PObject(static_cast<unsigned long long>(len))).size();
+        return Channel::Write(src, len);
+    }
+    int Read(char* dst, unsigned int len, unsigned int& count) override {
+        PObject note;
+        notes += Decode(Encode(Array({PObject(1ULL)})), note) == 0 ? 1 : 0;
+        return Channel::Read(dst, len, count);
+    }
+    size_t notes = 0;
+};
+
 TEST(PStreamTest, ReplacedChannelStepsSeeEveryByte) {
     PObject message;
     message["list"] = Array({PObject("abc"), PObject(300ULL), PObject()});
@@ -390,6 +426,14 @@ TEST(PStreamTest, ReplacedChannelStepsSeeEveryByte) {
     EXPECT_TRUE(in.read == plain);
     EXPECT_EQ("{\"k\": {\"x\": \"" + std::string(100, 'y') + "\"}, \"list\": [\"abc\", 300, null]}",
               back.toString());
+    // Steps that send and receive messages of their own leave the outer message whole.
+    NotingChannel noting_out(4096), noting_in(4096);
+    EXPECT_TRUE(Encode(message, 0, &noting_out) == plain);
+    PObject again;
+    ASSERT_EQ(0, Decode(plain, again, 0, PStream::kDefaultMaxRecvBytes,
+                        PStream::kDefaultMaxRecvDepth, &noting_in));
+    EXPECT_EQ(back.toString(), again.toString());
+    EXPECT_TRUE(noting_out.notes > 0 && noting_in.notes > 0);
 }
 
 // A task map's password travels under "pswd"; other maps use names such as "Password". The
