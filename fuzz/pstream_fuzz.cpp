@@ -3,7 +3,9 @@
 // nesting, no read past a buffer, no hang. A value that decodes must encode and decode again.
 //
 // The first input byte picks the state of the receiving object (receiving into a container adds
-// to it) and the ring size of the receiving channel (small rings wrap at every offset).
+// to it), the ring size of the receiving channel (small rings wrap at every offset) and a nesting
+// limit. Every input is decoded twice, straight from the rings and the general way through a
+// channel with a replaced step, and both must agree.
 #include <signal.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -38,8 +40,20 @@ bool WriteAll(int fd, const uint8_t* data, size_t size) {
     return true;
 }
 
-// Decodes `size` bytes into `object` through a channel with the given ring.
-int DecodeBytes(const uint8_t* data, size_t size, unsigned int ring, S2S::PObject& object) {
+// A channel with a replaced step: the codec then takes its general way for every value, never
+// the direct one over the rings, so the two can be held against each other.
+class SteppedChannel : public S2S::Channel {
+  public:
+    using Channel::Channel;
+    int Read(char* dst, unsigned int len, unsigned int& count) override {
+        return Channel::Read(dst, len, count);
+    }
+};
+
+// Decodes `size` bytes into `object` through a channel with the given ring (a stepped one when
+// `general`), with a nesting limit of `depth` levels.
+int DecodeBytes(const uint8_t* data, size_t size, unsigned int ring, S2S::PObject& object,
+                bool general = false, unsigned int depth = S2S::PStream::kDefaultMaxRecvDepth) {
     int fds[2];
     if (socketpair(AF_UNIX, SOCK_STREAM, 0, fds) != 0) {
         abort();
@@ -48,12 +62,15 @@ int DecodeBytes(const uint8_t* data, size_t size, unsigned int ring, S2S::PObjec
         abort();
     }
     close(fds[1]);  // the peer is done: a truncated message ends with a status, not a wait
-    S2S::Channel channel(ring);
+    S2S::Channel plain(ring);
+    SteppedChannel stepped(ring);
+    S2S::Channel& channel = general ? stepped : plain;
     if (channel.Open(fds[0], true) != 0) {
         abort();
     }
     channel.SetTimeout(5);
     S2S::PStream stream;
+    stream.SetRecvLimits(S2S::PStream::kDefaultMaxRecvBytes, depth);
     int ret = stream.Recv(channel, object);
     if (stream.GetHistory() != "") {
         abort();  // every message leaves the key path empty
@@ -107,24 +124,37 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     uint8_t mode = data[0];
     static const unsigned int kRings[] = {1, 2, 3, 7, 16, 64, 4096, kWideRing};
     unsigned int ring = kRings[mode & 7];
+    // The next bits: a small nesting limit (or the default).
+    static const unsigned int kDepths[] = {S2S::PStream::kDefaultMaxRecvDepth, 1, 2, 3};
+    const unsigned int depth = kDepths[(mode >> 5) & 3];
+    auto start = [mode](S2S::PObject& object) {
+        switch ((mode >> 3) & 3) {
+            case 1:
+                object.asArray().push_back(S2S::PObject(1ULL));
+                break;
+            case 2:
+                object["a"] = "held";
+                object["b"].asArray();
+                break;
+            case 3:
+                object = "text";
+                break;
+            default:
+                break;
+        }
+    };
     S2S::PObject object;
-    switch ((mode >> 3) & 3) {
-        case 1:
-            object.asArray().push_back(S2S::PObject(1ULL));
-            break;
-        case 2:
-            object["a"] = "held";
-            object["b"].asArray();
-            break;
-        case 3:
-            object = "text";
-            break;
-        default:
-            break;
-    }
-    int ret = DecodeBytes(data + 1, size - 1, ring, object);
+    start(object);
+    int ret = DecodeBytes(data + 1, size - 1, ring, object, false, depth);
     if (ret != S2S::kStatusSuccessful && ret != S2S::kStatusIOError &&
         ret != S2S::kStatusProtocolError) {
+        abort();
+    }
+    // The general way reaches the same status and the same value, whatever it got of it.
+    S2S::PObject general;
+    start(general);
+    if (DecodeBytes(data + 1, size - 1, ring, general, true, depth) != ret ||
+        general.toString() != object.toString()) {
         abort();
     }
     if (ret == S2S::kStatusSuccessful) {
