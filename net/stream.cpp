@@ -156,6 +156,65 @@ constexpr size_t kKeptFrames = 256;
     }
 }
 
+// Writes the container `value` whole at `at` when it holds only primitives and fits before
+// `limit` (its keys and values are never on the key path: nothing can read it meanwhile), and
+// moves `at` past it; false, with nothing moved, otherwise.
+bool PutLeafContainer(const PObject& value, char*& at, char* limit) {
+    char* out = at;
+    auto put = [&](const PObject& item) {
+        const size_t wire = PrimitiveSize(item);
+        if (wire == 0 || static_cast<size_t>(limit - out) < wire + 1) {  // room for the end tag
+            return false;
+        }
+        PutPrimitive(item, out);
+        out += wire;
+        return true;
+    };
+    auto put_entry = [&](const char* name, size_t size, const PObject& item) {
+        size_t length = 0;
+        const char* key = WireKey(name, size, length);
+        if (length > 0xFFFF || static_cast<size_t>(limit - out) < 3 + length) {
+            return false;
+        }
+        out[0] = static_cast<char>(PStream::kTagString);
+        out[1] = static_cast<char>(length >> 8);
+        out[2] = static_cast<char>(length);
+        std::memcpy(out + 3, key, length);
+        out += 3 + length;
+        return put(item);
+    };
+    if (limit - out < 2) {
+        return false;
+    }
+    *out++ = static_cast<char>(value.isArray() ? PStream::kTagArray : PStream::kTagMap);
+    if (value.isArray()) {
+        for (const PObject& item : value.asArray()) {
+            if (!put(item)) {
+                return false;
+            }
+        }
+    } else if (PObjectAccess::IsFlat(value)) {
+        const FlatMap& flat = PObjectAccess::Flat(value);
+        for (uint32_t i = 0; i < flat.count; ++i) {
+            if (!put_entry(flat.key(i), flat.entries()[i].key_size, flat.entries()[i].value)) {
+                return false;
+            }
+        }
+    } else {
+        for (const auto& entry : value.asMap()) {
+            if (!put_entry(entry.first.data(), entry.first.size(), entry.second)) {
+                return false;
+            }
+        }
+    }
+    if (out == limit) {
+        return false;
+    }
+    *out++ = static_cast<char>(PStream::kTagEnd);
+    at = out;
+    return true;
+}
+
 // The wire size (tag included) of the primitive value at `value` when it lies whole before `end`;
 // 0 for a container, a malformed value or one whose bytes are still to come.
 [[gnu::always_inline]] inline size_t PrimitiveWire(const char* value, const char* end) {
@@ -925,17 +984,23 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             }
             const PObject& current = *entry_value;
             const size_t value_wire = PrimitiveSize(current);
-            if (value_wire == 0 || length > 0xFFFF ||
-                static_cast<size_t>(limit - at) < 3 + length + value_wire) {
-                break;  // a container (the general loop opens it), or no room
+            if (length > 0xFFFF || static_cast<size_t>(limit - at) < 3 + length + value_wire) {
+                break;  // no room
             }
+            char* const entry_start = at;
             at[0] = static_cast<char>(kTagString);
             at[1] = static_cast<char>(length >> 8);
             at[2] = static_cast<char>(length);
             std::memcpy(at + 3, key, length);
             at += 3 + length;
-            PutPrimitive(current, at);
-            at += value_wire;
+            if (value_wire != 0) {
+                PutPrimitive(current, at);
+                at += value_wire;
+            } else if (!current.isContainer() || !PutLeafContainer(current, at, limit)) {
+                at = entry_start;
+                break;  // a container of containers (the general loop opens it), a string
+                        // too long for its length field, or no room
+            }
             last_key = key;
             last_size = length;
             if (top.flat != nullptr) {
