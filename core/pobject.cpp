@@ -479,7 +479,8 @@ void PObject::clear() {
         // Releases `child` here when that needs no walk (adding its arena blocks to the
         // releaser's count instead of paying an atomic step of its own), else moves it to the
         // work list.
-        auto release_child = [&releaser, &pending](PObject& child) {
+        auto release_child =
+            [&releaser, &pending ](PObject & child) __attribute__((always_inline)) {
             if (child.type_ == kString) {
                 TextBlock* text = static_cast<TextBlock*>(child.payload_);
                 releaser.Free(text, text->arena);

@@ -141,7 +141,7 @@ constexpr size_t kKeptFrames = 256;
         at[0] = static_cast<char>(PStream::kTagString);
         at[1] = static_cast<char>(text.size >> 8);
         at[2] = static_cast<char>(text.size);
-        std::memcpy(at + 3, text.data(), text.size);
+        CopyBytes(at + 3, text.data(), text.size);
     } else if (value.isNull()) {
         at[0] = static_cast<char>(PStream::kTagNull);
         at[1] = 0;
@@ -179,7 +179,7 @@ bool PutLeafContainer(const PObject& value, char*& at, char* limit) {
         out[0] = static_cast<char>(PStream::kTagString);
         out[1] = static_cast<char>(length >> 8);
         out[2] = static_cast<char>(length);
-        std::memcpy(out + 3, key, length);
+        CopyBytes(out + 3, key, length);
         out += 3 + length;
         return put(item);
     };
@@ -302,7 +302,7 @@ class KeyBytes {
         if (capacity_ - size_ < length) {
             Grow(length);
         }
-        std::memcpy(bytes_.get() + size_, key, length);
+        CopyBytes(bytes_.get() + size_, key, length);
         size_ += length;
     }
     void Release() {
@@ -822,7 +822,7 @@ int PStream::WriteString(Channel& channel, const char* data, size_t len) {
         room[0] = static_cast<char>(kTagString);
         room[1] = static_cast<char>((len >> 8) & 0xFF);
         room[2] = static_cast<char>(len & 0xFF);
-        std::memcpy(room + 3, data, len);
+        CopyBytes(room + 3, data, len);
         channel.Commit(static_cast<unsigned int>(3 + len));
         return 0;
     }
@@ -991,7 +991,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             at[0] = static_cast<char>(kTagString);
             at[1] = static_cast<char>(length >> 8);
             at[2] = static_cast<char>(length);
-            std::memcpy(at + 3, key, length);
+            CopyBytes(at + 3, key, length);
             at += 3 + length;
             if (value_wire != 0) {
                 PutPrimitive(current, at);
@@ -1396,7 +1396,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             for (uint32_t i = 0; i < count; ++i) {
                 const char* key = p + 3;
                 const uint32_t key_size = static_cast<uint32_t>(TextLength(key, key_wire(p)));
-                std::memcpy(flat->keys() + offset, key, key_size);
+                CopyBytes(flat->keys() + offset, key, key_size);
                 out[i].key_offset = offset;
                 out[i].key_size = key_size;
                 offset += key_size;
