@@ -3,6 +3,7 @@
 // counters under the stream's own mutex.
 #include "s2s_stream.h"
 
+#include <endian.h>
 #include <linux/membarrier.h>
 #include <sched.h>
 #include <sys/syscall.h>
@@ -241,9 +242,25 @@ inline size_t TextLength(const char* text, size_t wire_length);
                                                   Arena* arena) {
     const unsigned char tag = static_cast<unsigned char>(value[0]);
     if (tag == PStream::kTagInteger) {
+        // The writer's lengths are 1, 2, 4 and 8 bytes, most significant first.
+        const unsigned char* bytes = reinterpret_cast<const unsigned char*>(value) + 2;
         unsigned long long number = 0;
-        for (size_t i = 2; i < wire; ++i) {
-            number = (number << 8) + static_cast<unsigned char>(value[i]);
+        if (wire == 3) {
+            number = bytes[0];
+        } else if (wire == 4) {
+            number = (static_cast<unsigned int>(bytes[0]) << 8) | bytes[1];
+        } else if (wire == 6) {
+            uint32_t word;
+            std::memcpy(&word, bytes, sizeof(word));
+            number = be32toh(word);
+        } else if (wire == 10) {
+            uint64_t word;
+            std::memcpy(&word, bytes, sizeof(word));
+            number = be64toh(word);
+        } else {
+            for (size_t i = 0; i + 2 < wire; ++i) {
+                number = (number << 8) + bytes[i];
+            }
         }
         PObjectAccess::SetInteger(target, number);
     } else if (tag == PStream::kTagString) {
@@ -1359,6 +1376,14 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             return static_cast<size_t>((static_cast<unsigned char>(key_tag[1]) << 8) |
                                        static_cast<unsigned char>(key_tag[2]));
         };
+        // What the scan learns of the first entries is kept for the build.
+        struct Seen {
+            const char* key;
+            uint32_t key_size;
+            uint32_t value_wire;
+        };
+        constexpr uint32_t kSeen = 32;
+        Seen seen[kSeen];
         const char* p = at;
         uint32_t count = 0;
         size_t key_bytes = 0;
@@ -1375,6 +1400,10 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             if (value_wire == 0 ||
                 (previous != nullptr && CompareKeys(previous, previous_size, key, key_size) >= 0)) {
                 return 0;
+            }
+            if (count < kSeen) {
+                seen[count] =
+                    Seen{key, static_cast<uint32_t>(key_size), static_cast<uint32_t>(value_wire)};
             }
             ++count;
             key_bytes += key_size;
@@ -1395,13 +1424,16 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             p = at;
             for (uint32_t i = 0; i < count; ++i) {
                 const char* key = p + 3;
-                const uint32_t key_size = static_cast<uint32_t>(TextLength(key, key_wire(p)));
+                const uint32_t key_size = i < kSeen
+                                              ? seen[i].key_size
+                                              : static_cast<uint32_t>(TextLength(key, key_wire(p)));
                 CopyBytes(flat->keys() + offset, key, key_size);
                 out[i].key_offset = offset;
                 out[i].key_size = key_size;
                 offset += key_size;
                 const char* value = key + key_wire(p);
-                const size_t value_wire = PrimitiveWire(value, end);
+                const size_t value_wire =
+                    i < kSeen ? seen[i].value_wire : PrimitiveWire(value, end);
                 StorePrimitive(value, value_wire, out[i].value, message);
                 blocks += out[i].value.isString() ? 1 : 0;
                 p = value + value_wire;
