@@ -1378,7 +1378,6 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         };
         // What the scan learns of the first entries is kept for the build.
         struct Seen {
-            const char* key;
             uint32_t key_size;
             uint32_t value_wire;
         };
@@ -1403,7 +1402,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             }
             if (count < kSeen) {
                 seen[count] =
-                    Seen{key, static_cast<uint32_t>(key_size), static_cast<uint32_t>(value_wire)};
+                    Seen{static_cast<uint32_t>(key_size), static_cast<uint32_t>(value_wire)};
             }
             ++count;
             key_bytes += key_size;
