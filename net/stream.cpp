@@ -162,7 +162,7 @@ constexpr size_t kKeptFrames = 256;
 // moves `at` past it; false, with nothing moved, otherwise.
 bool PutLeafContainer(const PObject& value, char*& at, char* limit) {
     char* out = at;
-    auto put = [&](const PObject& item) {
+    auto put = [&](const PObject& item) __attribute__((always_inline)) {
         const size_t wire = PrimitiveSize(item);
         if (wire == 0 || static_cast<size_t>(limit - out) < wire + 1) {  // room for the end tag
             return false;
@@ -171,7 +171,8 @@ bool PutLeafContainer(const PObject& value, char*& at, char* limit) {
         out += wire;
         return true;
     };
-    auto put_entry = [&](const char* name, size_t size, const PObject& item) {
+    auto put_entry = [&](const char* name, size_t size, const PObject& item)
+        __attribute__((always_inline)) {
         size_t length = 0;
         const char* key = WireKey(name, size, length);
         if (length > 0xFFFF || static_cast<size_t>(limit - out) < 3 + length) {
@@ -1076,6 +1077,18 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
                 ResetStatus();
                 ++items.index;
                 continue;
+            }
+            if (element.isContainer()) {
+                // A container of primitives goes whole.
+                unsigned int room_size = 0;
+                char* const start = channel.WriteSpan(room_size);
+                char* at = start;
+                if (start != nullptr && PutLeafContainer(element, at, start + room_size)) {
+                    channel.Commit(static_cast<unsigned int>(at - start));
+                    ResetStatus();
+                    ++items.index;
+                    continue;
+                }
             }
             char* room = channel.WriteRoom(1);
             if (!element.isMap() || room == nullptr) {
