@@ -292,6 +292,16 @@ inline size_t TextLength(const char* text, size_t wire_length) {
         if (n + 8 > wire_length && !has_zero(text + wire_length - 8)) {
             return wire_length;
         }
+    } else if (wire_length >= 4) {
+        // Two overlapping half words cover four to seven bytes.
+        auto has_zero_half = [](const char* at) {
+            uint32_t half;
+            std::memcpy(&half, at, sizeof(half));
+            return ((half - 0x01010101U) & ~half & 0x80808080U) != 0;
+        };
+        if (!has_zero_half(text) && !has_zero_half(text + wire_length - 4)) {
+            return wire_length;
+        }
     }
     while (n < wire_length && text[n] != '\0') {
         ++n;
