@@ -1466,6 +1466,40 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         return static_cast<size_t>(p + 1 - at);
     };
 
+    // An array of primitives that lies whole in the ring from `at` (just past its tag) to its end
+    // tag before `end`, built at once into the null `target`: the wire bytes it took, end tag
+    // included, or 0 when the bytes are not such an array (then nothing is built).
+    auto leaf_array = [&](const char* at, const char* end, PObject& target) -> size_t {
+        if (max_recv_depth_ != 0 && stack.size() >= max_recv_depth_) {
+            return 0;
+        }
+        size_t count = 0;
+        const char* p = at;
+        for (; p < end && static_cast<unsigned char>(*p) != kTagEnd; ++count) {
+            const size_t wire = PrimitiveWire(p, end);
+            if (wire == 0) {
+                return 0;
+            }
+            p += wire;
+        }
+        if (p >= end) {
+            return 0;
+        }
+        if (count > 0) {
+            std::vector<PObject>& items = target.asArray();
+            items.reserve(count);
+            Arena* const message = arena();
+            for (const char* item = at; item < p;) {
+                const size_t wire = PrimitiveWire(item, end);
+                StorePrimitive(item, wire, items.emplace_back(), message);
+                item += wire;
+            }
+        } else {
+            target.asArray();
+        }
+        return static_cast<size_t>(p + 1 - at);
+    };
+
     auto flat_run = [&](Frame& top) {
         unsigned int buffered = 0;
         const char* const start = channel.BufferedSpan(buffered);
@@ -1480,11 +1514,14 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 break;  // the key and the start of its value are not buffered yet
             }
             const char* value = at + 3 + key_wire;
-            // A map of primitives as the value is taken whole too.
+            // A map or an array of primitives as the value is taken whole too.
             PObject nested;
             size_t value_wire = PrimitiveWire(value, end);
             if (value_wire == 0 && static_cast<unsigned char>(value[0]) == kTagMap) {
                 value_wire = leaf_map(value + 1, end, nested);
+                value_wire += value_wire != 0 ? 1 : 0;
+            } else if (value_wire == 0 && static_cast<unsigned char>(value[0]) == kTagArray) {
+                value_wire = leaf_array(value + 1, end, nested);
                 value_wire += value_wire != 0 ? 1 : 0;
             }
             const size_t wire = 3 + key_wire + value_wire;
@@ -1503,7 +1540,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             entry.key_offset = keys.size();
             entry.key_size = static_cast<uint32_t>(key_size);
             keys.append(key, key_size);
-            if (nested.isMap()) {
+            if (nested.isContainer()) {
                 PObjectAccess::Move(entry.value, nested);
             } else {
                 StorePrimitive(value, value_wire, entry.value, arena());
