@@ -1381,12 +1381,6 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         return at + 2;
     };
 
-    // Entries of a flat map whose key and primitive value are buffered whole (in one piece of
-    // the ring) and arrive in ascending key order, read in one pass without the per-value steps:
-    // the run's last key goes on the history once, as if each key had been put there and
-    // replaced by the next. The run is taken only when no debug line is due (direct_) and no
-    // reader holds the key path (a locked span), and stops before anything else, which the
-    // general loop below then reads.
     // A map of primitive entries in ascending key order that lies whole in the ring from `at`
     // (just past its tag) to its end tag before `end`, built straight into its block (no
     // scratch, no history: nothing can read the path meanwhile): the wire bytes it took, end
@@ -1497,6 +1491,116 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         } else {
             target.asArray();
         }
+        return static_cast<size_t>(p + 1 - at);
+    };
+
+    // Entries of a flat map whose key and primitive value are buffered whole (in one piece of
+    // the ring) and arrive in ascending key order, read in one pass without the per-value steps:
+    // the run's last key goes on the history once, as if each key had been put there and
+    // replaced by the next. The run is taken only when no debug line is due (direct_) and no
+    // reader holds the key path (a locked span), and stops before anything else, which the
+    // general loop below then reads.
+    // A whole map that lies in the ring from `at` (just past its tag) to its end tag before
+    // `end`, in ascending key order, whose values are primitives or maps or arrays of primitives
+    // (a request as front ends send them), built at once into its block: the wire bytes it took,
+    // end tag included, or 0 when the bytes are not such a map (then nothing is kept). Nested
+    // values are built while the map is scanned.
+    auto whole_map = [&](const char* at, const char* end, PObject& target) -> size_t {
+        if (max_recv_depth_ != 0 && stack.size() + 1 >= max_recv_depth_) {
+            return 0;  // its nested containers would count one level more than allowed
+        }
+        constexpr uint32_t kMost = 64;
+        struct Entry {
+            const char* key;
+            uint32_t key_size;
+            uint32_t value_wire;
+        };
+        Entry seen[kMost];
+        // The nested values built so far, in place; released on every way out unless moved.
+        struct Nested {
+            alignas(PObject) unsigned char bytes[kMost][sizeof(PObject)];
+            uint64_t used = 0;  // bit i: bytes[i] holds a PObject
+            PObject& at(uint32_t i) { return *reinterpret_cast<PObject*>(bytes[i]); }
+            ~Nested() {
+                for (uint32_t i = 0; used != 0; ++i, used >>= 1) {
+                    if ((used & 1) != 0) {
+                        at(i).~PObject();
+                    }
+                }
+            }
+        } nested;
+        static_assert(kMost <= 64, "one bit per entry");
+        const char* p = at;
+        uint32_t count = 0;
+        size_t key_bytes = 0;
+        bool leaves = true;
+        while (p < end && static_cast<unsigned char>(*p) != kTagEnd) {
+            if (count == kMost || static_cast<unsigned char>(*p) != kTagString || end - p < 3) {
+                return 0;
+            }
+            const size_t key_wire =
+                (static_cast<unsigned char>(p[1]) << 8) | static_cast<unsigned char>(p[2]);
+            if (static_cast<size_t>(end - p) - 3 < key_wire + 1) {
+                return 0;
+            }
+            Entry& entry = seen[count];
+            entry.key = p + 3;
+            entry.key_size = static_cast<uint32_t>(TextLength(entry.key, key_wire));
+            if (count > 0 && CompareKeys(seen[count - 1].key, seen[count - 1].key_size, entry.key,
+                                         entry.key_size) >= 0) {
+                return 0;
+            }
+            const char* value = entry.key + key_wire;
+            size_t value_wire = PrimitiveWire(value, end);
+            if (value_wire == 0) {
+                const unsigned char tag = static_cast<unsigned char>(*value);
+                if (tag != kTagMap && tag != kTagArray) {
+                    return 0;
+                }
+                PObject& built = *new (nested.bytes[count]) PObject();
+                nested.used |= uint64_t{1} << count;
+                value_wire = tag == kTagMap ? leaf_map(value + 1, end, built)
+                                            : leaf_array(value + 1, end, built);
+                if (value_wire == 0) {
+                    return 0;
+                }
+                ++value_wire;  // the container's tag
+                leaves = false;
+            }
+            entry.value_wire = static_cast<uint32_t>(value_wire);
+            ++count;
+            key_bytes += entry.key_size;
+            p = value + value_wire;
+        }
+        if (p >= end) {
+            return 0;
+        }
+        FlatMap* flat = nullptr;
+        if (count > 0) {
+            Arena* const message = arena();
+            flat = PObjectAccess::NewFlat(message, count, static_cast<uint32_t>(key_bytes));
+            FlatEntry* out = flat->entries();
+            uint32_t offset = 0;
+            uint32_t blocks = 1;  // the map, and each of its strings
+            for (uint32_t i = 0; i < count; ++i) {
+                Entry& entry = seen[i];
+                CopyBytes(flat->keys() + offset, entry.key, entry.key_size);
+                out[i].key_offset = offset;
+                out[i].key_size = entry.key_size;
+                offset += entry.key_size;
+                if ((nested.used >> i) & 1) {
+                    PObjectAccess::Move(out[i].value, nested.at(i));
+                } else {
+                    const char* value =
+                        entry.key + ((static_cast<unsigned char>(entry.key[-2]) << 8) |
+                                     static_cast<unsigned char>(entry.key[-1]));
+                    StorePrimitive(value, entry.value_wire, out[i].value, message);
+                    blocks += out[i].value.isString() ? 1 : 0;
+                }
+            }
+            flat->leaf_blocks = leaves ? blocks : 0;
+        }
+        PObjectAccess::AssignFlat(target, flat);
         return static_cast<size_t>(p + 1 - at);
     };
 
@@ -1728,9 +1832,25 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                     }
                     if (target.isMap() && !target.isEmpty()) {
                         open(nullptr, &target.asMap());  // merges into a map already there
-                    } else {
-                        open_flat(&target, target_owner);
+                        continue;
                     }
+                    if (direct_ && !span_locked_) {
+                        // A whole map of primitives and containers of primitives is built at
+                        // once.
+                        unsigned int run = 0;
+                        const char* at = channel.BufferedSpan(run);
+                        PObject whole;
+                        const size_t wire = at == nullptr ? 0 : whole_map(at, at + run, whole);
+                        if (wire != 0 &&
+                            (max_recv_bytes_ == 0 || received_ + wire <= max_recv_bytes_)) {
+                            ResetStatus();
+                            target.swap(whole);
+                            channel.Consume(static_cast<unsigned int>(wire));
+                            received_ += wire;
+                            break;
+                        }
+                    }
+                    open_flat(&target, target_owner);
                     continue;
                 case kTagNull: {
                     unsigned char length = 0;
