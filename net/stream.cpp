@@ -1381,85 +1381,6 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         return at + 2;
     };
 
-    // A map of primitive entries in ascending key order that lies whole in the ring from `at`
-    // (just past its tag) to its end tag before `end`, built straight into its block (no
-    // scratch, no history: nothing can read the path meanwhile): the wire bytes it took, end
-    // tag included, or 0 when the bytes are not such a map (then nothing is built).
-    auto leaf_map = [&](const char* at, const char* end, PObject& target) -> size_t {
-        if (max_recv_depth_ != 0 && stack.size() >= max_recv_depth_) {
-            return 0;
-        }
-        auto key_wire = [](const char* key_tag) {
-            return static_cast<size_t>((static_cast<unsigned char>(key_tag[1]) << 8) |
-                                       static_cast<unsigned char>(key_tag[2]));
-        };
-        // What the scan learns of the first entries is kept for the build.
-        struct Seen {
-            uint32_t key_size;
-            uint32_t value_wire;
-        };
-        constexpr uint32_t kSeen = 32;
-        Seen seen[kSeen];
-        const char* p = at;
-        uint32_t count = 0;
-        size_t key_bytes = 0;
-        const char* previous = nullptr;
-        size_t previous_size = 0;
-        while (p < end && static_cast<unsigned char>(*p) != kTagEnd) {
-            if (static_cast<unsigned char>(*p) != kTagString || end - p < 3 ||
-                static_cast<size_t>(end - p) - 3 < key_wire(p)) {
-                return 0;
-            }
-            const char* key = p + 3;
-            const size_t key_size = TextLength(key, key_wire(p));
-            const size_t value_wire = PrimitiveWire(key + key_wire(p), end);
-            if (value_wire == 0 ||
-                (previous != nullptr && CompareKeys(previous, previous_size, key, key_size) >= 0)) {
-                return 0;
-            }
-            if (count < kSeen) {
-                seen[count] =
-                    Seen{static_cast<uint32_t>(key_size), static_cast<uint32_t>(value_wire)};
-            }
-            ++count;
-            key_bytes += key_size;
-            previous = key;
-            previous_size = key_size;
-            p = key + key_wire(p) + value_wire;
-        }
-        if (p >= end) {
-            return 0;
-        }
-        FlatMap* flat = nullptr;
-        if (count > 0) {
-            Arena* const message = arena();
-            flat = PObjectAccess::NewFlat(message, count, static_cast<uint32_t>(key_bytes));
-            FlatEntry* out = flat->entries();
-            uint32_t offset = 0;
-            uint32_t blocks = 1;  // the map, and each of its strings
-            p = at;
-            for (uint32_t i = 0; i < count; ++i) {
-                const char* key = p + 3;
-                const uint32_t key_size = i < kSeen
-                                              ? seen[i].key_size
-                                              : static_cast<uint32_t>(TextLength(key, key_wire(p)));
-                CopyBytes(flat->keys() + offset, key, key_size);
-                out[i].key_offset = offset;
-                out[i].key_size = key_size;
-                offset += key_size;
-                const char* value = key + key_wire(p);
-                const size_t value_wire =
-                    i < kSeen ? seen[i].value_wire : PrimitiveWire(value, end);
-                StorePrimitive(value, value_wire, out[i].value, message);
-                blocks += out[i].value.isString() ? 1 : 0;
-                p = value + value_wire;
-            }
-            flat->leaf_blocks = blocks;
-        }
-        PObjectAccess::AssignFlat(target, flat);
-        return static_cast<size_t>(p + 1 - at);
-    };
-
     // An array of primitives that lies whole in the ring from `at` (just past its tag) to its end
     // tag before `end`, built at once into the null `target`: the wire bytes it took, end tag
     // included, or 0 when the bytes are not such an array (then nothing is built).
@@ -1494,82 +1415,79 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         return static_cast<size_t>(p + 1 - at);
     };
 
-    // Entries of a flat map whose key and primitive value are buffered whole (in one piece of
-    // the ring) and arrive in ascending key order, read in one pass without the per-value steps:
-    // the run's last key goes on the history once, as if each key had been put there and
-    // replaced by the next. The run is taken only when no debug line is due (direct_) and no
-    // reader holds the key path (a locked span), and stops before anything else, which the
-    // general loop below then reads.
-    // A whole map that lies in the ring from `at` (just past its tag) to its end tag before
-    // `end`, in ascending key order, whose values are primitives or maps or arrays of primitives
-    // (a request as front ends send them), built at once into its block: the wire bytes it took,
-    // end tag included, or 0 when the bytes are not such a map (then nothing is kept). Nested
-    // values are built while the map is scanned.
-    auto whole_map = [&](const char* at, const char* end, PObject& target) -> size_t {
-        if (max_recv_depth_ != 0 && stack.size() + 1 >= max_recv_depth_) {
-            return 0;  // its nested containers would count one level more than allowed
+    // A map that lies whole in the ring from `at` (just past its tag) to its end tag before
+    // `end`, in ascending key order, built at once into its block (no scratch, no key path:
+    // nothing can read the path meanwhile): the wire bytes it took, end tag included, or 0 when
+    // the bytes are not such a map (then nothing is kept). Its values are primitives, and with
+    // `nested` also maps or arrays of primitives (a request as front ends send it), built while
+    // the map is scanned. What the scan learns of the first entries is kept for the build.
+    auto build_map = [&](auto& self, const char* at, const char* end, PObject& target,
+                         bool nested) -> size_t {
+        // Nested containers count one level more.
+        if (max_recv_depth_ != 0 && stack.size() + (nested ? 1 : 0) >= max_recv_depth_) {
+            return 0;
         }
-        constexpr uint32_t kMost = 64;
-        struct Entry {
-            const char* key;
+        auto key_wire = [](const char* key_tag) {
+            return static_cast<size_t>((static_cast<unsigned char>(key_tag[1]) << 8) |
+                                       static_cast<unsigned char>(key_tag[2]));
+        };
+        constexpr uint32_t kSeen = 64;
+        struct Seen {
             uint32_t key_size;
             uint32_t value_wire;
         };
-        Entry seen[kMost];
+        Seen seen[kSeen];
         // The nested values built so far, in place; released on every way out unless moved.
-        struct Nested {
-            alignas(PObject) unsigned char bytes[kMost][sizeof(PObject)];
+        struct Built {
+            alignas(PObject) unsigned char bytes[kSeen][sizeof(PObject)];
             uint64_t used = 0;  // bit i: bytes[i] holds a PObject
             PObject& at(uint32_t i) { return *reinterpret_cast<PObject*>(bytes[i]); }
-            ~Nested() {
+            ~Built() {
                 for (uint32_t i = 0; used != 0; ++i, used >>= 1) {
                     if ((used & 1) != 0) {
                         at(i).~PObject();
                     }
                 }
             }
-        } nested;
-        static_assert(kMost <= 64, "one bit per entry");
+        } built;
+        static_assert(kSeen <= 64, "one bit per entry");
         const char* p = at;
         uint32_t count = 0;
         size_t key_bytes = 0;
-        bool leaves = true;
+        const char* previous = nullptr;
+        size_t previous_size = 0;
         while (p < end && static_cast<unsigned char>(*p) != kTagEnd) {
-            if (count == kMost || static_cast<unsigned char>(*p) != kTagString || end - p < 3) {
+            if (static_cast<unsigned char>(*p) != kTagString || end - p < 3 ||
+                static_cast<size_t>(end - p) - 3 < key_wire(p) + 1) {
                 return 0;
             }
-            const size_t key_wire =
-                (static_cast<unsigned char>(p[1]) << 8) | static_cast<unsigned char>(p[2]);
-            if (static_cast<size_t>(end - p) - 3 < key_wire + 1) {
+            const char* key = p + 3;
+            const size_t key_size = TextLength(key, key_wire(p));
+            if (previous != nullptr && CompareKeys(previous, previous_size, key, key_size) >= 0) {
                 return 0;
             }
-            Entry& entry = seen[count];
-            entry.key = p + 3;
-            entry.key_size = static_cast<uint32_t>(TextLength(entry.key, key_wire));
-            if (count > 0 && CompareKeys(seen[count - 1].key, seen[count - 1].key_size, entry.key,
-                                         entry.key_size) >= 0) {
-                return 0;
-            }
-            const char* value = entry.key + key_wire;
+            const char* value = key + key_wire(p);
             size_t value_wire = PrimitiveWire(value, end);
-            if (value_wire == 0) {
-                const unsigned char tag = static_cast<unsigned char>(*value);
-                if (tag != kTagMap && tag != kTagArray) {
-                    return 0;
-                }
-                PObject& built = *new (nested.bytes[count]) PObject();
-                nested.used |= uint64_t{1} << count;
-                value_wire = tag == kTagMap ? leaf_map(value + 1, end, built)
-                                            : leaf_array(value + 1, end, built);
-                if (value_wire == 0) {
-                    return 0;
-                }
-                ++value_wire;  // the container's tag
-                leaves = false;
+            const unsigned char tag = static_cast<unsigned char>(*value);
+            if (value_wire == 0 && nested && count < kSeen &&
+                (tag == kTagMap || tag == kTagArray)) {
+                PObject& inner = *new (built.bytes[count]) PObject();
+                built.used |= uint64_t{1} << count;
+                value_wire = tag == kTagMap ? self(self, value + 1, end, inner, false)
+                                            : leaf_array(value + 1, end, inner);
+                value_wire += value_wire != 0 ? 1 : 0;  // the container's tag
             }
-            entry.value_wire = static_cast<uint32_t>(value_wire);
+            if (value_wire == 0) {
+                return 0;
+            }
+            if (count < kSeen) {
+                seen[count] =
+                    Seen{static_cast<uint32_t>(key_size), static_cast<uint32_t>(value_wire)};
+            }
             ++count;
-            key_bytes += entry.key_size;
+            key_bytes += key_size;
+            previous = key;
+            previous_size = key_size;
             p = value + value_wire;
         }
         if (p >= end) {
@@ -1582,28 +1500,48 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             FlatEntry* out = flat->entries();
             uint32_t offset = 0;
             uint32_t blocks = 1;  // the map, and each of its strings
+            const bool leaves = built.used == 0;
+            p = at;
             for (uint32_t i = 0; i < count; ++i) {
-                Entry& entry = seen[i];
-                CopyBytes(flat->keys() + offset, entry.key, entry.key_size);
+                const char* key = p + 3;
+                const uint32_t key_size = i < kSeen
+                                              ? seen[i].key_size
+                                              : static_cast<uint32_t>(TextLength(key, key_wire(p)));
+                CopyBytes(flat->keys() + offset, key, key_size);
                 out[i].key_offset = offset;
-                out[i].key_size = entry.key_size;
-                offset += entry.key_size;
-                if ((nested.used >> i) & 1) {
-                    PObjectAccess::Move(out[i].value, nested.at(i));
+                out[i].key_size = key_size;
+                offset += key_size;
+                const char* value = key + key_wire(p);
+                const size_t value_wire =
+                    i < kSeen ? seen[i].value_wire : PrimitiveWire(value, end);
+                if (i < kSeen && ((built.used >> i) & 1) != 0) {
+                    PObjectAccess::Move(out[i].value, built.at(i));
                 } else {
-                    const char* value =
-                        entry.key + ((static_cast<unsigned char>(entry.key[-2]) << 8) |
-                                     static_cast<unsigned char>(entry.key[-1]));
-                    StorePrimitive(value, entry.value_wire, out[i].value, message);
+                    StorePrimitive(value, value_wire, out[i].value, message);
                     blocks += out[i].value.isString() ? 1 : 0;
                 }
+                p = value + value_wire;
             }
             flat->leaf_blocks = leaves ? blocks : 0;
         }
         PObjectAccess::AssignFlat(target, flat);
         return static_cast<size_t>(p + 1 - at);
     };
+    // A map of primitives only.
+    auto leaf_map = [&](const char* at, const char* end, PObject& target) {
+        return build_map(build_map, at, end, target, false);
+    };
+    // A map of primitives and of maps or arrays of primitives.
+    auto whole_map = [&](const char* at, const char* end, PObject& target) {
+        return build_map(build_map, at, end, target, true);
+    };
 
+    // Entries of a flat map whose key and primitive value are buffered whole (in one piece of
+    // the ring) and arrive in ascending key order, read in one pass without the per-value steps:
+    // the run's last key goes on the history once, as if each key had been put there and
+    // replaced by the next. The run is taken only when no debug line is due (direct_) and no
+    // reader holds the key path (a locked span), and stops before anything else, which the
+    // general loop below then reads.
     auto flat_run = [&](Frame& top) {
         unsigned int buffered = 0;
         const char* const start = channel.BufferedSpan(buffered);
