@@ -24,6 +24,7 @@
 #include <new>
 #include <string>
 
+#include "core/copy_bytes.h"
 #include "s2s_pobject.h"
 
 namespace S2S {
@@ -100,30 +101,6 @@ struct FlatMap {
     char* keys() { return reinterpret_cast<char*>(entries() + count); }
     const char* key(uint32_t i) const { return keys() + entries()[i].key_offset; }
 };
-
-// Copies `size` bytes. Keys and strings are mostly short: up to 16 bytes are moved as two
-// overlapping words (or byte by byte below four) rather than through a call.
-inline void CopyBytes(char* to, const char* from, size_t size) {
-    if (size > 16) {
-        std::memcpy(to, from, size);
-    } else if (size >= 8) {
-        uint64_t head, tail;
-        std::memcpy(&head, from, 8);
-        std::memcpy(&tail, from + size - 8, 8);
-        std::memcpy(to, &head, 8);
-        std::memcpy(to + size - 8, &tail, 8);
-    } else if (size >= 4) {
-        uint32_t head, tail;
-        std::memcpy(&head, from, 4);
-        std::memcpy(&tail, from + size - 4, 4);
-        std::memcpy(to, &head, 4);
-        std::memcpy(to + size - 4, &tail, 4);
-    } else {
-        for (size_t i = 0; i < size; ++i) {
-            to[i] = from[i];
-        }
-    }
-}
 
 // Byte order of keys: what std::string's comparison gives (unsigned bytes, a prefix first).
 inline int CompareKeys(const char* a, size_t a_size, const char* b, size_t b_size) {

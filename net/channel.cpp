@@ -18,6 +18,7 @@
 #include <ctime>
 #include <new>
 
+#include "core/copy_bytes.h"
 #include "net/log_debug.h"
 #include "s2s_logger.h"
 #include "s2s_status.h"
@@ -29,15 +30,6 @@ namespace {
 // The address length every domain-socket peer of the service uses: the whole sockaddr_un.
 constexpr socklen_t kDomainAddrLen = 110;
 constexpr size_t kDomainPathMax = 107;
-
-// Most copies on the data path are one tag or length byte: those skip the library call.
-inline void CopyBytes(char* dst, const char* src, unsigned int len) {
-    if (len == 1) {
-        *dst = *src;
-    } else {
-        std::memcpy(dst, src, len);
-    }
-}
 
 // The flag is a plain int owned by the caller and set from another thread or a signal handler;
 // an atomic load keeps each check a fresh, well-defined read.
