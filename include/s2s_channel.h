@@ -1,6 +1,7 @@
 // Channel: the byte transport of the library. A stream socket (TCP over IPv4 or a local domain
 // socket) held in non-blocking mode, with a read ring and a write ring of one fixed capacity,
-// every wait bounded by select(), an inactivity timeout and an external abort flag. An open
+// every wait bounded (one interval, 1 second by default), an inactivity timeout and an external
+// abort flag. The channel waits with poll (PollFd); WaitFd keeps the select() form. An open
 // channel can be turned into a TLS channel in place: the set of I/O operations is exchanged
 // (SwitchChannelOp) and all buffering, timeouts and status codes stay as they are.
 //
@@ -9,7 +10,7 @@
 //
 // A channel is used by one thread at a time. The abort flag is the only cross-thread input: any
 // thread (or a signal handler) may set the int it points to; each wait checks it before every
-// select, so an abort takes effect within one wait interval.
+// poll, so an abort takes effect within one wait interval.
 #ifndef S2S_CHANNEL_H
 #define S2S_CHANNEL_H
 
@@ -228,6 +229,17 @@ class S2S_EXPORT Channel {
     // interval passed quietly, -3 on a select failure, -1 once *flag is non-zero.
     static int WaitFd(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_set,
                       const timeval& wait, int* flag);
+    // The wait the channel itself uses (reads, writes, connects, TLS handshakes and records):
+    // WaitFd's statuses and messages, with `ready` and `exception` saying what the read (or,
+    // with `for_write`, the write) set and the exception set would have held. It waits with
+    // poll rather than select, and differs from WaitFd in two ways: a descriptor at or above
+    // FD_SETSIZE, which select's sets cannot hold (WaitFd refuses it with -3), is waited on like
+    // any other, so a busy service with many descriptors keeps working; and a wait costs less
+    // (no sets copied in and out, no time written back). The interval is rounded up to whole
+    // milliseconds. A write wait on a socket that reports only a hang-up returns at once with
+    // neither flag set (select would sleep out the interval).
+    static int PollFd(int fd, bool for_write, const timeval& wait, int* flag, bool& ready,
+                      bool& exception);
 
     // The operation set of the plain channel.
     static int PlainGetFd(const int* handle);

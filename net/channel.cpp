@@ -1,6 +1,6 @@
 // Channel: the plain socket operations, the read and write rings, and the waits. Every wait is a
-// select() of at most one second, so the abort flag is looked at at least once a second and the
-// inactivity timeout counts whole quiet seconds; the rings are allocated once, in the
+// poll of at most one interval (one second), so the abort flag is looked at at least once a second
+// and the inactivity timeout counts whole quiet seconds; the rings are allocated once, in the
 // constructor, and the data path never allocates.
 #include "s2s_channel.h"
 
@@ -8,6 +8,7 @@
 #include <fcntl.h>
 #include <netinet/in.h>
 #include <openssl/ssl.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -478,9 +479,9 @@ int Channel::ReadMore(int want) {
         int n;
         if (read_drained_ && !is_ssl_) {
             // Wait first (see read_drained_); the receive that follows then finds the bytes.
-            fd_set read_set;
-            fd_set except_set;
-            n = WaitFd(GetFd(), &read_set, nullptr, &except_set, wait_, flag_);
+            bool ready = false;
+            bool exception = false;
+            n = PollFd(GetFd(), false, wait_, flag_, ready, exception);
             if (n == kStatusSuccessful) {
                 n = read_op_(handle_, at, len, wait_, flag_);
             }
@@ -588,16 +589,16 @@ int Channel::ConnectWithTimeout(int fd, const char* ip, int port) {
     }
     unsigned int elapsed = 0;
     for (;;) {
-        fd_set write_set;
-        fd_set except_set;
-        int ret = WaitFd(fd, nullptr, &write_set, &except_set, wait_, flag_);
+        bool ready = false;
+        bool exception = false;
+        int ret = PollFd(fd, true, wait_, flag_, ready, exception);
         if (ret >= 0) {
-            if (FD_ISSET(fd, &except_set)) {
+            if (exception) {
                 Logger::LogMsg(Logger::Warning,
                                "[WARNING] s2s_channel.cpp(%d): connect: exception set\n", __LINE__);
                 return kStatusIOError;
             }
-            if (FD_ISSET(fd, &write_set)) {
+            if (ready) {
                 return kStatusSuccessful;
             }
             Logger::LogMsg(Logger::Warning,
@@ -687,6 +688,52 @@ int Channel::WaitFd(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_
     return kStatusInterrupted;
 }
 
+int Channel::PollFd(int fd, bool for_write, const timeval& wait, int* flag, bool& ready,
+                    bool& exception) {
+    ready = false;
+    exception = false;
+    if (fd < 0) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
+                       __LINE__, std::strerror(EBADF), EBADF);
+        return kStatusSystemError;
+    }
+    // Whole milliseconds, rounded up so that a short interval still waits.
+    const long long wait_ms = static_cast<long long>(wait.tv_sec) * 1000 +
+                              (static_cast<long long>(wait.tv_usec) + 999) / 1000;
+    const int timeout_ms =
+        wait_ms < 0 ? 0 : static_cast<int>(std::min<long long>(wait_ms, 0x7FFFFFFF));
+    // What select would report: readable on data, hang-up or error; writable on room or error;
+    // an exception on urgent data.
+    const short wanted = static_cast<short>((for_write ? POLLOUT : POLLIN) | POLLPRI);
+    const short ready_on =
+        static_cast<short>(for_write ? (POLLOUT | POLLERR) : (POLLIN | POLLHUP | POLLERR));
+    while (!AbortRequested(flag)) {
+        pollfd entry{fd, wanted, 0};
+        int ret = ::poll(&entry, 1, timeout_ms);
+        if (ret > 0) {
+            if ((entry.revents & POLLNVAL) != 0) {  // select fails with EBADF here
+                Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
+                               __LINE__, std::strerror(EBADF), EBADF);
+                return kStatusSystemError;
+            }
+            ready = (entry.revents & ready_on) != 0;
+            exception = (entry.revents & POLLPRI) != 0;
+            return kStatusSuccessful;
+        }
+        if (ret == 0) {
+            S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): select: timeout\n", __LINE__);
+            return kStatusConnectionTimeout;
+        }
+        if (errno != EINTR) {
+            int err = errno;
+            Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
+                           __LINE__, std::strerror(err), err);
+            return kStatusSystemError;
+        }
+    }
+    return kStatusInterrupted;
+}
+
 namespace {
 
 // Outcome of one recv/send that returned `n`: the count, or -2 with the warnings of a failed or
@@ -747,18 +794,18 @@ int Channel::ReadFd(int* handle, void* buf, unsigned int len, const timeval& wai
             return ReadResult(n);
         }
     }
-    fd_set read_set;
-    fd_set except_set;
-    int ret = WaitFd(fd, &read_set, nullptr, &except_set, wait, flag);
+    bool ready = false;
+    bool exception = false;
+    int ret = PollFd(fd, false, wait, flag, ready, exception);
     if (ret < 0) {
         return ret;
     }
-    if (FD_ISSET(fd, &except_set)) {
+    if (exception) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): ReadFd: exception set\n",
                        __LINE__);
         return kStatusIOError;
     }
-    if (!FD_ISSET(fd, &read_set)) {
+    if (!ready) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] s2s_channel.cpp(%d): ReadFd: select but fd [%d] not ready\n",
                        __LINE__, fd);
@@ -779,18 +826,18 @@ int Channel::WriteFd(int* handle, const void* buf, unsigned int len, const timev
             return WriteResult(n);
         }
     }
-    fd_set write_set;
-    fd_set except_set;
-    int ret = WaitFd(fd, nullptr, &write_set, &except_set, wait, flag);
+    bool ready = false;
+    bool exception = false;
+    int ret = PollFd(fd, true, wait, flag, ready, exception);
     if (ret < 0) {
         return ret;
     }
-    if (FD_ISSET(fd, &except_set)) {
+    if (exception) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] s2s_channel.cpp(%d): WriteFd: exception occurs\n", __LINE__);
         return kStatusIOError;
     }
-    if (!FD_ISSET(fd, &write_set)) {
+    if (!ready) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] s2s_channel.cpp(%d): WriteFd: select but fd [%d] not ready\n",
                        __LINE__, fd);

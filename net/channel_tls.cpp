@@ -5,7 +5,6 @@
 #include <openssl/ssl.h>
 #include <openssl/x509.h>
 #include <openssl/x509v3.h>
-#include <sys/select.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -135,28 +134,27 @@ int AbandonInit(SSL*& ssl, SSL_CTX*& ctx) {
     return -1;
 }
 
-// Channel::WaitFd, handed in by the channel (it is the channel's own step).
-using WaitFdFn = int (*)(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_set,
-                         const timeval& wait, int* flag);
+// Channel::PollFd, handed in by the channel (it is the channel's own step).
+using PollFdFn = int (*)(int fd, bool for_write, const timeval& wait, int* flag, bool& ready,
+                         bool& exception);
 
 // One bounded wait of a record read or write (`who`: "ReadFd" or "WriteFd") until `fd` is
 // readable (or, with `write`, writable): 0 when it is; the wait's own negative status; -2 on an
-// exception, -3 when select returned without the descriptor.
-int WaitReady(WaitFdFn wait_fd, int fd, bool write, const timeval& wait, int* flag,
+// exception, -3 when the wait returned without the descriptor ready.
+int WaitReady(PollFdFn poll_fd, int fd, bool write, const timeval& wait, int* flag,
               const char* who) {
-    fd_set ready;
-    fd_set except;
-    const int status = write ? wait_fd(fd, nullptr, &ready, &except, wait, flag)
-                             : wait_fd(fd, &ready, nullptr, &except, wait, flag);
+    bool ready = false;
+    bool exception = false;
+    const int status = poll_fd(fd, write, wait, flag, ready, exception);
     if (status < 0) {
         return status;
     }
-    if (FD_ISSET(fd, &except)) {
+    if (exception) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): %s: exception set\n",
                        __LINE__, who);
         return -2;
     }
-    if (!FD_ISSET(fd, &ready)) {
+    if (!ready) {
         Logger::LogMsg(Logger::Warning,
                        "[WARNING] s2s_channel.cpp(%d): %s: select but fd [%d] not ready\n",
                        __LINE__, who, fd);
@@ -371,11 +369,9 @@ int Channel::SSLHandshake(SSL* ssl, timeval wait, unsigned int timeout, int* /*f
             log_ssl();
             return -2;
         }
-        fd_set ready;
-        fd_set except;
-        int status = error == SSL_ERROR_WANT_READ
-                         ? WaitFd(fd, &ready, nullptr, &except, wait, nullptr)
-                         : WaitFd(fd, nullptr, &ready, &except, wait, nullptr);
+        bool ready = false;
+        bool exception = false;
+        int status = PollFd(fd, error != SSL_ERROR_WANT_READ, wait, nullptr, ready, exception);
         if (status == -9) {
             elapsed += static_cast<unsigned int>(wait.tv_sec);
             if (timeout != 0 && elapsed >= timeout) {
@@ -390,13 +386,13 @@ int Channel::SSLHandshake(SSL* ssl, timeval wait, unsigned int timeout, int* /*f
         if (status < 0) {
             return status;
         }
-        if (FD_ISSET(fd, &except)) {
+        if (exception) {
             Logger::LogMsg(Logger::Warning,
                            "[WARNING] s2s_channel.cpp(%d): SSLHandshake: exception set\n",
                            __LINE__);
             return -2;
         }
-        if (!FD_ISSET(fd, &ready)) {
+        if (!ready) {
             Logger::LogMsg(
                 Logger::Warning,
                 "[WARNING] s2s_channel.cpp(%d): SSLHandshake: select returns but fd is not set\n",
@@ -430,7 +426,7 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wai
                        __LINE__, n);
         return n;
     }
-    const int status = WaitReady(&WaitFd, SSL_get_fd(ssl), false, wait, flag, "ReadFd");
+    const int status = WaitReady(&PollFd, SSL_get_fd(ssl), false, wait, flag, "ReadFd");
     if (status < 0) {
         return status;
     }
@@ -456,7 +452,7 @@ int Channel::SSLReadFd(SSL* ssl, void* buf, unsigned int len, const timeval& wai
 
 int Channel::SSLWriteFd(SSL* ssl, const void* buf, unsigned int len, const timeval& wait,
                         int* flag) {
-    const int status = WaitReady(&WaitFd, SSL_get_fd(ssl), true, wait, flag, "WriteFd");
+    const int status = WaitReady(&PollFd, SSL_get_fd(ssl), true, wait, flag, "WriteFd");
     if (status < 0) {
         return status;
     }

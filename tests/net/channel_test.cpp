@@ -364,4 +364,95 @@ TEST(ChannelTest, LargeTransferThroughSmallRingsKeepsEveryByte) {
     EXPECT_TRUE(got == data);
 }
 
+// The channel waits with poll; WaitFd keeps select. Both give the same status and readiness on
+// every state of a socket, and only the channel's wait serves a descriptor beyond select's sets,
+// end to end through a channel.
+class WaitingChannel : public Channel {
+  public:
+    using Channel::PollFd;
+    using Channel::WaitFd;
+};
+
+TEST(ChannelTest, ThePollWaitAgreesWithSelectAndServesDescriptorsBeyondItsSets) {
+    const timeval brief{0, 20000};
+    struct Outcome {
+        int status;
+        bool ready, exception;
+        bool operator==(const Outcome& o) const {
+            return status == o.status && ready == o.ready && exception == o.exception;
+        }
+    };
+    auto by_select = [&](int fd, bool write, int* flag) {
+        fd_set ready_set;
+        fd_set except_set;
+        int status =
+            write ? WaitingChannel::WaitFd(fd, nullptr, &ready_set, &except_set, brief, flag)
+                  : WaitingChannel::WaitFd(fd, &ready_set, nullptr, &except_set, brief, flag);
+        bool ok = status == 0;
+        return Outcome{status, ok && FD_ISSET(fd, &ready_set), ok && FD_ISSET(fd, &except_set)};
+    };
+    auto by_poll = [&](int fd, bool write, int* flag) {
+        Outcome out{0, false, false};
+        out.status = WaitingChannel::PollFd(fd, write, brief, flag, out.ready, out.exception);
+        return out;
+    };
+    SocketPair quiet;
+    SocketPair fed;
+    ASSERT_TRUE(WriteAll(fed.b, "x"));
+    SocketPair closed;
+    s2s_test::CloseFd(closed.b);
+    s2s_test::Listener listener;
+    int urgent_peer = listener.Connect(0);
+    int urgent = listener.Accept();
+    ASSERT_EQ(1, send(urgent_peer, "!", 1, MSG_OOB));
+    int stop = 1;
+    struct Row {
+        const char* what;
+        int fd;
+        bool write;
+        int* flag;
+        Outcome expected;
+    } rows[] = {
+        {"nothing to read: one quiet interval",
+         quiet.a,
+         false,
+         nullptr,
+         {kStatusConnectionTimeout, false, false}},
+        {"bytes to read", fed.a, false, nullptr, {0, true, false}},
+        {"room to write", quiet.a, true, nullptr, {0, true, false}},
+        {"peer gone: readable (the receive finds the end)",
+         closed.a,
+         false,
+         nullptr,
+         {0, true, false}},
+        {"urgent data: an exception", urgent, false, nullptr, {0, false, true}},
+        {"abort flag set", quiet.a, false, &stop, {kStatusInterrupted, false, false}},
+        {"no descriptor", -1, false, nullptr, {kStatusSystemError, false, false}},
+    };
+    for (const Row& row : rows) {
+        EXPECT_EQ(row.expected, by_select(row.fd, row.write, row.flag)) << row.what;
+        EXPECT_EQ(row.expected, by_poll(row.fd, row.write, row.flag)) << row.what;
+    }
+    s2s_test::CloseFd(urgent);
+    s2s_test::CloseFd(urgent_peer);
+
+    // A descriptor past FD_SETSIZE: select cannot wait on it, the channel can.
+    SocketPair pair;
+    const int high = fcntl(pair.a, F_DUPFD_CLOEXEC, FD_SETSIZE + 8);
+    if (high < 0) {
+        GTEST_SKIP() << "no descriptor past FD_SETSIZE under this limit";
+    }
+    EXPECT_EQ(kStatusSystemError, by_select(high, false, nullptr).status);
+    CountingChannel channel(64);
+    ASSERT_EQ(0, channel.Open(high, true));
+    std::thread peer([&] { WriteAll(pair.b, std::string("\0\0\0\x2a", 4)); });
+    unsigned int value = 0;
+    EXPECT_EQ(0, channel.ReadInt32(&value));
+    EXPECT_EQ(42u, value);
+    EXPECT_EQ(0, channel.WriteInt32(7));
+    channel.Close();  // flushes
+    EXPECT_EQ(std::string("\0\0\0\7", 4), ReadExactly(pair.b, 4));
+    peer.join();
+}
+
 }  // namespace
