@@ -103,17 +103,55 @@ struct FlatMap {
 };
 
 // Byte order of keys: what std::string's comparison gives (unsigned bytes, a prefix first).
+// Compared a word at a time, most significant byte first; the last word is read where the
+// common part ends (overlapping bytes already found equal), so no byte loop runs above 3 bytes.
 inline int CompareKeys(const char* a, size_t a_size, const char* b, size_t b_size) {
-    size_t common = a_size < b_size ? a_size : b_size;
-    if (common <= 16) {
-        // Most keys are short: a byte loop costs less than the call.
+    const size_t common = a_size < b_size ? a_size : b_size;
+    auto order64 = [](const char* x, const char* y) {
+        uint64_t u;
+        uint64_t v;
+        std::memcpy(&u, x, sizeof(u));
+        std::memcpy(&v, y, sizeof(v));
+        if (u == v) {
+            return 0;
+        }
+        return __builtin_bswap64(u) < __builtin_bswap64(v) ? -1 : 1;
+    };
+    auto order32 = [](const char* x, const char* y) {
+        uint32_t u;
+        uint32_t v;
+        std::memcpy(&u, x, sizeof(u));
+        std::memcpy(&v, y, sizeof(v));
+        if (u == v) {
+            return 0;
+        }
+        return __builtin_bswap32(u) < __builtin_bswap32(v) ? -1 : 1;
+    };
+    if (common >= 8) {
+        size_t i = 0;
+        for (; i + 8 <= common; i += 8) {
+            if (int order = order64(a + i, b + i); order != 0) {
+                return order;
+            }
+        }
+        if (i < common) {
+            if (int order = order64(a + common - 8, b + common - 8); order != 0) {
+                return order;
+            }
+        }
+    } else if (common >= 4) {
+        if (int order = order32(a, b); order != 0) {
+            return order;
+        }
+        if (int order = order32(a + common - 4, b + common - 4); order != 0) {
+            return order;
+        }
+    } else {
         for (size_t i = 0; i < common; ++i) {
             if (a[i] != b[i]) {
                 return static_cast<unsigned char>(a[i]) < static_cast<unsigned char>(b[i]) ? -1 : 1;
             }
         }
-    } else if (int order = std::memcmp(a, b, common); order != 0) {
-        return order;
     }
     return a_size < b_size ? -1 : (a_size > b_size ? 1 : 0);
 }
@@ -159,6 +197,11 @@ struct PObjectAccess {
         text->data()[size] = '\0';
         return text;
     }
+    // Makes the null object `o` the string `data`.
+    static void SetText(PObject& o, Arena* arena, const char* data, size_t size) {
+        o.payload_ = NewText(arena, data, size);
+        o.type_ = PObject::kString;
+    }
     // Makes `o` the string `data`: the block is built before the old content goes.
     static void AssignText(PObject& o, Arena* arena, const char* data, size_t size) {
         TextBlock* text = NewText(arena, data, size);  // `data` may live inside `o`
@@ -177,6 +220,13 @@ struct PObjectAccess {
             new (&entries[i]) FlatEntry{PObject(), 0, 0};
         }
         return flat;
+    }
+    // The block of NewFlat with its entries left unbuilt: the caller constructs every one of
+    // them, in order, before anything else sees the map.
+    static FlatMap* NewFlatUnfilled(Arena* arena, uint32_t count, uint32_t key_bytes) {
+        const size_t bytes = sizeof(FlatMap) + count * sizeof(FlatEntry) + key_bytes;
+        void* raw = arena != nullptr ? arena->Allocate(bytes) : ::operator new(bytes);
+        return new (raw) FlatMap{arena, count, key_bytes, 0};
     }
     // Makes `o` the map `flat` (null: the empty map), dropping what it held.
     static void AssignFlat(PObject& o, FlatMap* flat) {

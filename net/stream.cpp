@@ -9,6 +9,10 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#if defined(__SSE2__)
+#include <emmintrin.h>
+#endif
+
 #include <algorithm>
 #include <cctype>
 #include <climits>
@@ -46,7 +50,7 @@ const char* const kIndent[] = {
 constexpr int kMaxIndent = 11;
 
 // The byte count of the smallest of 1, 2, 4, 8 that holds the value.
-unsigned char IntegerLength(unsigned long long value) {
+inline unsigned char IntegerLength(unsigned long long value) {
     if ((value >> 8) == 0) {
         return 1;
     }
@@ -151,8 +155,18 @@ constexpr size_t kKeptFrames = 256;
         const unsigned char length = IntegerLength(number);
         at[0] = static_cast<char>(PStream::kTagInteger);
         at[1] = static_cast<char>(length);
-        for (unsigned char i = 0; i < length; ++i) {
-            at[2 + i] = static_cast<char>(number >> (8 * (length - 1 - i)));
+        // Most significant byte first, stored as one word.
+        if (length == 1) {
+            at[2] = static_cast<char>(number);
+        } else if (length == 2) {
+            const uint16_t word = htobe16(static_cast<uint16_t>(number));
+            std::memcpy(at + 2, &word, sizeof(word));
+        } else if (length == 4) {
+            const uint32_t word = htobe32(static_cast<uint32_t>(number));
+            std::memcpy(at + 2, &word, sizeof(word));
+        } else {
+            const uint64_t word = htobe64(number);
+            std::memcpy(at + 2, &word, sizeof(word));
         }
     }
 }
@@ -236,11 +250,12 @@ bool PutLeafContainer(const PObject& value, char*& at, char* limit) {
     return static_cast<size_t>(end - value) >= wire ? wire : 0;
 }
 
-inline size_t TextLength(const char* text, size_t wire_length);
+inline size_t TextLength(const char* text, size_t wire_length, const char* readable_end);
 
 // Stores the primitive value at `value` (PrimitiveWire gave `wire`) into `target`, which is null.
+// `end`: the end of the readable bytes around it (the buffered span).
 [[gnu::always_inline]] inline void StorePrimitive(const char* value, size_t wire, PObject& target,
-                                                  Arena* arena) {
+                                                  Arena* arena, const char* end) {
     const unsigned char tag = static_cast<unsigned char>(value[0]);
     if (tag == PStream::kTagInteger) {
         // The writer's lengths are 1, 2, 4 and 8 bytes, most significant first.
@@ -265,13 +280,40 @@ inline size_t TextLength(const char* text, size_t wire_length);
         }
         PObjectAccess::SetInteger(target, number);
     } else if (tag == PStream::kTagString) {
-        PObjectAccess::AssignText(target, arena, value + 3, TextLength(value + 3, wire - 3));
+        PObjectAccess::SetText(target, arena, value + 3, TextLength(value + 3, wire - 3, end));
     }
 }
 
 // The length of a received string as it is kept: up to its first NUL. Short ones are looked at
-// here rather than through a call.
-inline size_t TextLength(const char* text, size_t wire_length) {
+// here rather than through a call; the bytes up to `readable_end` may be read past the text (they
+// are buffered bytes of the same ring), which lets one or two vector compares settle most texts.
+inline size_t TextLength(const char* text, size_t wire_length, const char* readable_end) {
+#if defined(__SSE2__)
+    const size_t readable = static_cast<size_t>(readable_end - text);
+    if (wire_length <= 32 && readable >= 32) {
+        const __m128i zero = _mm_setzero_si128();
+        const __m128i low = _mm_loadu_si128(reinterpret_cast<const __m128i*>(text));
+        const __m128i high = _mm_loadu_si128(reinterpret_cast<const __m128i*>(text + 16));
+        // Bit i: byte i is NUL; the bit at wire_length stands for the end of the text.
+        const uint64_t zeros =
+            static_cast<uint64_t>(
+                static_cast<uint32_t>(_mm_movemask_epi8(_mm_cmpeq_epi8(low, zero)))) |
+            (static_cast<uint64_t>(
+                 static_cast<uint32_t>(_mm_movemask_epi8(_mm_cmpeq_epi8(high, zero))))
+             << 16) |
+            (uint64_t{1} << wire_length);
+        return static_cast<size_t>(__builtin_ctzll(zeros));
+    }
+    if (wire_length <= 16 && readable >= 16) {
+        const __m128i bytes = _mm_loadu_si128(reinterpret_cast<const __m128i*>(text));
+        const uint32_t zeros =
+            static_cast<uint32_t>(_mm_movemask_epi8(_mm_cmpeq_epi8(bytes, _mm_setzero_si128()))) |
+            (uint32_t{1} << wire_length);
+        return static_cast<size_t>(__builtin_ctz(zeros));
+    }
+#else
+    (void)readable_end;
+#endif
     if (wire_length > 64) {
         return strnlen(text, wire_length);
     }
@@ -1406,7 +1448,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             Arena* const message = arena();
             for (const char* item = at; item < p;) {
                 const size_t wire = PrimitiveWire(item, end);
-                StorePrimitive(item, wire, items.emplace_back(), message);
+                StorePrimitive(item, wire, items.emplace_back(), message, end);
                 item += wire;
             }
         } else {
@@ -1462,7 +1504,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 return 0;
             }
             const char* key = p + 3;
-            const size_t key_size = TextLength(key, key_wire(p));
+            const size_t key_size = TextLength(key, key_wire(p), end);
             if (previous != nullptr && CompareKeys(previous, previous_size, key, key_size) >= 0) {
                 return 0;
             }
@@ -1496,7 +1538,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         FlatMap* flat = nullptr;
         if (count > 0) {
             Arena* const message = arena();
-            flat = PObjectAccess::NewFlat(message, count, static_cast<uint32_t>(key_bytes));
+            flat = PObjectAccess::NewFlatUnfilled(message, count, static_cast<uint32_t>(key_bytes));
             FlatEntry* out = flat->entries();
             uint32_t offset = 0;
             uint32_t blocks = 1;  // the map, and each of its strings
@@ -1504,12 +1546,11 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             p = at;
             for (uint32_t i = 0; i < count; ++i) {
                 const char* key = p + 3;
-                const uint32_t key_size = i < kSeen
-                                              ? seen[i].key_size
-                                              : static_cast<uint32_t>(TextLength(key, key_wire(p)));
+                const uint32_t key_size =
+                    i < kSeen ? seen[i].key_size
+                              : static_cast<uint32_t>(TextLength(key, key_wire(p), end));
                 CopyBytes(flat->keys() + offset, key, key_size);
-                out[i].key_offset = offset;
-                out[i].key_size = key_size;
+                new (&out[i]) FlatEntry{PObject(), offset, key_size};
                 offset += key_size;
                 const char* value = key + key_wire(p);
                 const size_t value_wire =
@@ -1517,7 +1558,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 if (i < kSeen && ((built.used >> i) & 1) != 0) {
                     PObjectAccess::Move(out[i].value, built.at(i));
                 } else {
-                    StorePrimitive(value, value_wire, out[i].value, message);
+                    StorePrimitive(value, value_wire, out[i].value, message, end);
                     blocks += out[i].value.isString() ? 1 : 0;
                 }
                 p = value + value_wire;
@@ -1571,7 +1612,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 break;  // not whole, a container, or something the general loop reports
             }
             const char* key = at + 3;
-            const size_t key_size = TextLength(key, key_wire);
+            const size_t key_size = TextLength(key, key_wire, end);
             if ((entries.size() != top.first &&
                  CompareKeys(keys.data() + entries.back().key_offset, entries.back().key_size, key,
                              key_size) >= 0) ||
@@ -1585,7 +1626,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             if (nested.isContainer()) {
                 PObjectAccess::Move(entry.value, nested);
             } else {
-                StorePrimitive(value, value_wire, entry.value, arena());
+                StorePrimitive(value, value_wire, entry.value, arena(), end);
             }
             received_ += wire;
             at += wire;
@@ -1640,7 +1681,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                     }
                     items.reserve(items.size() + count);
                 }
-                StorePrimitive(at, primitive, items.emplace_back(), arena());
+                StorePrimitive(at, primitive, items.emplace_back(), arena(), at + run);
                 channel.Consume(static_cast<unsigned int>(primitive));
                 received_ += primitive;
                 continue;
