@@ -96,9 +96,17 @@ size_t RoundUp8(size_t size) {
 class WorkList {
   public:
     // Moves `value` in; it is null afterwards.
+    WorkList() = default;
+    WorkList(const WorkList&) = delete;
+    WorkList& operator=(const WorkList&) = delete;
+    ~WorkList() {
+        while (count_ > 0) {
+            slot(--count_).~PObject();
+        }
+    }
     void Push(PObject& value) {
         if (count_ < kInPlace) {
-            in_place_[count_++].swap(value);
+            new (&in_place_[count_++]) PObject(std::move(value));
         } else {
             spilled_.emplace_back(std::move(value));
         }
@@ -113,13 +121,20 @@ class WorkList {
         if (count_ == 0) {
             return false;
         }
-        to.swap(in_place_[--count_]);
+        PObject& last = slot(--count_);
+        to.swap(last);
+        last.~PObject();  // null now
         return true;
     }
 
   private:
     static constexpr size_t kInPlace = 8;
-    PObject in_place_[kInPlace];
+    // Raw room: a slot holds a PObject only below count_ (nothing is built for an empty list).
+    PObject& slot(size_t i) { return *std::launder(reinterpret_cast<PObject*>(&in_place_[i])); }
+    struct alignas(PObject) Room {
+        unsigned char bytes[sizeof(PObject)];
+    };
+    Room in_place_[kInPlace];
     size_t count_ = 0;
     std::vector<PObject> spilled_;
 };
@@ -484,6 +499,24 @@ void PObject::clear() {
             if (child.type_ == kString) {
                 TextBlock* text = static_cast<TextBlock*>(child.payload_);
                 releaser.Free(text, text->arena);
+            } else if (child.type_ == kArray && child.payload_ != nullptr) {
+                // An array of leaves (a list of names, say) goes here and now.
+                Array* items = static_cast<Array*>(child.payload_);
+                for (const PObject& item : *items) {
+                    if (item.isContainer() && item.payload_ != nullptr) {
+                        pending.Push(child);
+                        return;
+                    }
+                }
+                for (PObject& item : *items) {
+                    if (item.type_ == kString) {
+                        TextBlock* text = static_cast<TextBlock*>(item.payload_);
+                        releaser.Free(text, text->arena);
+                    }
+                    item.type_ = kNull;
+                    item.payload_ = nullptr;
+                }
+                delete items;
             } else if (child.isContainer() && child.payload_ != nullptr) {
                 if (!PObjectAccess::IsFlat(child) || PObjectAccess::Flat(child).leaf_blocks == 0) {
                     pending.Push(child);

@@ -171,19 +171,45 @@ constexpr size_t kKeptFrames = 256;
     }
 }
 
+// Writes the primitive `value` at `at` when it fits before `limit` with `spare` bytes left over:
+// its wire size, or 0 (nothing written) for a container, a string longer than its 16-bit length
+// field, or too little room. One look at the type, where PrimitiveSize and PutPrimitive take two.
+[[gnu::always_inline]] inline size_t PutPrimitiveWithin(const PObject& value, char* at,
+                                                        const char* limit, size_t spare) {
+    const size_t room = static_cast<size_t>(limit - at);
+    size_t wire = 0;
+    if (value.isString()) {
+        const size_t size = PObjectAccess::Text(value).size;
+        wire = 3 + size;
+        if (size > 0xFFFF || room < wire + spare) {
+            return 0;
+        }
+    } else if (value.isInteger()) {
+        wire = 2 + IntegerLength(PObjectAccess::Number(value));
+        if (room < wire + spare) {
+            return 0;
+        }
+    } else if (value.isNull()) {
+        wire = 2;
+        if (room < wire + spare) {
+            return 0;
+        }
+    } else {
+        return 0;
+    }
+    PutPrimitive(value, at);
+    return wire;
+}
+
 // Writes the container `value` whole at `at` when it holds only primitives and fits before
 // `limit` (its keys and values are never on the key path: nothing can read it meanwhile), and
 // moves `at` past it; false, with nothing moved, otherwise.
 bool PutLeafContainer(const PObject& value, char*& at, char* limit) {
     char* out = at;
     auto put = [&](const PObject& item) __attribute__((always_inline)) {
-        const size_t wire = PrimitiveSize(item);
-        if (wire == 0 || static_cast<size_t>(limit - out) < wire + 1) {  // room for the end tag
-            return false;
-        }
-        PutPrimitive(item, out);
+        const size_t wire = PutPrimitiveWithin(item, out, limit, 1);  // room for the end tag
         out += wire;
-        return true;
+        return wire != 0;
     };
     auto put_entry = [&](const char* name, size_t size, const PObject& item)
         __attribute__((always_inline)) {
@@ -250,7 +276,8 @@ bool PutLeafContainer(const PObject& value, char*& at, char* limit) {
     return static_cast<size_t>(end - value) >= wire ? wire : 0;
 }
 
-inline size_t TextLength(const char* text, size_t wire_length, const char* readable_end);
+[[gnu::always_inline]] inline size_t TextLength(const char* text, size_t wire_length,
+                                                const char* readable_end);
 
 // Stores the primitive value at `value` (PrimitiveWire gave `wire`) into `target`, which is null.
 // `end`: the end of the readable bytes around it (the buffered span).
@@ -287,7 +314,8 @@ inline size_t TextLength(const char* text, size_t wire_length, const char* reada
 // The length of a received string as it is kept: up to its first NUL. Short ones are looked at
 // here rather than through a call; the bytes up to `readable_end` may be read past the text (they
 // are buffered bytes of the same ring), which lets one or two vector compares settle most texts.
-inline size_t TextLength(const char* text, size_t wire_length, const char* readable_end) {
+[[gnu::always_inline]] inline size_t TextLength(const char* text, size_t wire_length,
+                                                const char* readable_end) {
 #if defined(__SSE2__)
     const size_t readable = static_cast<size_t>(readable_end - text);
     if (wire_length <= 32 && readable >= 32) {
@@ -1053,8 +1081,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
                 entry_value = &top.next->second;
             }
             const PObject& current = *entry_value;
-            const size_t value_wire = PrimitiveSize(current);
-            if (length > 0xFFFF || static_cast<size_t>(limit - at) < 3 + length + value_wire) {
+            if (length > 0xFFFF || static_cast<size_t>(limit - at) < 3 + length) {
                 break;  // no room
             }
             char* const entry_start = at;
@@ -1063,8 +1090,8 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             at[2] = static_cast<char>(length);
             CopyBytes(at + 3, key, length);
             at += 3 + length;
-            if (value_wire != 0) {
-                PutPrimitive(current, at);
+            if (const size_t value_wire = PutPrimitiveWithin(current, at, limit, 0);
+                value_wire != 0) {
                 at += value_wire;
             } else if (!current.isContainer() || !PutLeafContainer(current, at, limit)) {
                 at = entry_start;
