@@ -36,8 +36,12 @@ class Daemon {
     void Start() {
         const std::string socket = host_.Root() + Control::kSocketPath;
         unlink(socket.c_str());
-        program_.reset(new s2s_test::Program(
-            {s2s_test::ToolPath("s2sd"), "--delay", "1", "--verbose"}, host_.Env()));
+        // Temporary files under the host's root: a killed daemon's leftovers go with the test.
+        s2s_test::EnvMap env = host_.Env();
+        env["TMPDIR"] = host_.Root() + "/tmp";
+        mkdir(env["TMPDIR"].c_str(), 0700);
+        program_.reset(
+            new s2s_test::Program({s2s_test::ToolPath("s2sd"), "--delay", "1", "--verbose"}, env));
         EXPECT_TRUE(WaitFor([&] { return access(socket.c_str(), F_OK) == 0; }));
     }
     ~Daemon() {
