@@ -173,7 +173,7 @@ struct LeftRun {
     pid_t pid;
     int pidfd;   // -1 without pidfds
     int output;  // the read end of its output pipe, drained so that the child never blocks on it
-    std::function<void()> after_exit;
+    std::function<void(int status)> after_exit;
 };
 
 // The runs this thread left; the thread waits for them before it ends, so the kernel never
@@ -194,7 +194,7 @@ class LeftRuns {
             int status = 0;
             Drain(runs_[i]);
             if (TryReap(runs_[i].pid, &status)) {
-                End(i);
+                End(i, status);
             } else {
                 ++i;
             }
@@ -213,11 +213,12 @@ class LeftRuns {
                 Drain(run);
                 AwaitExit(run.pidfd, 20);
             }
-            if (!reaped) {
+            const bool stopped = !reaped;
+            if (stopped) {
                 LineSplitter splitter(kNoSink);
                 StopGroup(run.pid, run.pidfd, run.output, &splitter, &reaped, &status);
             }
-            End(runs_.size() - 1);
+            End(runs_.size() - 1, stopped ? -1 : status);
         }
     }
 
@@ -226,8 +227,9 @@ class LeftRuns {
         LineSplitter splitter(kNoSink);
         DrainAvailable(run.output, &splitter);
     }
-    // The run has been reaped: whatever of its group is left goes, then its descriptors.
-    void End(size_t i) {
+    // The run has been reaped (`status`: its wait status, -1 when it was stopped): whatever of
+    // its group is left goes, then its descriptors.
+    void End(size_t i, int status) {
         LeftRun run = std::move(runs_[i]);
         runs_.erase(runs_.begin() + static_cast<std::ptrdiff_t>(i));
         if (GroupAlive(run.pid)) {
@@ -240,7 +242,7 @@ class LeftRuns {
             close(run.output);
         }
         if (run.after_exit) {
-            run.after_exit();
+            run.after_exit(status);
         }
     }
 

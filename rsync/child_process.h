@@ -32,10 +32,11 @@ struct ChildCommand {
     // When `ready` is set: a descriptor that turns readable whenever the child may have produced
     // all the caller needs (an inotify watch), and the test whether it has. Once the test says
     // yes, RunChild returns at once (exit_code 0, left_running) and the child ends in the
-    // background; `after_exit` is called once it has been reaped (only then).
+    // background; `after_exit` is called once it has been reaped (only then), with its wait
+    // status as waitpid gives it, or -1 when it outlasted rsync's own end and was stopped.
     int ready_fd = -1;
     std::function<bool()> ready;
-    std::function<void()> after_exit;
+    std::function<void(int status)> after_exit;
 };
 
 struct ChildOutcome {

@@ -7,6 +7,7 @@
 #include <sys/inotify.h>
 #include <sys/random.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -246,7 +247,26 @@ int RsyncWrapper::Impl::ExecuteCommand(const boost::function<bool()>& cancel) {
             complete = ReplyComplete(replyDir);
             return complete;
         };
-        job.after_exit = [path = dir.path()]() { reply::RemoveTree(path); };
+        // The reply was taken before rsync ended; a failed end afterwards is still told.
+        job.after_exit = [path = dir.path()](int status) {
+            reply::RemoveTree(path);
+            if (status == -1) {
+                Logger::LogMsg(Logger::Warning,
+                               "[WARNING] rsync_wrapper.cpp(%d): the command's rsync did not end "
+                               "after its reply and was stopped\n",
+                               __LINE__);
+            } else if (WIFEXITED(status) && WEXITSTATUS(status) != 0) {
+                Logger::LogMsg(Logger::Warning,
+                               "[WARNING] rsync_wrapper.cpp(%d): the command's rsync ended with "
+                               "code %d after its reply\n",
+                               __LINE__, WEXITSTATUS(status));
+            } else if (WIFSIGNALED(status)) {
+                Logger::LogMsg(Logger::Warning,
+                               "[WARNING] rsync_wrapper.cpp(%d): the command's rsync ended by "
+                               "signal %d after its reply\n",
+                               __LINE__, WTERMSIG(status));
+            }
+        };
     }
     int rc = Run(job, cancel, true);
     if (complete) {

@@ -197,6 +197,25 @@ TEST_F(StandIn, CancelEndsTheWholeGroup) {
     EXPECT_EQ(ProcessesMentioning(marker), 0) << "a process of the group survived";
 }
 
+// A command's rsync left to end after its reply was taken: a failed end is still logged.
+TEST_F(StandIn, ACommandRsyncFailingAfterItsReplyIsLogged) {
+    const std::string go = dir_ / "go";
+    auto w = Wrapper(
+        "for a; do reply=$a; done; echo 7 > \"${reply}t\"; mv \"${reply}t\" "
+        "\"${reply}result\"; while [ ! -e '" +
+        go + "' ]; do sleep 0.01; done; exit 23");
+    w->setVurnCustCmdRule({"command=\"S2S_GetProtocolVer\"", "clientID=\"abc\""});
+    LogCapture log(S2S::Logger::Warning);
+    {
+        S2S::rsync_internal::LeftRunsScope scope;
+        EXPECT_EQ(w->execute(kNoCancel), 7);  // the reply, while the stand-in still runs
+        WriteFile(go, "");
+    }
+    EXPECT_TRUE(log.Contains("rsync_wrapper.cpp(")) << log.Text();
+    EXPECT_TRUE(log.Contains("): the command's rsync ended with code 23 after its reply\n"))
+        << log.Text();
+}
+
 // A full debug log is moved aside before the next run; only the newest old logs are kept.
 TEST_F(StandIn, FullDebugLogIsRotated) {
     const std::string log = dir_ / "rsync.log";
