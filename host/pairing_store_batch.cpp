@@ -137,8 +137,9 @@ struct Request {
 };
 
 // The requests waiting in the queue, `own` first, the others in the order they were queued.
-// Requests of writers that have ended are removed unapplied: nobody waits for their answer. A
-// name that is not a request, or an entry that is not a regular file of ours, is left alone.
+// Requests of writers that have ended are removed unapplied: nobody waits for their answer; so
+// are their hidden, half-written ones. A name that is not a request, or an entry that is not a
+// regular file of ours, is left alone.
 std::vector<Request> WaitingRequests(const std::string& queue, const std::string& own) {
     std::vector<Request> requests(1);
     requests[0].path = own;
@@ -150,6 +151,15 @@ std::vector<Request> WaitingRequests(const std::string& queue, const std::string
         const std::string name = e->d_name;
         const std::string path = queue + "/" + name;
         struct stat st;
+        // A hidden request is still being written; one whose writer has ended (killed while
+        // writing it) will never be finished and goes.
+        if (name.size() > 1 && name[0] == '.' &&
+            name.find_first_not_of("0123456789-", 1) == name.npos &&
+            lstat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == geteuid() &&
+            !WriterAlive(name.substr(1))) {
+            unlink(path.c_str());
+            continue;
+        }
         if (name[0] == '.' || path == own || name.find_first_not_of("0123456789-") != name.npos ||
             lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
             continue;

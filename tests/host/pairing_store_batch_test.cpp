@@ -38,6 +38,7 @@ TEST(PairingStoreBatch, WritesWaitingUpdatesOfLiveWritersAndSkipsNoOps) {
     s2s_test::WriteFile(queue + "/" + std::to_string(getppid()) + "-1-2",
                         "[TASK_SN4/t]\n\tstatus=\"6\"\n");
     s2s_test::WriteFile(queue + "/notes.txt", "[pair]\n\tclientID=\"EVIL\"\n");
+    s2s_test::WriteFile(queue + "/." + RequestName(ended, 2), "[TASK_SN5/t]\n\tsta");  // killed
 
     ASSERT_EQ(S2S::PairingStore::RecordTaskStatus("SN1/t", "4"), 0);
     S2S::PairingStore::StoreContents store;
