@@ -14,6 +14,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <msgpack.hpp>
 #include <string>
 #include <thread>
@@ -115,7 +116,10 @@ std::string Encoded(const PObject& message) {
 // One wait of at most a second for `fd` to become readable, as the channel waits; true.
 bool WaitReadable(int fd) {
     pollfd entry{fd, POLLIN | POLLPRI, 0};
-    while (poll(&entry, 1, 1000) == 0) {
+    for (int ret; (ret = poll(&entry, 1, 1000)) <= 0;) {
+        if (ret < 0 && errno != EINTR) {
+            s2s_bench::Die("poll");
+        }
     }
     return true;
 }

@@ -232,12 +232,13 @@ class S2S_EXPORT Channel {
     // The wait the channel itself uses (reads, writes, connects, TLS handshakes and records):
     // WaitFd's statuses and messages, with `ready` and `exception` saying what the read (or,
     // with `for_write`, the write) set and the exception set would have held. It waits with
-    // poll rather than select, and differs from WaitFd in two ways: a descriptor at or above
+    // poll rather than select, and differs from WaitFd in these ways: a descriptor at or above
     // FD_SETSIZE, which select's sets cannot hold (WaitFd refuses it with -3), is waited on like
-    // any other, so a busy service with many descriptors keeps working; and a wait costs less
-    // (no sets copied in and out, no time written back). The interval is rounded up to whole
-    // milliseconds. A write wait on a socket that reports only a hang-up returns at once with
-    // neither flag set (select would sleep out the interval).
+    // any other, so a busy service with many descriptors keeps working; a wait costs less (no
+    // sets copied in and out, no time written back); the interval is rounded up to whole
+    // milliseconds (and at most about 24 days); and a write wait on a socket whose peer hung up
+    // returns at once as ready, so the send that follows reports the peer gone (-2) without
+    // first sleeping out the interval.
     static int PollFd(int fd, bool for_write, const timeval& wait, int* flag, bool& ready,
                       bool& exception);
 

@@ -15,6 +15,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <climits>
 #include <cstring>
 #include <ctime>
 #include <new>
@@ -697,16 +698,26 @@ int Channel::PollFd(int fd, bool for_write, const timeval& wait, int* flag, bool
                        __LINE__, std::strerror(EBADF), EBADF);
         return kStatusSystemError;
     }
-    // Whole milliseconds, rounded up so that a short interval still waits.
-    const long long wait_ms = static_cast<long long>(wait.tv_sec) * 1000 +
-                              (static_cast<long long>(wait.tv_usec) + 999) / 1000;
-    const int timeout_ms =
-        wait_ms < 0 ? 0 : static_cast<int>(std::min<long long>(wait_ms, 0x7FFFFFFF));
+    // A negative interval is refused as select refuses it.
+    if (wait.tv_sec < 0 || wait.tv_usec < 0) {
+        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
+                       __LINE__, std::strerror(EINVAL), EINVAL);
+        return kStatusSystemError;
+    }
+    // Whole milliseconds, rounded up so that a short interval still waits; a longer one than poll
+    // takes waits as long as poll can (about 24 days).
+    long long wait_ms = INT_MAX;
+    if (wait.tv_sec < INT_MAX / 1000) {
+        wait_ms = static_cast<long long>(wait.tv_sec) * 1000 + wait.tv_usec / 1000 +
+                  (wait.tv_usec % 1000 != 0 ? 1 : 0);
+    }
+    const int timeout_ms = static_cast<int>(std::min<long long>(wait_ms, INT_MAX));
     // What select would report: readable on data, hang-up or error; writable on room or error;
-    // an exception on urgent data.
+    // an exception on urgent data. A hang-up also ends a write wait: the send that follows then
+    // reports the peer gone (select would wait out the interval first).
     const short wanted = static_cast<short>((for_write ? POLLOUT : POLLIN) | POLLPRI);
-    const short ready_on =
-        static_cast<short>(for_write ? (POLLOUT | POLLERR) : (POLLIN | POLLHUP | POLLERR));
+    const short ready_on = static_cast<short>(for_write ? (POLLOUT | POLLERR | POLLHUP)
+                                                        : (POLLIN | POLLHUP | POLLERR));
     while (!AbortRequested(flag)) {
         pollfd entry{fd, wanted, 0};
         int ret = ::poll(&entry, 1, timeout_ms);

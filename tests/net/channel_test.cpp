@@ -7,6 +7,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
@@ -436,10 +437,36 @@ TEST(ChannelTest, ThePollWaitAgreesWithSelectAndServesDescriptorsBeyondItsSets) 
     s2s_test::CloseFd(urgent);
     s2s_test::CloseFd(urgent_peer);
 
-    // A descriptor past FD_SETSIZE: select cannot wait on it, the channel can.
+    // A negative interval is refused alike.
+    bool ready = false;
+    bool exception = false;
+    EXPECT_EQ(kStatusSystemError,
+              WaitingChannel::PollFd(quiet.a, false, timeval{-1, 0}, nullptr, ready, exception));
+    // A peer that hung up while our side is full: the write ends at once with the peer gone.
+    {
+        SocketPair full;
+        CountingChannel writer(4096);
+        ASSERT_EQ(0, writer.Open(full.ReleaseA(), true));
+        while (send(writer.GetFd(), "x", 1, MSG_DONTWAIT) == 1) {
+        }
+        shutdown(full.b, SHUT_RDWR);
+        EXPECT_EQ(kStatusIOError,
+                  Steps({writer.Write(std::string(100, 'y').data(), 100), writer.FlushWrite(0)}));
+    }
+
+    // A descriptor past FD_SETSIZE: select cannot wait on it, the channel can (under the usual
+    // soft limit of 1024 descriptors the limit is raised for this).
+    rlimit limit{};
+    getrlimit(RLIMIT_NOFILE, &limit);
+    const rlimit saved = limit;
+    if (limit.rlim_cur < FD_SETSIZE + 64 && limit.rlim_max >= FD_SETSIZE + 64) {
+        limit.rlim_cur = FD_SETSIZE + 64;
+        setrlimit(RLIMIT_NOFILE, &limit);
+    }
     SocketPair pair;
     const int high = fcntl(pair.a, F_DUPFD_CLOEXEC, FD_SETSIZE + 8);
     if (high < 0) {
+        setrlimit(RLIMIT_NOFILE, &saved);
         GTEST_SKIP() << "no descriptor past FD_SETSIZE under this limit";
     }
     EXPECT_EQ(kStatusSystemError, by_select(high, false, nullptr).status);
@@ -453,6 +480,7 @@ TEST(ChannelTest, ThePollWaitAgreesWithSelectAndServesDescriptorsBeyondItsSets) 
     channel.Close();  // flushes
     EXPECT_EQ(std::string("\0\0\0\7", 4), ReadExactly(pair.b, 4));
     peer.join();
+    setrlimit(RLIMIT_NOFILE, &saved);
 }
 
 }  // namespace
