@@ -102,48 +102,47 @@ struct FlatMap {
     const char* key(uint32_t i) const { return keys() + entries()[i].key_offset; }
 };
 
+inline uint32_t ByteSwap(uint32_t v) {
+    return __builtin_bswap32(v);
+}
+inline uint64_t ByteSwap(uint64_t v) {
+    return __builtin_bswap64(v);
+}
+// The order of the words of keys at `x` and `y`, read most significant byte first.
+template <typename Word>
+inline int KeyWordOrder(const char* x, const char* y) {
+    Word u;
+    Word v;
+    std::memcpy(&u, x, sizeof(u));
+    std::memcpy(&v, y, sizeof(v));
+    if (u == v) {
+        return 0;
+    }
+    return ByteSwap(u) < ByteSwap(v) ? -1 : 1;
+}
+
 // Byte order of keys: what std::string's comparison gives (unsigned bytes, a prefix first).
 // Compared a word at a time, most significant byte first; the last word is read where the
 // common part ends (overlapping bytes already found equal), so no byte loop runs above 3 bytes.
 inline int CompareKeys(const char* a, size_t a_size, const char* b, size_t b_size) {
     const size_t common = a_size < b_size ? a_size : b_size;
-    auto order64 = [](const char* x, const char* y) {
-        uint64_t u;
-        uint64_t v;
-        std::memcpy(&u, x, sizeof(u));
-        std::memcpy(&v, y, sizeof(v));
-        if (u == v) {
-            return 0;
-        }
-        return __builtin_bswap64(u) < __builtin_bswap64(v) ? -1 : 1;
-    };
-    auto order32 = [](const char* x, const char* y) {
-        uint32_t u;
-        uint32_t v;
-        std::memcpy(&u, x, sizeof(u));
-        std::memcpy(&v, y, sizeof(v));
-        if (u == v) {
-            return 0;
-        }
-        return __builtin_bswap32(u) < __builtin_bswap32(v) ? -1 : 1;
-    };
     if (common >= 8) {
         size_t i = 0;
         for (; i + 8 <= common; i += 8) {
-            if (int order = order64(a + i, b + i); order != 0) {
+            if (int order = KeyWordOrder<uint64_t>(a + i, b + i); order != 0) {
                 return order;
             }
         }
         if (i < common) {
-            if (int order = order64(a + common - 8, b + common - 8); order != 0) {
+            if (int order = KeyWordOrder<uint64_t>(a + common - 8, b + common - 8); order != 0) {
                 return order;
             }
         }
     } else if (common >= 4) {
-        if (int order = order32(a, b); order != 0) {
+        if (int order = KeyWordOrder<uint32_t>(a, b); order != 0) {
             return order;
         }
-        if (int order = order32(a + common - 4, b + common - 4); order != 0) {
+        if (int order = KeyWordOrder<uint32_t>(a + common - 4, b + common - 4); order != 0) {
             return order;
         }
     } else {

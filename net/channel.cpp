@@ -39,6 +39,23 @@ bool AbortRequested(const int* flag) {
     return flag != nullptr && __atomic_load_n(flag, __ATOMIC_RELAXED) != 0;
 }
 
+// A wait that failed with `err`: logged as a failed select, -3.
+int WaitFailure(int err) {
+    Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n", __LINE__,
+                   std::strerror(err), err);
+    return kStatusSystemError;
+}
+
+// The end of a wait call that reported nothing ready (`ret` <= 0): -9 after a quiet interval,
+// -3 on a failure, 0 when a signal interrupted it (the caller waits again).
+int NothingReady(int ret) {
+    if (ret == 0) {
+        S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): select: timeout\n", __LINE__);
+        return kStatusConnectionTimeout;
+    }
+    return errno == EINTR ? 0 : WaitFailure(errno);
+}
+
 }  // namespace
 
 Channel::Channel(unsigned int capacity)
@@ -652,10 +669,7 @@ int Channel::WaitFd(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_
                     const timeval& wait, int* flag) {
     // An fd_set holds descriptors below FD_SETSIZE only; anything else would write past it.
     if (fd < 0 || fd >= FD_SETSIZE) {
-        int err = fd < 0 ? EBADF : EINVAL;
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
-                       __LINE__, std::strerror(err), err);
-        return kStatusSystemError;
+        return WaitFailure(fd < 0 ? EBADF : EINVAL);
     }
     while (!AbortRequested(flag)) {
         timeval interval = wait;  // select may change its copy
@@ -675,15 +689,8 @@ int Channel::WaitFd(int fd, fd_set* read_set, fd_set* write_set, fd_set* except_
         if (ret > 0) {
             return kStatusSuccessful;
         }
-        if (ret == 0) {
-            S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): select: timeout\n", __LINE__);
-            return kStatusConnectionTimeout;
-        }
-        if (errno != EINTR) {
-            int err = errno;
-            Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
-                           __LINE__, std::strerror(err), err);
-            return kStatusSystemError;
+        if (int end = NothingReady(ret); end != 0) {
+            return end;
         }
     }
     return kStatusInterrupted;
@@ -694,15 +701,11 @@ int Channel::PollFd(int fd, bool for_write, const timeval& wait, int* flag, bool
     ready = false;
     exception = false;
     if (fd < 0) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
-                       __LINE__, std::strerror(EBADF), EBADF);
-        return kStatusSystemError;
+        return WaitFailure(EBADF);
     }
     // A negative interval is refused as select refuses it.
     if (wait.tv_sec < 0 || wait.tv_usec < 0) {
-        Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
-                       __LINE__, std::strerror(EINVAL), EINVAL);
-        return kStatusSystemError;
+        return WaitFailure(EINVAL);
     }
     // Whole milliseconds, rounded up so that a short interval still waits; a longer one than poll
     // takes waits as long as poll can (about 24 days).
@@ -723,23 +726,14 @@ int Channel::PollFd(int fd, bool for_write, const timeval& wait, int* flag, bool
         int ret = ::poll(&entry, 1, timeout_ms);
         if (ret > 0) {
             if ((entry.revents & POLLNVAL) != 0) {  // select fails with EBADF here
-                Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
-                               __LINE__, std::strerror(EBADF), EBADF);
-                return kStatusSystemError;
+                return WaitFailure(EBADF);
             }
             ready = (entry.revents & ready_on) != 0;
             exception = (entry.revents & POLLPRI) != 0;
             return kStatusSuccessful;
         }
-        if (ret == 0) {
-            S2S_LOG_DEBUG("[DEBUG] s2s_channel.cpp(%d): select: timeout\n", __LINE__);
-            return kStatusConnectionTimeout;
-        }
-        if (errno != EINTR) {
-            int err = errno;
-            Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): select: %s (%d)\n",
-                           __LINE__, std::strerror(err), err);
-            return kStatusSystemError;
+        if (int end = NothingReady(ret); end != 0) {
+            return end;
         }
     }
     return kStatusInterrupted;
