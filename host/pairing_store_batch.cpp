@@ -66,12 +66,16 @@ std::string QueueDir(const std::string& store) {
     return dir + "/." + store.substr(slash + 1) + ".queue";
 }
 
+// A start time that could not be read (the process table unreadable for a moment, say).
+constexpr unsigned long long kStartUnknown = ~0ULL;
+
 // When process `pid` started, in clock ticks since boot (field 22 of /proc/<pid>/stat): with the
-// pid it names one process even after the pid is used again. 0 when there is no such process.
+// pid it names one process even after the pid is used again. 0 when there is no such process,
+// kStartUnknown when that cannot be told.
 unsigned long long ProcessStart(pid_t pid) {
     std::FILE* f = std::fopen(("/proc/" + std::to_string(pid) + "/stat").c_str(), "re");
     if (f == nullptr) {
-        return 0;
+        return errno == ENOENT || errno == ESRCH ? 0 : kStartUnknown;
     }
     char buf[1024];
     const size_t n = std::fread(buf, 1, sizeof buf - 1, f);
@@ -81,21 +85,36 @@ unsigned long long ProcessStart(pid_t pid) {
     for (int field = 2; p != nullptr && field < 22; ++field) {
         p = std::strchr(p + 1, ' ');
     }
-    return p == nullptr ? 0 : std::strtoull(p + 1, nullptr, 10);
+    return p == nullptr ? kStartUnknown : std::strtoull(p + 1, nullptr, 10);
 }
 
-// True when `name` is a request "<pid>-<start>-<sequence>" of a process that still runs.
-bool WriterAlive(const std::string& name) {
+enum class Writer {
+    kNoRequest,  // the name is not "<pid>-<start>-<sequence>"
+    kAlive,      // its writer still runs
+    kEnded,      // its writer has ended: nobody waits for its answer
+    kUnknown,    // its writer's start could not be read: left for a later look
+};
+
+// The writer of the request named `name`.
+Writer WriterOf(const std::string& name) {
     const size_t first = name.find('-');
     const size_t second = first == std::string::npos ? first : name.find('-', first + 1);
     if (first == 0 || second == std::string::npos || second == first + 1 ||
         second + 1 == name.size() || name.find('-', second + 1) != std::string::npos ||
         name.find_first_not_of("0123456789-") != std::string::npos) {
-        return false;
+        return Writer::kNoRequest;
     }
     const long pid = std::strtol(name.c_str(), nullptr, 10);
-    const unsigned long long start = pid > 0 ? ProcessStart(static_cast<pid_t>(pid)) : 0;
-    return start != 0 && start == std::strtoull(name.c_str() + first + 1, nullptr, 10);
+    if (pid <= 0) {
+        return Writer::kNoRequest;
+    }
+    const unsigned long long start = ProcessStart(static_cast<pid_t>(pid));
+    if (start == kStartUnknown) {
+        return Writer::kUnknown;
+    }
+    return start != 0 && start == std::strtoull(name.c_str() + first + 1, nullptr, 10)
+               ? Writer::kAlive
+               : Writer::kEnded;
 }
 
 // True when `path` is a private directory of this process's user: a request there can only
@@ -138,8 +157,8 @@ struct Request {
 
 // The requests waiting in the queue, `own` first, the others in the order they were queued.
 // Requests of writers that have ended are removed unapplied: nobody waits for their answer; so
-// are their hidden, half-written ones. A name that is not a request, or an entry that is not a
-// regular file of ours, is left alone.
+// are their hidden, half-written ones. A name that is not a request, a writer that cannot be
+// told alive or ended, or an entry that is not a regular file of ours, is left alone.
 std::vector<Request> WaitingRequests(const std::string& queue, const std::string& own) {
     std::vector<Request> requests(1);
     requests[0].path = own;
@@ -153,22 +172,17 @@ std::vector<Request> WaitingRequests(const std::string& queue, const std::string
         struct stat st;
         // A hidden request is still being written; one whose writer has ended (killed while
         // writing it) will never be finished and goes.
-        if (name.size() > 1 && name[0] == '.' &&
-            name.find_first_not_of("0123456789-", 1) == name.npos &&
-            lstat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) && st.st_uid == geteuid() &&
-            !WriterAlive(name.substr(1))) {
+        const bool hidden = name[0] == '.';
+        if (path == own || lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) ||
+            st.st_uid != geteuid()) {
+            continue;
+        }
+        const Writer writer = WriterOf(hidden ? name.substr(1) : name);
+        if (writer == Writer::kEnded) {
             unlink(path.c_str());
-            continue;
+        } else if (writer == Writer::kAlive && !hidden) {
+            requests.push_back(Request{path, SectionDoc(), st.st_mtim});
         }
-        if (name[0] == '.' || path == own || name.find_first_not_of("0123456789-") != name.npos ||
-            lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
-            continue;
-        }
-        if (!WriterAlive(name)) {
-            unlink(path.c_str());
-            continue;
-        }
-        requests.push_back(Request{path, SectionDoc(), st.st_mtim});
     }
     closedir(d);
     std::sort(requests.begin() + 1, requests.end(), [](const Request& a, const Request& b) {
@@ -247,9 +261,14 @@ int ApplyUpdates(const std::vector<SectionUpdate>& updates) {
         return -1;
     }
     const std::string queue = QueueDir(store);
-    const std::string name = RequestName(getpid(), g_sequence++);
+    // A writer that cannot name itself (its start unreadable) would look ended to the others:
+    // it writes alone.
+    const unsigned long long start = ProcessStart(getpid());
+    const std::string name =
+        std::to_string(getpid()) + "-" + std::to_string(start) + "-" + std::to_string(g_sequence++);
     own.path = queue + "/" + name;
-    const bool queued = (mkdir(queue.c_str(), 0700) == 0 || errno == EEXIST) && PrivateDir(queue) &&
+    const bool queued = start != 0 && start != kStartUnknown &&
+                        (mkdir(queue.c_str(), 0700) == 0 || errno == EEXIST) && PrivateDir(queue) &&
                         PutRequest(queue, name, text);
 
     SemaphoreHold hold;

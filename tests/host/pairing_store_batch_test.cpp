@@ -5,6 +5,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <filesystem>
+#include <set>
 #include <string>
 
 #include "host/pairing_store.h"
@@ -39,6 +41,9 @@ TEST(PairingStoreBatch, WritesWaitingUpdatesOfLiveWritersAndSkipsNoOps) {
                         "[TASK_SN4/t]\n\tstatus=\"6\"\n");
     s2s_test::WriteFile(queue + "/notes.txt", "[pair]\n\tclientID=\"EVIL\"\n");
     s2s_test::WriteFile(queue + "/." + RequestName(ended, 2), "[TASK_SN5/t]\n\tsta");  // killed
+    for (const char* odd : {"123", ".1--2", ".-"}) {  // not request names: never touched
+        s2s_test::WriteFile(queue + "/" + odd, "[TASK_SN6/t]\n\tstatus=\"6\"\n");
+    }
 
     ASSERT_EQ(S2S::PairingStore::RecordTaskStatus("SN1/t", "4"), 0);
     S2S::PairingStore::StoreContents store;
@@ -49,8 +54,13 @@ TEST(PairingStoreBatch, WritesWaitingUpdatesOfLiveWritersAndSkipsNoOps) {
     ASSERT_NE(store.FindTask("SN1/t"), nullptr);
     EXPECT_EQ(store.FindTask("SN1/t")->status, "4") << "the holder's update was not applied last";
     EXPECT_EQ(store.pairedClientID, "") << "a file that is no request was applied";
-    EXPECT_EQ(system(("test \"$(ls -A " + queue + ")\" = notes.txt").c_str()), 0)
+    std::set<std::string> left;
+    for (const auto& entry : std::filesystem::directory_iterator(queue)) {
+        left.insert(entry.path().filename().string());
+    }
+    EXPECT_EQ(left, (std::set<std::string>{".-", ".1--2", "123", "notes.txt"}))
         << "requests left, or a file that is no request removed";
+    EXPECT_EQ(store.FindTask("SN6/t"), nullptr) << "a file that is no request was applied";
 
     const ino_t written = StoreInode();
     ASSERT_EQ(S2S::PairingStore::RecordTaskStatus("SN1/t", "4"), 0);
