@@ -237,8 +237,8 @@ class S2S_EXPORT Channel {
     // any other, so a busy service with many descriptors keeps working; a wait costs less (no
     // sets copied in and out, no time written back); the interval is rounded up to whole
     // milliseconds (and at most about 24 days); and a write wait on a socket whose peer hung up
-    // returns at once as ready, so the send that follows reports the peer gone (-2) without
-    // first sleeping out the interval.
+    // returns at once as ready, so the send that follows reports the peer gone (-2, with the
+    // SIGPIPE any send to a gone peer raises) without first sleeping out the interval.
     static int PollFd(int fd, bool for_write, const timeval& wait, int* flag, bool& ready,
                       bool& exception);
 
