@@ -743,6 +743,13 @@ void PStream::DumpHistory() {
 }
 
 void PStream::ClearHistory() {
+    // The usual end of a whole message leaves nothing to clear: then no edit is needed, as for
+    // ResetStatus.
+    if (history_.empty() && marks_.empty() && status_a_.load(std::memory_order_relaxed) == 0 &&
+        status_b_.load(std::memory_order_relaxed) == 0) {
+        depth_ = 0;
+        return;
+    }
     bool locked = BeginEdit();
     history_.clear();
     marks_.clear();
