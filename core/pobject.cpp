@@ -267,6 +267,22 @@ PObject::Map& PObjectAccess::Materialise(PObject& o) {
     return *static_cast<PObject::Map*>(o.payload_);
 }
 
+PObject::Array& PObjectAccess::MaterialiseArray(PObject& o) {
+    FlatArray& flat = FlatItems(o);
+    auto items = std::make_unique<PObject::Array>();
+    items->reserve(flat.count);
+    PObject* from = flat.items();
+    for (uint32_t i = 0; i < flat.count; ++i) {
+        items->push_back(std::move(from[i]));
+    }
+    for (uint32_t i = 0; i < flat.count; ++i) {
+        from[i].~PObject();  // moved out: nothing left to release
+    }
+    Releaser().Free(&flat, flat.arena);  // the block alone: its strings moved with the items
+    o.payload_ = items.release();
+    return *static_cast<PObject::Array*>(o.payload_);
+}
+
 PObject::PObject(unsigned long long value) {
     copy(value);
 }
@@ -340,7 +356,9 @@ bool PObject::isEmpty() const {
         case kString:
             return static_cast<const TextBlock*>(payload_)->size == 0;
         case kArray:
-            return payload_ == nullptr || static_cast<const Array*>(payload_)->empty();
+            // A flat array holds at least one item.
+            return payload_ == nullptr || (!PObjectAccess::IsFlatArray(*this) &&
+                                           static_cast<const Array*>(payload_)->empty());
         case kMap:
             // A flat map holds at least one entry.
             return payload_ == nullptr ||
@@ -376,6 +394,10 @@ std::string PObject::asString() const {
 
 const PObject::Array& PObject::asArray() const {
     if (type_ == kArray && payload_ != nullptr) {
+        if (PObjectAccess::IsFlatArray(*this)) {
+            // As for a flat map: the reference handed out must stay valid as a vector's would.
+            return PObjectAccess::MaterialiseArray(const_cast<PObject&>(*this));
+        }
         return *static_cast<const Array*>(payload_);
     }
     return GetEmptyArray();
@@ -400,6 +422,8 @@ PObject::Array& PObject::asArray() {
     }
     if (payload_ == nullptr) {
         payload_ = new Array();
+    } else if (PObjectAccess::IsFlatArray(*this)) {
+        return PObjectAccess::MaterialiseArray(*this);
     }
     return *static_cast<Array*>(payload_);
 }
@@ -486,9 +510,9 @@ void PObject::clear() {
     if (payload_ != nullptr && type_ != kInteger) {
         // A tree decoded from a peer may be nested a million levels deep: release it with an
         // explicit work list instead of recursion, so the depth never reaches the call stack.
-        // Only children that need a walk of their own go on the list: everything a received map
-        // of leaves holds is released with the map in one step (its blocks were counted when it
-        // was built), and strings go at once.
+        // Only children that need a walk of their own go on the list: a received map or array
+        // that lives wholly in its arena is released with everything in it in one step (its
+        // blocks were counted when it was built), and strings go at once.
         Releaser releaser;
         WorkList pending;
         // Releases `child` here when that needs no walk (adding its arena blocks to the
@@ -499,6 +523,9 @@ void PObject::clear() {
             if (child.type_ == kString) {
                 TextBlock* text = static_cast<TextBlock*>(child.payload_);
                 releaser.Free(text, text->arena);
+            } else if (PObjectAccess::IsFlatArray(child)) {
+                FlatArray& flat = PObjectAccess::FlatItems(child);
+                releaser.Free(&flat, flat.arena, flat.whole_blocks);
             } else if (child.type_ == kArray && child.payload_ != nullptr) {
                 // An array of leaves (a list of names, say) goes here and now.
                 Array* items = static_cast<Array*>(child.payload_);
@@ -518,12 +545,12 @@ void PObject::clear() {
                 }
                 delete items;
             } else if (child.isContainer() && child.payload_ != nullptr) {
-                if (!PObjectAccess::IsFlat(child) || PObjectAccess::Flat(child).leaf_blocks == 0) {
+                if (!PObjectAccess::IsFlat(child) || PObjectAccess::Flat(child).whole_blocks == 0) {
                     pending.Push(child);
                     return;
                 }
                 FlatMap& flat = PObjectAccess::Flat(child);
-                releaser.Free(&flat, flat.arena, flat.leaf_blocks);
+                releaser.Free(&flat, flat.arena, flat.whole_blocks);
             }
             // Everything else left is an integer, a null or an empty container.
             child.type_ = kNull;
@@ -539,7 +566,10 @@ void PObject::clear() {
                     break;
                 }
                 case kArray:
-                    if (current.payload_ != nullptr) {
+                    if (PObjectAccess::IsFlatArray(current)) {
+                        FlatArray& flat = PObjectAccess::FlatItems(current);
+                        releaser.Free(&flat, flat.arena, flat.whole_blocks);
+                    } else if (current.payload_ != nullptr) {
                         Array* items = static_cast<Array*>(current.payload_);
                         for (PObject& item : *items) {
                             release_child(item);
@@ -553,8 +583,8 @@ void PObject::clear() {
                     }
                     if (PObjectAccess::IsFlat(current)) {
                         FlatMap& flat = PObjectAccess::Flat(current);
-                        if (flat.leaf_blocks != 0) {
-                            releaser.Free(&flat, flat.arena, flat.leaf_blocks);
+                        if (flat.whole_blocks != 0) {
+                            releaser.Free(&flat, flat.arena, flat.whole_blocks);
                             break;
                         }
                         FlatEntry* entries = flat.entries();
@@ -650,15 +680,15 @@ void PObject::copy(const PObject& other) {
             }
             case kArray: {
                 to.type_ = kArray;
-                const Array& items = from.asArray();
-                if (items.empty()) {
+                const ItemView items = PObjectAccess::Items(from);  // either form, read in place
+                if (items.size == 0) {
                     break;
                 }
                 // Sized once, so the addresses on the work list stay valid.
                 Array& copies = to.asArray();
-                copies.resize(items.size());
-                for (size_t i = items.size(); i-- > 0;) {
-                    pending.emplace_back(&items[i], &copies[i]);
+                copies.resize(items.size);
+                for (size_t i = items.size; i-- > 0;) {
+                    pending.emplace_back(&items.data[i], &copies[i]);
                 }
                 break;
             }
@@ -745,9 +775,9 @@ void PObject::Print(std::string& out) const {
             case kArray: {
                 out += '[';
                 pending.push_back(Step{nullptr, "]", nullptr, 0});
-                const Array& items = value.asArray();
-                for (size_t i = items.size(); i-- > 0;) {
-                    pending.push_back(Step{&items[i], nullptr, nullptr, 0});
+                const ItemView items = PObjectAccess::Items(value);
+                for (size_t i = items.size; i-- > 0;) {
+                    pending.push_back(Step{&items.data[i], nullptr, nullptr, 0});
                     if (i > 0) {
                         pending.push_back(Step{nullptr, ", ", nullptr, 0});
                     }

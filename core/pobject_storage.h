@@ -8,6 +8,10 @@
 // reference into it (asMap(), either operator[], an integer index), and stays one. Lookups that
 // hand out nothing (hasMember, a missing key, printing, copying, sending, releasing) read the
 // flat form as it is.
+// An array is likewise the std::vector that asArray() hands out, or a FlatArray: the items of an
+// array of leaves (nulls, integers, strings of its arena) that the decoder found whole in its
+// buffer, in one block. It becomes a std::vector the first time a caller asks for a reference
+// into it (asArray(), an integer index).
 //
 // Blocks come from the heap or from an Arena: one per decoded message, filled by bumping a
 // pointer and freed in chunks once its last block is released. Every block names its arena
@@ -91,15 +95,36 @@ struct FlatMap {
     Arena* arena;
     uint32_t count;  // at least 1: an empty map has no payload
     uint32_t key_bytes;
-    // Non-zero for a map whose entries are all leaves (nulls, integers, strings of its arena):
-    // the number of arena blocks the map and its strings take, released together without a
-    // walk. A flat map is never changed in place, so the count stays true.
-    uint32_t leaf_blocks;
+    // Non-zero for a map that lives wholly in its arena: its entries are leaves (nulls,
+    // integers, strings of its arena) or flat maps and arrays that live wholly in the same
+    // arena. The number of arena blocks the map and everything in it take, released together
+    // without a walk. A flat map is never changed in place, and nothing in it can be reached for
+    // a change while it stays flat, so the count stays true; when it turns into a std::map, its
+    // own block goes and each entry keeps its own count.
+    uint32_t whole_blocks;
     FlatEntry* entries() { return reinterpret_cast<FlatEntry*>(this + 1); }
     const FlatEntry* entries() const { return reinterpret_cast<const FlatEntry*>(this + 1); }
     const char* keys() const { return reinterpret_cast<const char*>(entries() + count); }
     char* keys() { return reinterpret_cast<char*>(entries() + count); }
     const char* key(uint32_t i) const { return keys() + entries()[i].key_offset; }
+};
+
+struct FlatArray {
+    Arena* arena;
+    uint32_t count;  // at least 1: an empty array has no payload
+    // The number of arena blocks the array and its strings take, released together without a
+    // walk (every item is a leaf of the array's arena).
+    uint32_t whole_blocks;
+    PObject* items() { return reinterpret_cast<PObject*>(this + 1); }
+    const PObject* items() const { return reinterpret_cast<const PObject*>(this + 1); }
+};
+
+// The items of an array in either form, read in place.
+struct ItemView {
+    const PObject* data;
+    size_t size;
+    const PObject* begin() const { return data; }
+    const PObject* end() const { return data + size; }
 };
 
 inline uint32_t ByteSwap(uint32_t v) {
@@ -169,6 +194,26 @@ struct PObjectAccess {
         return *reinterpret_cast<FlatMap*>(reinterpret_cast<uintptr_t>(o.payload_) - 1);
     }
 
+    static bool IsFlatArray(const PObject& o) {
+        return o.type_ == PObject::kArray && (reinterpret_cast<uintptr_t>(o.payload_) & 1) != 0;
+    }
+    // REQUIRES: IsFlatArray(o).
+    static FlatArray& FlatItems(const PObject& o) {
+        return *reinterpret_cast<FlatArray*>(reinterpret_cast<uintptr_t>(o.payload_) - 1);
+    }
+    // REQUIRES: o.isArray().
+    static ItemView Items(const PObject& o) {
+        if (o.payload_ == nullptr) {
+            return ItemView{nullptr, 0};
+        }
+        if (IsFlatArray(o)) {
+            const FlatArray& flat = FlatItems(o);
+            return ItemView{flat.items(), flat.count};
+        }
+        const PObject::Array& items = *static_cast<const PObject::Array*>(o.payload_);
+        return ItemView{items.data(), items.size()};
+    }
+
     // Moves `from` into the null object `to`; `from` is null afterwards.
     static void Move(PObject& to, PObject& from) {
         to.type_ = from.type_;
@@ -235,6 +280,20 @@ struct PObjectAccess {
     }
     // The flat map of `o` turned into its std::map.
     static PObject::Map& Materialise(PObject& o);
+
+    // A flat array of `count` (>= 1) unbuilt items from `arena`: the caller constructs every
+    // one of them, in order, before anything else sees the array.
+    static FlatArray* NewFlatArrayUnfilled(Arena* arena, uint32_t count) {
+        void* raw = arena->Allocate(sizeof(FlatArray) + count * sizeof(PObject));
+        return new (raw) FlatArray{arena, count, 0};
+    }
+    // Makes the null object `o` the array `flat`.
+    static void SetFlatArray(PObject& o, FlatArray* flat) {
+        o.type_ = PObject::kArray;
+        o.payload_ = reinterpret_cast<char*>(flat) + 1;
+    }
+    // The flat array of `o` turned into its std::vector.
+    static PObject::Array& MaterialiseArray(PObject& o);
 };
 
 }  // namespace S2S

@@ -14,6 +14,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <string>
+#include <vector>
 
 #include "s2s_channel.h"
 #include "s2s_logger.h"
@@ -164,6 +165,25 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
         S2S::PObject again;
         if (DecodeBytes(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size(), kWideRing,
                         again) != S2S::kStatusSuccessful) {
+            abort();
+        }
+        // A copy, and the value with every container turned into its std form, print the same.
+        S2S::PObject copy(object);
+        std::vector<const S2S::PObject*> pending{&object};
+        while (!pending.empty()) {
+            const S2S::PObject* value = pending.back();
+            pending.pop_back();
+            if (value->isArray()) {
+                for (const S2S::PObject& item : value->asArray()) {
+                    pending.push_back(&item);
+                }
+            } else if (value->isMap()) {
+                for (const auto& entry : value->asMap()) {
+                    pending.push_back(&entry.second);
+                }
+            }
+        }
+        if (copy.toString() != object.toString()) {
             abort();
         }
     }

@@ -122,8 +122,8 @@ class S2S_EXPORT PObject {
     // kNull exactly when the object is null; every operation that empties it resets both fields.
     int type_ = kNull;
     union {
-        // Owned: a TextBlock, an Array, a Map, or a FlatMap (its address + 1); null for an empty
-        // container.
+        // Owned: a TextBlock, an Array, a Map, or a FlatArray or FlatMap (its address + 1); null
+        // for an empty container.
         void* payload_ = nullptr;
         unsigned long long number_;  // an integer's value
     };

@@ -230,7 +230,7 @@ bool PutLeafContainer(const PObject& value, char*& at, char* limit) {
     }
     *out++ = static_cast<char>(value.isArray() ? PStream::kTagArray : PStream::kTagMap);
     if (value.isArray()) {
-        for (const PObject& item : value.asArray()) {
+        for (const PObject& item : PObjectAccess::Items(value)) {
             if (!put(item)) {
                 return false;
             }
@@ -1004,8 +1004,9 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
     // Containers are walked with an explicit stack, like the decoder, so that any tree the
     // decoder accepted can be sent on again whatever its depth.
     struct Walk {
-        const std::vector<PObject>* array;
-        size_t index;  // of the array, or of the flat map
+        const PObject* items;  // an array's items, in either of its forms (a map's walk has
+        size_t count;          // `map` or `flat` set instead)
+        size_t index;          // of the array, or of the flat map
         const std::map<std::string, PObject>* map;
         std::map<std::string, PObject>::const_iterator next;
         bool key_pushed;
@@ -1027,14 +1028,14 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             }
         }
     } span_end{*this, stack};
-    auto open_array = [&](const std::vector<PObject>& a) {
+    auto open_array = [&](ItemView a) {
         int ret = WriteByte(channel, kTagArray);
         if (ret < 0) {
             return ChannelFailure(ret);
         }
         S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s[\n", __LINE__, Indent());
         ++depth_;
-        stack.push_back(Walk{&a, 0, nullptr, {}, false, nullptr});
+        stack.push_back(Walk{a.data, a.size, 0, nullptr, {}, false, nullptr});
         return 0;
     };
     auto open_map = [&](const std::map<std::string, PObject>& m) {
@@ -1044,7 +1045,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         }
         S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s{\n", __LINE__, Indent());
         ++depth_;
-        stack.push_back(Walk{nullptr, 0, &m, m.begin(), false, nullptr});
+        stack.push_back(Walk{nullptr, 0, 0, &m, m.begin(), false, nullptr});
         return 0;
     };
     auto open_flat = [&](const FlatMap& flat) {
@@ -1054,7 +1055,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
         }
         S2S_LOG_DEBUG("[DEBUG] s2s_stream.cpp(%d): %s{\n", __LINE__, Indent());
         ++depth_;
-        stack.push_back(Walk{nullptr, 0, nullptr, {}, false, &flat});
+        stack.push_back(Walk{nullptr, 0, 0, nullptr, {}, false, &flat});
         return 0;
     };
 
@@ -1149,10 +1150,10 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
     auto elements_run = [&](size_t array_walk) {
         for (bool progress = false;; progress = true) {
             Walk& items = stack[array_walk];
-            if (items.index == items.array->size()) {
+            if (items.index == items.count) {
                 return progress;
             }
-            const PObject& element = (*items.array)[items.index];
+            const PObject& element = items.items[items.index];
             if (const size_t wire = PrimitiveSize(element); wire != 0) {
                 char* room = channel.WriteRoom(static_cast<unsigned int>(wire));
                 if (room == nullptr) {
@@ -1185,7 +1186,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             ++items.index;
             ++depth_;
             // The map's walk goes on the stack only if the map stays open.
-            Walk map{nullptr, 0, nullptr, {}, false, nullptr};
+            Walk map{nullptr, 0, 0, nullptr, {}, false, nullptr};
             if (PObjectAccess::IsFlat(element)) {
                 map.flat = &PObjectAccess::Flat(element);
             } else {
@@ -1210,7 +1211,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
 
     int ret = 0;
     if (array != nullptr) {
-        ret = open_array(*array);
+        ret = open_array(ItemView{array->data(), array->size()});
     } else if (map != nullptr) {
         ret = open_map(*map);
     }
@@ -1239,7 +1240,7 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
                                                      : open_map(current.asMap());
                 continue;
             } else if (current.isArray()) {
-                ret = open_array(current.asArray());
+                ret = open_array(PObjectAccess::Items(current));
                 continue;
             } else {
                 return kStatusInterrupted;  // unknown type code: nothing is written
@@ -1252,7 +1253,8 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             return kStatusSuccessful;
         }
         Walk& top = stack.back();
-        bool at_end = top.array != nullptr  ? top.index == top.array->size()
+        const bool is_array = top.map == nullptr && top.flat == nullptr;
+        bool at_end = is_array              ? top.index == top.count
                       : top.flat != nullptr ? top.index == top.flat->count
                                             : top.next == top.map->end();
         // The previous value went out whole: its key leaves the history, at once before the end
@@ -1262,7 +1264,6 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             top.key_pushed = false;
         }
         if (at_end) {
-            bool is_array = top.array != nullptr;
             ret = WriteByte(channel, kTagEnd);
             if (ret < 0) {
                 return ChannelFailure(ret);
@@ -1273,11 +1274,11 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
             stack.pop_back();
             continue;
         }
-        if (top.array != nullptr) {
+        if (is_array) {
             if (direct_ && !span_locked_ && elements_run(stack.size() - 1)) {
                 continue;  // a map may have been left open: the loop looks again
             }
-            value = &(*top.array)[top.index++];
+            value = &top.items[top.index++];
             continue;
         }
         if (direct_ && !span_locked_ && entry_run(top)) {
@@ -1403,7 +1404,7 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 out[i].key_offset = static_cast<uint32_t>(entry.key_offset - frame.key_start);
                 out[i].key_size = entry.key_size;
             }
-            flat->leaf_blocks = leaves ? blocks : 0;
+            flat->whole_blocks = leaves ? blocks : 0;
             std::memcpy(flat->keys(), keys.data() + frame.key_start, key_bytes);
             entries.resize(frame.first);
             keys.resize(frame.key_start);
@@ -1458,8 +1459,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     };
 
     // An array of primitives that lies whole in the ring from `at` (just past its tag) to its end
-    // tag before `end`, built at once into the null `target`: the wire bytes it took, end tag
-    // included, or 0 when the bytes are not such an array (then nothing is built).
+    // tag before `end`, built at once into the null `target` as one block of the message's arena
+    // (released in one step, like a map of leaves): the wire bytes it took, end tag included, or
+    // 0 when the bytes are not such an array (then nothing is built).
     auto leaf_array = [&](const char* at, const char* end, PObject& target) -> size_t {
         if (max_recv_depth_ != 0 && stack.size() >= max_recv_depth_) {
             return 0;
@@ -1477,14 +1479,19 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             return 0;
         }
         if (count > 0) {
-            std::vector<PObject>& items = target.asArray();
-            items.reserve(count);
             Arena* const message = arena();
-            for (const char* item = at; item < p;) {
+            FlatArray* flat =
+                PObjectAccess::NewFlatArrayUnfilled(message, static_cast<uint32_t>(count));
+            PObject* items = flat->items();
+            uint32_t blocks = 1;  // the array, and each of its strings
+            for (const char* item = at; item < p; ++items) {
                 const size_t wire = PrimitiveWire(item, end);
-                StorePrimitive(item, wire, items.emplace_back(), message, end);
+                StorePrimitive(item, wire, *new (items) PObject(), message, end);
+                blocks += items->isString() ? 1 : 0;
                 item += wire;
             }
+            flat->whole_blocks = blocks;
+            PObjectAccess::SetFlatArray(target, flat);
         } else {
             target.asArray();
         }
@@ -1492,75 +1499,79 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
     };
 
     // A map that lies whole in the ring from `at` (just past its tag) to its end tag before
-    // `end`, in ascending key order, built at once into its block (no scratch, no key path:
-    // nothing can read the path meanwhile): the wire bytes it took, end tag included, or 0 when
-    // the bytes are not such a map (then nothing is kept). Its values are primitives, and with
-    // `nested` also maps or arrays of primitives (a request as front ends send it), built while
-    // the map is scanned. What the scan learns of the first entries is kept for the build.
+    // `end`, in ascending key order, with at most kMostBuilt entries, built at once into its
+    // block (no scratch, no key path: nothing can read the path meanwhile): the wire bytes it
+    // took, end tag included, or 0 when the bytes are not such a map (then nothing is kept).
+    // Its values are primitives, and with `nested` also maps or arrays of primitives (a request
+    // as front ends send it). Each entry is built as it is read, in place on the stack, and the
+    // entries move into the map's block once its end tag gives their count.
     auto build_map = [&](auto& self, const char* at, const char* end, PObject& target,
                          bool nested) -> size_t {
         // Nested containers count one level more.
         if (max_recv_depth_ != 0 && stack.size() + (nested ? 1 : 0) >= max_recv_depth_) {
             return 0;
         }
-        auto key_wire = [](const char* key_tag) {
-            return static_cast<size_t>((static_cast<unsigned char>(key_tag[1]) << 8) |
-                                       static_cast<unsigned char>(key_tag[2]));
-        };
-        constexpr uint32_t kSeen = 64;
-        struct Seen {
-            uint32_t key_size;
-            uint32_t value_wire;
-        };
-        Seen seen[kSeen];
-        // The nested values built so far, in place; released on every way out unless moved.
+        constexpr uint32_t kMostBuilt = 64;  // a larger map takes the general loop
+        // The entries built so far; released on every way out unless moved.
         struct Built {
-            alignas(PObject) unsigned char bytes[kSeen][sizeof(PObject)];
-            uint64_t used = 0;  // bit i: bytes[i] holds a PObject
-            PObject& at(uint32_t i) { return *reinterpret_cast<PObject*>(bytes[i]); }
+            alignas(FlatEntry) unsigned char bytes[kMostBuilt][sizeof(FlatEntry)];
+            const char* keys[kMostBuilt];
+            uint32_t count = 0;
+            FlatEntry& at(uint32_t i) { return *reinterpret_cast<FlatEntry*>(bytes[i]); }
             ~Built() {
-                for (uint32_t i = 0; used != 0; ++i, used >>= 1) {
-                    if ((used & 1) != 0) {
-                        at(i).~PObject();
-                    }
+                while (count > 0) {
+                    at(--count).~FlatEntry();
                 }
             }
         } built;
-        static_assert(kSeen <= 64, "one bit per entry");
         const char* p = at;
-        uint32_t count = 0;
+        Arena* const message =
+            p < end && static_cast<unsigned char>(*p) != kTagEnd ? arena() : nullptr;
         size_t key_bytes = 0;
         const char* previous = nullptr;
         size_t previous_size = 0;
+        uint32_t blocks = 1;  // the map, and everything in it
         while (p < end && static_cast<unsigned char>(*p) != kTagEnd) {
             if (static_cast<unsigned char>(*p) != kTagString || end - p < 3 ||
-                static_cast<size_t>(end - p) - 3 < key_wire(p) + 1) {
+                built.count == kMostBuilt) {
+                return 0;
+            }
+            const size_t key_wire = (static_cast<size_t>(static_cast<unsigned char>(p[1])) << 8) |
+                                    static_cast<unsigned char>(p[2]);
+            if (static_cast<size_t>(end - p) - 3 < key_wire + 1) {
                 return 0;
             }
             const char* key = p + 3;
-            const size_t key_size = TextLength(key, key_wire(p), end);
+            const size_t key_size = TextLength(key, key_wire, end);
             if (previous != nullptr && CompareKeys(previous, previous_size, key, key_size) >= 0) {
                 return 0;
             }
-            const char* value = key + key_wire(p);
+            const char* value = key + key_wire;
             size_t value_wire = PrimitiveWire(value, end);
-            const unsigned char tag = static_cast<unsigned char>(*value);
-            if (value_wire == 0 && nested && count < kSeen &&
-                (tag == kTagMap || tag == kTagArray)) {
-                PObject& inner = *new (built.bytes[count]) PObject();
-                built.used |= uint64_t{1} << count;
-                value_wire = tag == kTagMap ? self(self, value + 1, end, inner, false)
-                                            : leaf_array(value + 1, end, inner);
-                value_wire += value_wire != 0 ? 1 : 0;  // the container's tag
+            FlatEntry& entry = *new (built.bytes[built.count])
+                                   FlatEntry{PObject(), 0, static_cast<uint32_t>(key_size)};
+            built.keys[built.count++] = key;
+            if (value_wire != 0) {
+                StorePrimitive(value, value_wire, entry.value, message, end);
+                blocks += entry.value.isString() ? 1 : 0;
+            } else {
+                const unsigned char tag = static_cast<unsigned char>(*value);
+                if (!nested || (tag != kTagMap && tag != kTagArray)) {
+                    return 0;
+                }
+                value_wire = tag == kTagMap ? self(self, value + 1, end, entry.value, false)
+                                            : leaf_array(value + 1, end, entry.value);
+                if (value_wire == 0) {
+                    return 0;
+                }
+                ++value_wire;  // the container's tag
+                // Built here, it lives wholly in the message's arena (an empty one takes none).
+                if (PObjectAccess::IsFlat(entry.value)) {
+                    blocks += PObjectAccess::Flat(entry.value).whole_blocks;
+                } else if (PObjectAccess::IsFlatArray(entry.value)) {
+                    blocks += PObjectAccess::FlatItems(entry.value).whole_blocks;
+                }
             }
-            if (value_wire == 0) {
-                return 0;
-            }
-            if (count < kSeen) {
-                seen[count] =
-                    Seen{static_cast<uint32_t>(key_size), static_cast<uint32_t>(value_wire)};
-            }
-            ++count;
             key_bytes += key_size;
             previous = key;
             previous_size = key_size;
@@ -1570,34 +1581,21 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             return 0;
         }
         FlatMap* flat = nullptr;
-        if (count > 0) {
-            Arena* const message = arena();
-            flat = PObjectAccess::NewFlatUnfilled(message, count, static_cast<uint32_t>(key_bytes));
+        if (built.count > 0) {
+            flat = PObjectAccess::NewFlatUnfilled(message, built.count,
+                                                  static_cast<uint32_t>(key_bytes));
             FlatEntry* out = flat->entries();
+            char* const keys = flat->keys();
             uint32_t offset = 0;
-            uint32_t blocks = 1;  // the map, and each of its strings
-            const bool leaves = built.used == 0;
-            p = at;
-            for (uint32_t i = 0; i < count; ++i) {
-                const char* key = p + 3;
-                const uint32_t key_size =
-                    i < kSeen ? seen[i].key_size
-                              : static_cast<uint32_t>(TextLength(key, key_wire(p), end));
-                CopyBytes(flat->keys() + offset, key, key_size);
-                new (&out[i]) FlatEntry{PObject(), offset, key_size};
-                offset += key_size;
-                const char* value = key + key_wire(p);
-                const size_t value_wire =
-                    i < kSeen ? seen[i].value_wire : PrimitiveWire(value, end);
-                if (i < kSeen && ((built.used >> i) & 1) != 0) {
-                    PObjectAccess::Move(out[i].value, built.at(i));
-                } else {
-                    StorePrimitive(value, value_wire, out[i].value, message, end);
-                    blocks += out[i].value.isString() ? 1 : 0;
-                }
-                p = value + value_wire;
+            for (uint32_t i = 0; i < built.count; ++i) {
+                FlatEntry& entry = built.at(i);
+                new (&out[i]) FlatEntry{PObject(), offset, entry.key_size};
+                PObjectAccess::Move(out[i].value, entry.value);
+                CopyBytes(keys + offset, built.keys[i], entry.key_size);
+                offset += entry.key_size;
             }
-            flat->leaf_blocks = leaves ? blocks : 0;
+            flat->whole_blocks = blocks;
+            built.count = 0;  // moved out: nothing left to release
         }
         PObjectAccess::AssignFlat(target, flat);
         return static_cast<size_t>(p + 1 - at);

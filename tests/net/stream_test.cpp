@@ -321,13 +321,14 @@ TEST(PStreamTest, MillionNestedArraysDecodeWithoutTheCallStack) {
     EXPECT_TRUE(partial.isArray());
 }
 
-// A received map is stored compactly until a reference into it is asked for; every access must
-// see the same map, before and after that change, and a part kept alone must outlive the rest.
-TEST(PStreamTest, ReceivedMapsBehaveAsMapsThroughEveryAccess) {
+// A received map or array is stored compactly until a reference into it is asked for; every access
+// must see the same value, before and after that change, and a part kept alone must outlive the
+// rest of its message.
+TEST(PStreamTest, ReceivedMapsAndArraysBehaveAsThemselvesThroughEveryAccess) {
     PObject sent;
     sent["a"] = 1ULL;
     sent["b"]["c"] = "a text longer than a short string";
-    sent["b"]["d"] = Array({PObject(1ULL), PObject()});
+    sent["b"]["d"] = Array({PObject(1ULL), PObject(), PObject("an item longer than a short one")});
     sent["z"] = "last";
     const std::string bytes = Encode(sent);
     PObject back;
@@ -350,13 +351,30 @@ TEST(PStreamTest, ReceivedMapsBehaveAsMapsThroughEveryAccess) {
     EXPECT_FALSE(read["b"].hasMember("new"));
     EXPECT_EQ(
         "{\"a\": 1, \"aa\": 2, \"b\": {\"c\": \"a text longer than a short string\", "
-        "\"d\": [1, null], \"new\": 5}, \"z\": \"last\"}",
+        "\"d\": [1, null, \"an item longer than a short one\"], \"new\": 5}, \"z\": \"last\"}",
         copy.toString());
+
+    // The array: read in place, then through a reference that stays valid as it changes.
+    PObject again;
+    ASSERT_EQ(0, Decode(bytes, again));
+    PObject list;
+    list.swap(again["b"]["d"]);
+    again.clear();
+    const PObject& items = list;
+    EXPECT_FALSE(items.isEmpty());
+    EXPECT_EQ("[1, null, \"an item longer than a short one\"]", items.toString());
+    PObject list_copy = list;
+    const PObject& third = items[2u];
+    list.asArray()[0] = 7ULL;
+    EXPECT_EQ("an item longer than a short one", third.asString());
+    EXPECT_EQ(7u, items[0u].asUInt64());
+    EXPECT_EQ(3u, list_copy.asArray().size());
 
     PObject part;
     part.swap(back["b"]);
     back.clear();
     EXPECT_EQ("a text longer than a short string", part["c"].asString());
+    EXPECT_EQ(1u, static_cast<const PObject&>(part)["d"][0u].asUInt64());
 
     // Keys out of order, or repeated, on the wire: the later value is received into the entry.
     PObject unordered;
