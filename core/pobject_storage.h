@@ -287,10 +287,10 @@ struct PObjectAccess {
         void* raw = arena->Allocate(sizeof(FlatArray) + count * sizeof(PObject));
         return new (raw) FlatArray{arena, count, 0};
     }
-    // Makes the null object `o` the array `flat`.
+    // Makes the null object `o` the array `flat` (null: the empty array, which holds nothing).
     static void SetFlatArray(PObject& o, FlatArray* flat) {
         o.type_ = PObject::kArray;
-        o.payload_ = reinterpret_cast<char*>(flat) + 1;
+        o.payload_ = flat == nullptr ? nullptr : reinterpret_cast<char*>(flat) + 1;
     }
     // The flat array of `o` turned into its std::vector.
     static PObject::Array& MaterialiseArray(PObject& o);

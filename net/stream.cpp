@@ -1478,10 +1478,10 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
         if (p >= end) {
             return 0;
         }
+        FlatArray* flat = nullptr;
         if (count > 0) {
             Arena* const message = arena();
-            FlatArray* flat =
-                PObjectAccess::NewFlatArrayUnfilled(message, static_cast<uint32_t>(count));
+            flat = PObjectAccess::NewFlatArrayUnfilled(message, static_cast<uint32_t>(count));
             PObject* items = flat->items();
             uint32_t blocks = 1;  // the array, and each of its strings
             for (const char* item = at; item < p; ++items) {
@@ -1491,10 +1491,8 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 item += wire;
             }
             flat->whole_blocks = blocks;
-            PObjectAccess::SetFlatArray(target, flat);
-        } else {
-            target.asArray();
         }
+        PObjectAccess::SetFlatArray(target, flat);  // an empty one has no payload at all
         return static_cast<size_t>(p + 1 - at);
     };
 

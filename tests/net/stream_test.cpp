@@ -370,6 +370,15 @@ TEST(PStreamTest, ReceivedMapsAndArraysBehaveAsThemselvesThroughEveryAccess) {
     EXPECT_EQ(7u, items[0u].asUInt64());
     EXPECT_EQ(3u, list_copy.asArray().size());
 
+    // A request of leaves and containers of leaves, empty ones too, is released in one step.
+    PObject request;
+    request["empty"].asArray();
+    request["none"].asMap();
+    request["names"] = Array({PObject("a"), PObject("b")});
+    PObject request_back;
+    ASSERT_EQ(0, Decode(Encode(request), request_back));
+    EXPECT_EQ(request.toString(), request_back.toString());
+
     PObject part;
     part.swap(back["b"]);
     back.clear();
