@@ -228,8 +228,8 @@ void Arena::Grow(size_t size) {
 }
 
 void Arena::Finish() {
-    live_.fetch_add(allocated_, std::memory_order_relaxed);
-    Release(kCreatorHold);
+    // The hold gives way to the blocks handed out, in one step.
+    Release(kCreatorHold - allocated_);
 }
 
 void Arena::Release(size_t blocks) {

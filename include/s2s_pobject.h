@@ -6,7 +6,9 @@
 // allocated payload. An array or map may have no payload yet: it is then empty, and gets one on
 // its first mutable use. A map received from a stream is held in a compact sorted form until a
 // reference into it is first asked for (asMap(), operator[], an integer index): then it becomes
-// the std::map those return, once, so references handed out stay valid as std::map's do. That
+// the std::map those return, once, so references handed out stay valid as std::map's do. A
+// received array of nulls, integers and strings is likewise held compactly until asArray() or an
+// integer index asks for a reference, and then becomes the std::vector they return. That
 // first access may change the storage of an object reached through a const reference: like every
 // other use, it belongs to the one thread using the object. The parts of a received message share
 // its allocation; a part kept after the rest is released keeps that allocation. Copying,
