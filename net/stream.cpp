@@ -1405,7 +1405,9 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
                 out[i].key_size = entry.key_size;
             }
             flat->whole_blocks = leaves ? blocks : 0;
-            std::memcpy(flat->keys(), keys.data() + frame.key_start, key_bytes);
+            if (key_bytes > 0) {  // with only empty keys the scratch may hold no bytes at all
+                std::memcpy(flat->keys(), keys.data() + frame.key_start, key_bytes);
+            }
             entries.resize(frame.first);
             keys.resize(frame.key_start);
         }

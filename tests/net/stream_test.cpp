@@ -146,6 +146,8 @@ TEST(PStreamTest, MalformedStreamsEndWithTheirStatusLogLineAndWhatArrived) {
         int status;
         const char *log, *received;
     } cases[] = {
+        // First: only empty keys, while the thread's key scratch holds nothing yet.
+        {Bytes({0x42, 0x10, 0x00, 0x00}), S2S::kStatusIOError, "", "{\"\": null}"},
         {Bytes({0x00, 0x05}), kProtocol, "): expect length 0, but we've got 5\n", "\"before\""},
         {Bytes({0x01, 0x09, 1, 2, 3, 4, 5, 6, 7, 8, 9}), kProtocol, "", "0"},
         {Bytes({0x01, 0x00}), 0, "", "0"},  // no value bytes: 0
