@@ -1585,13 +1585,13 @@ int PStream::Decode(Channel& channel, PObject* slot, bool have_tag, unsigned cha
             flat = PObjectAccess::NewFlatUnfilled(message, built.count,
                                                   static_cast<uint32_t>(key_bytes));
             FlatEntry* out = flat->entries();
-            char* const keys = flat->keys();
+            char* const key_area = flat->keys();
             uint32_t offset = 0;
             for (uint32_t i = 0; i < built.count; ++i) {
                 FlatEntry& entry = built.at(i);
                 new (&out[i]) FlatEntry{PObject(), offset, entry.key_size};
                 PObjectAccess::Move(out[i].value, entry.value);
-                CopyBytes(keys + offset, built.keys[i], entry.key_size);
+                CopyBytes(key_area + offset, built.keys[i], entry.key_size);
                 offset += entry.key_size;
             }
             flat->whole_blocks = blocks;
