@@ -1003,10 +1003,12 @@ int PStream::Encode(Channel& channel, const PObject* object, const std::vector<P
                     const std::map<std::string, PObject>* map) {
     // Containers are walked with an explicit stack, like the decoder, so that any tree the
     // decoder accepted can be sent on again whatever its depth.
+    // An array's walk has neither `map` nor `flat` set; it reads the items in either of the
+    // array's forms.
     struct Walk {
-        const PObject* items;  // an array's items, in either of its forms (a map's walk has
-        size_t count;          // `map` or `flat` set instead)
-        size_t index;          // of the array, or of the flat map
+        const PObject* items;
+        size_t count;
+        size_t index;  // of the array, or of the flat map
         const std::map<std::string, PObject>* map;
         std::map<std::string, PObject>::const_iterator next;
         bool key_pushed;
