@@ -247,6 +247,14 @@ class S2S_EXPORT Channel {
     static void PlainClose(int* handle);
     static bool PlainIsClosed(const int* handle);
 
+    // ReadFd with the first, non-blocking receive made optional (`try_first`); `found_nothing`
+    // is set to whether that receive found nothing queued, and left alone when it was not tried.
+    static int ReceiveFd(int fd, void* buf, unsigned int len, const timeval& wait, int* flag,
+                         bool try_first, bool& found_nothing);
+    // One receive of ReadMore on the plain operation set, trying first or waiting first as the
+    // connection has taught it (see misses_in_row_).
+    int ReceivePlain(char* at, unsigned int len);
+
     // The descriptor behind the handle (get-descriptor op); -1 when closed.
     int GetFd() const { return get_fd_op_(handle_); }
 
@@ -275,10 +283,16 @@ class S2S_EXPORT Channel {
     int* flag_ = nullptr;
     bool is_ssl_ = false;
     bool allow_untrust_ = true;
-    // The last receive on a plain channel took all the socket had (it returned less than the
-    // room offered): the next one waits for readability first instead of trying a receive that
-    // would most likely find nothing (the usual case of a request/reply exchange).
-    bool read_drained_ = false;
+    // How a plain channel receives, learnt from the connection itself. A receive tried before
+    // any wait finds the bytes at once when the peer is ahead (a stream, or a peer that answers
+    // before this side reads again) and is a wasted call when it is not (a request whose reply is
+    // still on its way). So after kMissesToWait tries in a row found nothing, the channel waits
+    // first; every kProbeEvery-th wait it tries again, and a try that finds bytes (or a receive
+    // that fills the room offered) sends it back to trying first.
+    static constexpr unsigned int kMissesToWait = 2;
+    static constexpr unsigned int kProbeEvery = 8;
+    unsigned int misses_in_row_ = 0;
+    unsigned int waits_since_probe_ = 0;
     std::string ssl_hostname_;
 };
 

@@ -56,6 +56,11 @@ int NothingReady(int ret) {
     return errno == EINTR ? 0 : WaitFailure(errno);
 }
 
+// The plain set's read operation, named so that ReadMore can tell when it is the one installed.
+int PlainReadOp(void* handle, void* buf, unsigned int len, const timeval& wait, int* flag) {
+    return Channel::ReadFd(static_cast<int*>(handle), buf, len, wait, flag);
+}
+
 }  // namespace
 
 Channel::Channel(unsigned int capacity)
@@ -494,21 +499,8 @@ int Channel::ReadMore(int want) {
             "[DEBUG] s2s_channel.cpp(%d): ReadMore: want = %d, total = %d, len = %d, "
             "r_head = %d, r_size = %d\n",
             __LINE__, want, static_cast<int>(got), len, r_head_, r_size_);
-        int n;
-        if (read_drained_ && !is_ssl_) {
-            // Wait first (see read_drained_); the receive that follows then finds the bytes.
-            bool ready = false;
-            bool exception = false;
-            n = PollFd(GetFd(), false, wait_, flag_, ready, exception);
-            if (n == kStatusSuccessful) {
-                n = read_op_(handle_, at, len, wait_, flag_);
-            }
-        } else {
-            n = read_op_(handle_, at, len, wait_, flag_);
-        }
-        if (n > 0) {
-            read_drained_ = static_cast<unsigned int>(n) < len;
-        }
+        int n = read_op_ == PlainReadOp ? ReceivePlain(at, len)
+                                        : read_op_(handle_, at, len, wait_, flag_);
         if (n == kStatusConnectionTimeout) {
             time_t now = std::time(nullptr);
             if (timeout_ != 0 && now - last >= static_cast<time_t>(timeout_)) {
@@ -643,9 +635,7 @@ int Channel::ConnectWithTimeout(int fd, const char* ip, int port) {
 void Channel::SwitchChannelOp(int mode) {
     // Each set is a row of trampolines from the opaque handle to the typed operation.
     if (mode == kPlainOps) {
-        read_op_ = [](void* h, void* buf, unsigned int len, const timeval& wait, int* flag) {
-            return ReadFd(static_cast<int*>(h), buf, len, wait, flag);
-        };
+        read_op_ = PlainReadOp;
         write_op_ = [](void* h, const void* buf, unsigned int len, const timeval& wait, int* flag) {
             return WriteFd(static_cast<int*>(h), buf, len, wait, flag);
         };
@@ -785,17 +775,38 @@ bool WouldBlock(ssize_t n) {
 }  // namespace
 
 int Channel::ReadFd(int* handle, void* buf, unsigned int len, const timeval& wait, int* flag) {
+    bool found_nothing = false;
+    return ReceiveFd(PlainGetFd(handle), buf, len, wait, flag, true, found_nothing);
+}
+
+int Channel::ReceivePlain(char* at, unsigned int len) {
+    const bool try_first =
+        misses_in_row_ < kMissesToWait || ++waits_since_probe_ % kProbeEvery == 0;
+    bool found_nothing = false;
+    const int n = ReceiveFd(GetFd(), at, len, wait_, flag_, try_first, found_nothing);
+    if (found_nothing) {
+        misses_in_row_ = std::min(misses_in_row_ + 1, kMissesToWait);
+    } else if (try_first || (n > 0 && static_cast<unsigned int>(n) == len)) {
+        // Bytes were there at once, or the socket had more than the room (the rest is likely
+        // there too).
+        misses_in_row_ = 0;
+    }
+    return n;
+}
+
+int Channel::ReceiveFd(int fd, void* buf, unsigned int len, const timeval& wait, int* flag,
+                       bool try_first, bool& found_nothing) {
     if (len == 0) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): ReadFd: request 0\n",
                        __LINE__);
         return kStatusInvalidArgument;
     }
-    int fd = PlainGetFd(handle);
     // Bytes already queued on the socket need no wait: one non-blocking try first (as WriteFd
-    // does) saves the select. A set abort flag still ends the call without reading.
-    if (fd >= 0 && !AbortRequested(flag)) {
+    // does) saves the wait. A set abort flag still ends the call without reading.
+    if (try_first && fd >= 0 && !AbortRequested(flag)) {
         ssize_t n = ::recv(fd, buf, len, MSG_DONTWAIT);
-        if (!WouldBlock(n)) {
+        found_nothing = WouldBlock(n);
+        if (!found_nothing) {
             return ReadResult(n);
         }
     }
