@@ -286,13 +286,16 @@ class S2S_EXPORT Channel {
     // How a plain channel receives, learnt from the connection itself. A receive tried before
     // any wait finds the bytes at once when the peer is ahead (a stream, or a peer that answers
     // before this side reads again) and is a wasted call when it is not (a request whose reply is
-    // still on its way). So after kMissesToWait tries in a row found nothing, the channel waits
-    // first; every kProbeEvery-th wait it tries again, and a try that finds bytes (or a receive
-    // that fills the room offered) sends it back to trying first.
+    // still on its way). So once kMissesToWait tries in a row have found nothing, the channel
+    // tries only on every try_every_-th receive and waits first on the others; each further try
+    // that finds nothing doubles the spacing (every receive, then every 2nd, 4th ... up to every
+    // kTryEveryMost-th). A try that finds bytes, or a receive that fills the room offered, sends
+    // it back to trying first.
     static constexpr unsigned int kMissesToWait = 2;
-    static constexpr unsigned int kProbeEvery = 8;
+    static constexpr unsigned int kTryEveryMost = 64;
     unsigned int misses_in_row_ = 0;
-    unsigned int waits_since_probe_ = 0;
+    unsigned int try_every_ = 1;
+    unsigned int waits_since_try_ = 0;
     std::string ssl_hostname_;
 };
 

@@ -780,12 +780,13 @@ int Channel::ReadFd(int* handle, void* buf, unsigned int len, const timeval& wai
 }
 
 int Channel::ReceivePlain(char* at, unsigned int len) {
-    const bool try_first =
-        misses_in_row_ < kMissesToWait || ++waits_since_probe_ % kProbeEvery == 0;
+    const bool try_first = misses_in_row_ < kMissesToWait || ++waits_since_try_ >= try_every_;
     bool found_nothing = false;
     const int n = ReceiveFd(GetFd(), at, len, wait_, flag_, try_first, found_nothing);
     if (found_nothing) {
+        try_every_ = misses_in_row_ < kMissesToWait ? 1 : std::min(try_every_ * 2, kTryEveryMost);
         misses_in_row_ = std::min(misses_in_row_ + 1, kMissesToWait);
+        waits_since_try_ = 0;
     } else if (try_first || (n > 0 && static_cast<unsigned int>(n) == len)) {
         // Bytes were there at once, or the socket had more than the room (the rest is likely
         // there too).
