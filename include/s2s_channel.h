@@ -247,10 +247,10 @@ class S2S_EXPORT Channel {
     static void PlainClose(int* handle);
     static bool PlainIsClosed(const int* handle);
 
-    // ReadFd with the first, non-blocking receive made optional (`try_first`); `found_nothing`
-    // is set to whether that receive found nothing queued, and left alone when it was not tried.
+    // ReadFd on a descriptor; `found_nothing` says whether its first, non-blocking receive found
+    // nothing queued (false when it was not tried: a set abort flag or no descriptor).
     static int ReceiveFd(int fd, void* buf, unsigned int len, const timeval& wait, int* flag,
-                         bool try_first, bool& found_nothing);
+                         bool& found_nothing);
     // One receive of ReadMore on the plain operation set, trying first or waiting first as the
     // connection has taught it (see misses_in_row_).
     int ReceivePlain(char* at, unsigned int len);
@@ -287,14 +287,13 @@ class S2S_EXPORT Channel {
     // any wait finds the bytes at once when the peer is ahead (a stream, or a peer that answers
     // before this side reads again) and is a wasted call when it is not (a request whose reply is
     // still on its way). So once kMissesToWait tries in a row have found nothing, the channel
-    // tries only on every try_every_-th receive and waits first on the others; each further try
-    // that finds nothing doubles the spacing (every receive, then every 2nd, 4th ... up to every
-    // kTryEveryMost-th). A try that finds bytes, or a receive that fills the room offered, sends
-    // it back to trying first.
-    static constexpr unsigned int kMissesToWait = 2;
+    // waits first, and tries again after 1, then 3, 7 ... waits (at most kTryEveryMost - 1) while
+    // the tries keep finding nothing. A try that finds bytes, or a receive that fills the room
+    // offered, sends it back to trying first; so does a new connection (ClearRead).
+    static constexpr unsigned int kMissesToWait = 3;
     static constexpr unsigned int kTryEveryMost = 64;
-    unsigned int misses_in_row_ = 0;
-    unsigned int try_every_ = 1;
+    unsigned int misses_in_row_ = 0;  // up to kMissesToWait
+    unsigned int try_every_ = 1;      // receives per try once waiting first
     unsigned int waits_since_try_ = 0;
     std::string ssl_hostname_;
 };

@@ -389,6 +389,7 @@ int Channel::Write(const char* src, unsigned int len) {
 void Channel::ClearRead() {
     r_head_ = 0;
     r_size_ = 0;
+    misses_in_row_ = 0;  // a new connection (or none): nothing learnt about its receives yet
 }
 
 void Channel::ClearWrite() {
@@ -776,27 +777,40 @@ bool WouldBlock(ssize_t n) {
 
 int Channel::ReadFd(int* handle, void* buf, unsigned int len, const timeval& wait, int* flag) {
     bool found_nothing = false;
-    return ReceiveFd(PlainGetFd(handle), buf, len, wait, flag, true, found_nothing);
+    return ReceiveFd(PlainGetFd(handle), buf, len, wait, flag, found_nothing);
 }
 
 int Channel::ReceivePlain(char* at, unsigned int len) {
-    const bool try_first = misses_in_row_ < kMissesToWait || ++waits_since_try_ >= try_every_;
+    const int fd = GetFd();
     bool found_nothing = false;
-    const int n = ReceiveFd(GetFd(), at, len, wait_, flag_, try_first, found_nothing);
-    if (found_nothing) {
-        try_every_ = misses_in_row_ < kMissesToWait ? 1 : std::min(try_every_ * 2, kTryEveryMost);
-        misses_in_row_ = std::min(misses_in_row_ + 1, kMissesToWait);
-        waits_since_try_ = 0;
-    } else if (try_first || (n > 0 && static_cast<unsigned int>(n) == len)) {
-        // Bytes were there at once, or the socket had more than the room (the rest is likely
-        // there too).
+    if (misses_in_row_ >= kMissesToWait && ++waits_since_try_ < try_every_) {
+        // Wait first, then receive as ReadFd does (it waits again after a wake-up without bytes),
+        // so that every outcome is the one a trying channel would have.
+        bool ready = false;
+        bool exception = false;
+        int n = PollFd(fd, false, wait_, flag_, ready, exception);
+        if (n == kStatusSuccessful) {
+            n = ReceiveFd(fd, at, len, wait_, flag_, found_nothing);
+            if (n > 0 && static_cast<unsigned int>(n) == len) {
+                misses_in_row_ = 0;  // more than the room was queued: the rest is likely there too
+            }
+        }
+        return n;
+    }
+    waits_since_try_ = 0;
+    const int n = ReceiveFd(fd, at, len, wait_, flag_, found_nothing);
+    if (!found_nothing) {
         misses_in_row_ = 0;
+    } else if (misses_in_row_ < kMissesToWait) {
+        try_every_ = ++misses_in_row_ == kMissesToWait ? 2 : 1;
+    } else {
+        try_every_ = std::min(try_every_ * 2, kTryEveryMost);
     }
     return n;
 }
 
 int Channel::ReceiveFd(int fd, void* buf, unsigned int len, const timeval& wait, int* flag,
-                       bool try_first, bool& found_nothing) {
+                       bool& found_nothing) {
     if (len == 0) {
         Logger::LogMsg(Logger::Warning, "[WARNING] s2s_channel.cpp(%d): ReadFd: request 0\n",
                        __LINE__);
@@ -804,7 +818,7 @@ int Channel::ReceiveFd(int fd, void* buf, unsigned int len, const timeval& wait,
     }
     // Bytes already queued on the socket need no wait: one non-blocking try first (as WriteFd
     // does) saves the wait. A set abort flag still ends the call without reading.
-    if (try_first && fd >= 0 && !AbortRequested(flag)) {
+    if (fd >= 0 && !AbortRequested(flag)) {
         ssize_t n = ::recv(fd, buf, len, MSG_DONTWAIT);
         found_nothing = WouldBlock(n);
         if (!found_nothing) {
