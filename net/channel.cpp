@@ -802,7 +802,8 @@ int Channel::ReceivePlain(char* at, unsigned int len) {
     if (!found_nothing) {
         misses_in_row_ = 0;
     } else if (misses_in_row_ < kMissesToWait) {
-        try_every_ = ++misses_in_row_ == kMissesToWait ? 2 : 1;
+        ++misses_in_row_;
+        try_every_ = 2;  // from the last of these misses on: wait once, then try
     } else {
         try_every_ = std::min(try_every_ * 2, kTryEveryMost);
     }
